@@ -1,0 +1,87 @@
+#include "tests/fakes/FakeLogSystem.h"
+
+namespace tavrin::testing {
+
+class FakeLogSystem::Scope final : public LogScope {
+ public:
+  Scope(FakeLogSystem& owner, std::string name) : owner_(owner), name_(std::move(name)) {}
+  bool ShouldLog(LogLevel level) const override {
+    return level != LogLevel::kDebug || owner_.Verbose();
+  }
+  void Write(LogLevel level, std::string_view line) override { owner_.Append(name_, level, line); }
+
+ private:
+  FakeLogSystem& owner_;
+  std::string name_;
+};
+
+FakeLogSystem::FakeLogSystem()
+    : defaultScope_(std::make_shared<Scope>(*this, "default")), previous_(InstallLogSystem(this)) {}
+
+FakeLogSystem::~FakeLogSystem() { InstallLogSystem(previous_); }
+
+LogHandle FakeLogSystem::RegisterLogScope(bool enabled, uint32_t code, std::string_view scopeName,
+                                          std::string_view subsystem,
+                                          std::string_view verbosityKey, int level) {
+  std::lock_guard lock(mutex_);
+  registrations_[std::string(scopeName)] =
+      Registration{enabled, code, std::string(subsystem), std::string(verbosityKey), level};
+  if (failRegistrations_) return nullptr;
+  return std::make_shared<Scope>(*this, std::string(scopeName));
+}
+
+LogScope& FakeLogSystem::DefaultLog() { return *defaultScope_; }
+
+void FakeLogSystem::FailRegistrations(bool fail) {
+  std::lock_guard lock(mutex_);
+  failRegistrations_ = fail;
+}
+
+void FakeLogSystem::SetVerbose(bool verbose) {
+  std::lock_guard lock(mutex_);
+  verbose_ = verbose;
+}
+
+bool FakeLogSystem::Verbose() const {
+  std::lock_guard lock(mutex_);
+  return verbose_;
+}
+
+void FakeLogSystem::Append(const std::string& scope, LogLevel level, std::string_view text) {
+  std::lock_guard lock(mutex_);
+  lines_.push_back(LoggedLine{scope, level, std::string(text)});
+}
+
+std::vector<LoggedLine> FakeLogSystem::Lines() const {
+  std::lock_guard lock(mutex_);
+  return lines_;
+}
+
+std::vector<LoggedLine> FakeLogSystem::Matching(std::string_view needle) const {
+  std::lock_guard lock(mutex_);
+  std::vector<LoggedLine> found;
+  for (const auto& line : lines_) {
+    if (line.text.find(needle) != std::string::npos) found.push_back(line);
+  }
+  return found;
+}
+
+size_t FakeLogSystem::Count(std::string_view needle) const { return Matching(needle).size(); }
+
+size_t FakeLogSystem::Count(std::string_view needle, LogLevel level) const {
+  size_t count = 0;
+  for (const auto& line : Matching(needle)) count += line.level == level ? 1 : 0;
+  return count;
+}
+
+void FakeLogSystem::Clear() {
+  std::lock_guard lock(mutex_);
+  lines_.clear();
+}
+
+std::map<std::string, FakeLogSystem::Registration> FakeLogSystem::Registrations() const {
+  std::lock_guard lock(mutex_);
+  return registrations_;
+}
+
+}  // namespace tavrin::testing

@@ -1,0 +1,67 @@
+#pragma once
+
+#include <map>
+#include <mutex>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "platform/SystemLog.h"
+
+namespace tavrin::testing {
+
+struct LoggedLine {
+  std::string scope;  // "default" for the default system log
+  LogLevel level;
+  std::string text;
+};
+
+// Records every line in memory. Installs itself as the process's log facility for its lifetime.
+// Scopes are verbose (debug lines pass) unless SetVerbose says otherwise.
+class FakeLogSystem final : public LogSystem {
+ public:
+  FakeLogSystem();
+  ~FakeLogSystem() override;
+
+  LogHandle RegisterLogScope(bool enabled, uint32_t code, std::string_view scopeName,
+                             std::string_view subsystem, std::string_view verbosityKey,
+                             int level) override;
+  LogScope& DefaultLog() override;
+
+  // Makes RegisterLogScope answer nullptr, as a failed registration does.
+  void FailRegistrations(bool fail);
+  void SetVerbose(bool verbose);
+
+  std::vector<LoggedLine> Lines() const;
+  // Lines whose text contains `needle` (and, when given, have `level`).
+  std::vector<LoggedLine> Matching(std::string_view needle) const;
+  size_t Count(std::string_view needle) const;
+  size_t Count(std::string_view needle, LogLevel level) const;
+  bool Contains(std::string_view needle) const { return Count(needle) > 0; }
+  void Clear();
+
+  // What RegisterLogScope was asked, by scope name.
+  struct Registration {
+    bool enabled;
+    uint32_t code;
+    std::string subsystem;
+    std::string verbosityKey;
+    int level;
+  };
+  std::map<std::string, Registration> Registrations() const;
+
+ private:
+  class Scope;
+  void Append(const std::string& scope, LogLevel level, std::string_view text);
+  bool Verbose() const;
+
+  mutable std::mutex mutex_;
+  std::vector<LoggedLine> lines_;
+  std::map<std::string, Registration> registrations_;
+  bool failRegistrations_ = false;
+  bool verbose_ = true;
+  std::shared_ptr<Scope> defaultScope_;
+  LogSystem* previous_ = nullptr;
+};
+
+}  // namespace tavrin::testing

@@ -1,0 +1,41 @@
+#pragma once
+
+#include <algorithm>
+#include <cstdint>
+#include <mutex>
+#include <vector>
+
+#include "platform/TracePoints.h"
+
+namespace tavrin::testing {
+
+// Sees every trace point fired while it lives.
+class RecordingTraceRecorder final : public TraceRecorder {
+ public:
+  RecordingTraceRecorder() : previous_(InstallTraceRecorder(this)) {}
+  ~RecordingTraceRecorder() override { InstallTraceRecorder(previous_); }
+
+  void Record(uint32_t code) override {
+    std::lock_guard lock(mutex_);
+    codes_.push_back(code);
+  }
+  std::vector<uint32_t> Codes() const {
+    std::lock_guard lock(mutex_);
+    return codes_;
+  }
+  size_t Count(uint32_t code) const {
+    std::lock_guard lock(mutex_);
+    return static_cast<size_t>(std::count(codes_.begin(), codes_.end(), code));
+  }
+  void Clear() {
+    std::lock_guard lock(mutex_);
+    codes_.clear();
+  }
+
+ private:
+  mutable std::mutex mutex_;
+  std::vector<uint32_t> codes_;
+  TraceRecorder* previous_;
+};
+
+}  // namespace tavrin::testing
