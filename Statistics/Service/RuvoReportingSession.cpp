@@ -1,0 +1,698 @@
+#include "Statistics/Service/RuvoReportingSession.h"
+
+#include <chrono>
+#include <cmath>
+#include <ctime>
+#include <utility>
+
+#include "Statistics/RuvoReportingUtility.h"
+#include "platform/DeviceInfoQuery.h"
+#include "platform/FileSystem.h"
+#include "platform/TracePoints.h"
+
+namespace tavrin {
+namespace {
+
+constexpr const char* kSummaryEventKey = "Ruvo_Session_Summary_Event";
+constexpr const char* kHostApplicationKey = "HostApplicationDisplayID";
+constexpr const char* kSummaryDirectory = "/Audio/Reporting";
+constexpr unsigned kSummaryDirectoryMode = 0777;
+// Indentation of the summary file: readable by a person, parsed by tools.
+constexpr int kSummaryJsonIndent = 2;
+constexpr const char* kOrientationIDFormat = "RuvoReportingService {}";
+// Devices of this class never track orientation.
+constexpr int32_t kNoOrientationDeviceClass = 6;
+constexpr uint32_t kPlatformCategoryMask = 0xFFFF;
+// The session ID of single messages, which belong to no session.
+constexpr int32_t kSingleMessageSessionID = -1;
+
+// "%@" of an absent name.
+constexpr const char* kAbsentText = "(null)";
+
+std::string NameText(const std::optional<std::string>& name) {
+  return name ? *name : std::string(kAbsentText);
+}
+
+// The payload with every " " in its keys replaced by "_". When two keys become equal, the later
+// one's value wins. `changed` tells whether any key had a blank.
+Dictionary CleanedPayload(const Dictionary& payload, bool* changed) {
+  *changed = false;
+  if (payload.is_null()) return MakeDictionary();
+  if (!payload.is_object()) {
+    TLOG_ERROR(RuvoReportingSession::SessionLog(), "payload is not a dictionary, sending {{}}: {}",
+               JsonText(payload));
+    *changed = true;
+    return MakeDictionary();
+  }
+  bool blanks = false;
+  for (const auto& item : payload.items()) {
+    if (item.key().find(' ') != std::string::npos) {
+      blanks = true;
+      break;
+    }
+  }
+  if (!blanks) return payload;
+  *changed = true;
+  Dictionary cleaned = MakeDictionary();
+  for (const auto& item : payload.items()) {
+    std::string key = item.key();
+    for (char& c : key) {
+      if (c == ' ') c = '_';
+    }
+    cleaned[key] = item.value();
+  }
+  return cleaned;
+}
+
+// Seconds as the dispatcher's delays take them.
+Duration Seconds(double seconds) {
+  return std::chrono::duration_cast<Duration>(std::chrono::duration<double>(seconds));
+}
+
+// "yyyyMMdd-HHmmssZ" in local time, e.g. "20261116-052745+0000".
+std::string SummaryFileTime(WallTime now) {
+  const std::time_t seconds = std::chrono::system_clock::to_time_t(now);
+  std::tm local{};
+  if (localtime_r(&seconds, &local) == nullptr) return "00000000-000000+0000";
+  char text[64];
+  const size_t length = std::strftime(text, sizeof(text), "%Y%m%d-%H%M%S%z", &local);
+  return std::string(text, length);
+}
+
+// A name part of a file name must not leave the directory.
+std::string FileNamePart(std::string text) {
+  for (char& c : text) {
+    if (c == '/' || c == '\0') c = '_';
+  }
+  return text;
+}
+
+}  // namespace
+
+Value NestedPayloadEntry::ToValue() const {
+  const Value& value = payload ? *payload : Value();
+  if (!messageId) return value;
+  Value entry = MakeDictionary();
+  entry[*messageId] = value;
+  return entry;
+}
+
+struct RuvoReportingSession::BackendWait {
+  std::mutex mutex;
+  bool found = false;    // the back-ends-found flag
+  bool waiting = false;  // telvoroQueue is suspended for this wait
+  bool ended = false;
+  // Kept alive while its queue waits, as a blocked queue item would keep it; released at the end.
+  std::shared_ptr<RuvoReportingSession> session;
+};
+
+const LogHandle& RuvoReportingSession::SessionLog() {
+  static const LogHandle handle = RegisterLogScope(
+      true, FourCharCode("rvrr"), "rvrr", "com.quorvex.tavrin", "reporting_session_verbose", 31);
+  return handle;
+}
+
+std::shared_ptr<RuvoReportingSession> RuvoReportingSession::create(
+    int64_t reporterID, std::vector<int32_t> processIdentifiers, PlatformServices& platform) {
+  SessionLog();
+  return std::shared_ptr<RuvoReportingSession>(
+      new RuvoReportingSession(reporterID, std::move(processIdentifiers), platform));
+}
+
+RuvoReportingSession::RuvoReportingSession(int64_t reporterID,
+                                           std::vector<int32_t> processIdentifiers,
+                                           PlatformServices& platform)
+    : platform_(platform),
+      reporterID_(reporterID),
+      telvoroQueue_(
+          platform.dispatcher->CreateSerialQueue(kTelvoroQueueLabel, QualityOfService::kUtility)),
+      serviceType_(service_type::kUnknown),
+      processIdentifiers_(std::move(processIdentifiers)),
+      userInfo_(MakeDictionary()),
+      serviceName_("unknown"),
+      aggregatedPayloadData_(std::make_shared<PayloadList>()),
+      nestedAggregatedPayloadData_(std::make_shared<NestedPayloadList>()),
+      messageTypeCounts_(MakeDictionary()) {
+  TLOG_INFO(SessionLog(), "created reporting session for ID: {}", reporterID_);
+  EmitTracePoint(trace::kSessionCreated);
+}
+
+RuvoReportingSession::~RuvoReportingSession() {
+  EmitTracePoint(trace::kSessionReleased);
+  TLOG_INFO(SessionLog(), "deallocing this session {}", reporterID_);
+}
+
+void RuvoReportingSession::setServiceType(uint16_t serviceType) {
+  serviceType_.store(serviceType, std::memory_order_release);
+  std::optional<std::string> name = ServiceTypeName(serviceType);
+  {
+    std::lock_guard lock(propertyMutex_);
+    serviceName_ = name;
+  }
+  TLOG_INFO(SessionLog(), "setting service type {}", NameText(name));
+}
+
+void RuvoReportingSession::setConfiguration(const Dictionary& configuration) {
+  if (configuration.is_null()) return;
+  if (!configuration.is_object()) {
+    TLOG_ERROR(SessionLog(), "configuration for {} is not a dictionary: {}", reporterID_,
+               JsonText(configuration));
+    return;
+  }
+  std::lock_guard lock(propertyMutex_);
+  for (const auto& item : configuration.items()) userInfo_[item.key()] = item.value();
+}
+
+void RuvoReportingSession::updateDefaults(const Dictionary& defaults) {
+  setConfiguration(defaults);
+}
+
+void RuvoReportingSession::start() {
+  TLOG_DEBUG(SessionLog(), "starting session owned by {}", reporterID_);
+  if (started()) {
+    TLOG_INFO(SessionLog(), "{} is already started", reporterID_);
+    return;
+  }
+  started_.store(true, std::memory_order_release);
+  {
+    std::lock_guard lock(propertyMutex_);
+    aggregatedPayloadData_ = std::make_shared<PayloadList>();
+    nestedAggregatedPayloadData_ = std::make_shared<NestedPayloadList>();
+  }
+  EmitTracePoint(trace::kSessionStarted);
+
+  if (shouldReportOrientation()) registerOrientationCallbacks();
+
+  // The user info is read when the queued step runs, so configuration given meanwhile counts.
+  std::optional<std::string> name = serviceName();
+  const uint16_t type = serviceType();
+  telvoroQueue_->Async([self = shared_from_this(), name = std::move(name), type] {
+    self->createTelvoroSessionOnQueue(name, type);
+  });
+}
+
+void RuvoReportingSession::createTelvoroSessionOnQueue(
+    const std::optional<std::string>& serviceName, uint16_t serviceType) {
+  // Test sessions never get a TelvoroSession.
+  if (this->serviceType() == service_type::kTest) return;
+
+  TelvoroService& telvoro = *platform_.telvoro;
+  TelvoroTokenPtr token = telvoro.NewSecureHierarchyToken(nullptr);
+  {
+    std::lock_guard lock(propertyMutex_);
+    telvoroAgentToken_ = token;
+  }
+
+  // Every service type but apiusage is batched; apiusage is real-time.
+  Dictionary sessionInfo = MakeDictionary();
+  sessionInfo[kTelvoroSessionInfoClientType] = kClientType;
+  sessionInfo[kTelvoroSessionInfoClientVersion] = kClientVersion;
+  sessionInfo[kTelvoroSessionInfoSessionID] = reporterID_;
+  sessionInfo[kTelvoroSessionInfoBatchEvent] = serviceType != service_type::kApiUsage;
+  sessionInfo[kTelvoroSessionInfoHierarchyToken] = token ? Value(token->value) : Value();
+  sessionInfo[kTelvoroSessionInfoContainsRealtimeEvents] = serviceType == service_type::kApiUsage;
+
+  Dictionary telvoroUserInfo = MakeDictionary();
+  telvoroUserInfo[kTelvoroUserInfoClientName] = kClientName;
+  if (serviceName) telvoroUserInfo[kTelvoroUserInfoServiceName] = *serviceName + "_session";
+  // The client's entries go on top, so a client may rename its service.
+  const Dictionary clientUserInfo = userInfo();
+  if (clientUserInfo.is_object() && !clientUserInfo.empty()) {
+    for (const auto& item : clientUserInfo.items()) telvoroUserInfo[item.key()] = item.value();
+  }
+
+  TelvoroSessionPtr session = telvoro.CreateTelvoroSession(sessionInfo, telvoroUserInfo, {});
+  setTelvoroSession(session);
+
+  // The wait for the back-ends holds no thread: the queue is suspended (later items wait behind
+  // this one, in order) until the answer or the time-out resumes it, whichever comes first.
+  auto wait = std::make_shared<BackendWait>();
+  wait->found = telvoroSessionStarted();
+  wait->session = shared_from_this();
+  if (session) {
+    session->StartConfiguration([wait](const BackendList& backends) {
+      if (!backends) {
+        // The wait runs into its time-out.
+        TLOG_ERROR(SessionLog(), "No backends found, this session won't get sent to the server");
+        return;
+      }
+      TLOG_DEFAULT(SessionLog(), "List of backends {}", JsonText(Value(*backends)));
+      EndBackendWait(wait, true);
+    });
+  }
+
+  std::lock_guard lock(wait->mutex);
+  if (wait->found) {
+    // Answered before the wait began: nothing to wait for.
+    wait->ended = true;
+    wait->session.reset();
+    return;
+  }
+  TLOG_DEFAULT(SessionLog(), "waiting for telvorod to find backends");
+  wait->waiting = true;
+  telvoroQueue_->Suspend();
+  platform_.dispatcher->BackgroundQueue().AsyncAfter(Seconds(kBackendWaitSeconds),
+                                                     [wait] { EndBackendWait(wait, false); });
+}
+
+bool RuvoReportingSession::EndBackendWait(const std::shared_ptr<BackendWait>& wait, bool found) {
+  std::shared_ptr<RuvoReportingSession> session;
+  {
+    std::lock_guard lock(wait->mutex);
+    if (wait->ended) return false;
+    if (found) wait->found = true;
+    // Not begun yet: the waiter sees the flag and does not wait at all.
+    if (!wait->waiting) return false;
+    wait->ended = true;
+    session = std::move(wait->session);
+    if (found) {
+      TLOG_DEFAULT(SessionLog(), "continuing");
+    } else {
+      TLOG_ERROR(SessionLog(), "failed to find backend");
+      // The queue is suspended, so nothing of this session runs on it while these change.
+      session->setTelvoroSession(nullptr);
+      session->telvoroSessionStarted_.store(false, std::memory_order_release);
+    }
+  }
+  session->telvoroQueue_->Resume();
+  return true;
+}
+
+void RuvoReportingSession::stop() {
+  TLOG_DEBUG(SessionLog(), "ending session {}", reporterID_);
+  if (shouldReportOrientation()) {
+    std::optional<std::string> id = orientationCallbackID();
+    if (id) {
+      platform_.orientation->UnregisterDeviceOrientation(*id);
+      platform_.orientation->UnregisterUIOrientation(*id);
+      std::lock_guard lock(propertyMutex_);
+      orientationCallbackID_.reset();
+    }
+  }
+  if (!started()) return;
+
+  TLOG_DEBUG(SessionLog(), "ending session {}", reporterID_);
+  EmitTracePoint(trace::kSessionStopped);
+
+  if (std::optional<Dictionary> summary = createSummaryEventForSession()) {
+    TLOG_DEFAULT(SessionLog(), "sending summary event for reporter {}", reporterID_);
+    sendMessage(*summary, kSummaryEventCategory, kSummaryEventType, true, nullptr);
+  }
+  writeSummaryJson();
+
+  // Behind every message already queued, so the flush covers them all.
+  telvoroQueue_->Async([self = shared_from_this()] {
+    if (self->serviceType() != service_type::kTest) {
+      if (TelvoroSessionPtr session = self->telvoroSession()) {
+        session->FlushMessages([](const OptionalError& error) {
+          if (error) TLOG_ERROR(SessionLog(), "flush error {}", error->LocalizedDescription());
+        });
+      }
+    }
+    self->setTelvoroSession(nullptr);
+  });
+
+  {
+    std::shared_ptr<PayloadList> list = aggregatedPayloadData();
+    std::unique_lock<std::recursive_mutex> listLock;
+    if (list) listLock = std::unique_lock(list->mutex);
+    std::lock_guard lock(propertyMutex_);
+    aggregatedPayloadData_.reset();
+  }
+  {
+    std::shared_ptr<NestedPayloadList> list = nestedAggregatedPayloadData();
+    std::unique_lock<std::recursive_mutex> listLock;
+    if (list) listLock = std::unique_lock(list->mutex);
+    std::lock_guard lock(propertyMutex_);
+    nestedAggregatedPayloadData_.reset();
+  }
+  started_.store(false, std::memory_order_release);
+}
+
+void RuvoReportingSession::sendMessage(const Dictionary& payload, uint32_t category, uint16_t type,
+                                       Reply reply) {
+  sendMessage(payload, category, type, false, std::move(reply));
+}
+
+void RuvoReportingSession::sendMessage(const Dictionary& payload, uint32_t category, uint16_t type,
+                                       bool sync, Reply reply) {
+  TLOG_DEBUG(SessionLog(), "sending message for session owned by {}", reporterID_);
+  bool changed = false;
+  auto cleaned = std::make_shared<const Dictionary>(CleanedPayload(payload, &changed));
+  // The message as received is kept apart only when cleaning changed it (for the log line).
+  PayloadPtr received = changed ? std::make_shared<const Dictionary>(payload) : cleaned;
+  std::string messageId = messageIdForCategory(category, type);
+  appendAggregated(cleaned);
+  appendNested(NestedPayloadEntry{std::move(messageId), cleaned});
+  EmitTracePoint(trace::kMessageSent);
+
+  // The state at send time decides the road, even if stop runs before delivery.
+  const bool startedAtSend = started();
+  telvoroQueue_->Async([self = shared_from_this(), cleaned = std::move(cleaned),
+                        received = std::move(received), category, type, startedAtSend] {
+    self->deliver(cleaned, received, category, type, startedAtSend);
+  });
+  if (reply) reply(std::nullopt);
+}
+
+void RuvoReportingSession::deliver(const PayloadPtr& cleaned, const PayloadPtr& received,
+                                   uint32_t category, uint16_t type, bool startedAtSend) {
+  if (!startedAtSend) {
+    TLOG_DEBUG(SessionLog(), "session not started, will send as a single message");
+    sendSingleMessage(*cleaned, category, type, serviceType(), userInfo(), nullptr);
+    return;
+  }
+  if (serviceType() == service_type::kTest) {
+    TLOG_INFO(SessionLog(), "transactions aren't allowed on this platform");
+    return;
+  }
+  TelvoroSessionPtr session = telvoroSession();
+  if (!session) {
+    const Error error{kGeneralErrorDomain, -1, "No valid TelvoroSession"};
+    TLOG_ERROR(SessionLog(), "{}", error.LocalizedDescription());
+    return;
+  }
+  // A refused message is dropped without a line: the platform's error says nothing the caller
+  // could act on, and the reply has long been given.
+  Error error;
+  if (session->SendSessionMessage(static_cast<uint16_t>(category & kPlatformCategoryMask), type,
+                                  *cleaned, &error)) {
+    TLOG_DEBUG(SessionLog(), "TelvoroAgent {} : message {} : category {} : type {}",
+               session->Description(), *received, static_cast<int32_t>(category), type);
+  }
+}
+
+std::string RuvoReportingSession::messageIdForCategory(uint32_t category, uint16_t type) {
+  std::string kind = fmt::format("{}_{}", CategoryName(category), TypeName(type));
+  int64_t count = 1;
+  {
+    std::lock_guard lock(countsMutex_);
+    Value& slot = messageTypeCounts_[kind];
+    if (slot.is_number_integer()) count = slot.get<int64_t>() + 1;
+    slot = count;
+  }
+  return fmt::format("{}_{}", kind, count);
+}
+
+void RuvoReportingSession::appendAggregated(PayloadPtr payload) {
+  // The property is read once for the lock and again for the append: a stop in between leaves
+  // none to append to.
+  std::shared_ptr<PayloadList> locked = aggregatedPayloadData();
+  std::unique_lock<std::recursive_mutex> lock;
+  if (locked) lock = std::unique_lock(locked->mutex);
+  if (std::shared_ptr<PayloadList> list = aggregatedPayloadData()) {
+    list->items.push_back(std::move(payload));
+  }
+}
+
+void RuvoReportingSession::appendNested(NestedPayloadEntry entry) {
+  std::shared_ptr<NestedPayloadList> locked = nestedAggregatedPayloadData();
+  std::unique_lock<std::recursive_mutex> lock;
+  if (locked) lock = std::unique_lock(locked->mutex);
+  if (std::shared_ptr<NestedPayloadList> list = nestedAggregatedPayloadData()) {
+    list->items.push_back(std::move(entry));
+  }
+}
+
+std::optional<Dictionary> RuvoReportingSession::createSummaryEventForSession() {
+  std::shared_ptr<PayloadList> list = aggregatedPayloadData();
+  if (!list) return std::nullopt;
+
+  // Key -> the text forms of its values in payload order; the service type comes first.
+  Dictionary collector = MakeDictionary();
+  collector[kSummaryEventKey] = Value::array({std::to_string(serviceType())});
+  {
+    std::lock_guard lock(list->mutex);
+    if (list->items.empty()) return std::nullopt;
+    for (const PayloadPtr& payload : list->items) {
+      if (!payload || !payload->is_object()) continue;
+      for (const auto& item : payload->items()) {
+        Value& values = collector[item.key()];
+        if (values.is_null()) values = Value::array();
+        values.push_back(ValueText(item.value()));
+      }
+    }
+  }
+
+  Dictionary summary = MakeDictionary();
+  for (const auto& item : collector.items()) {
+    std::string joined;
+    const Value& texts = item.value();
+    for (size_t i = 0; i < texts.size(); ++i) {
+      if (i > 0) joined += ',';
+      joined += texts[i].get_ref<const std::string&>();
+    }
+    summary[item.key()] = std::move(joined);
+  }
+  return summary;
+}
+
+void RuvoReportingSession::writeSummaryJson() {
+  if (!IsInternalBuild()) return;
+  std::shared_ptr<NestedPayloadList> list = nestedAggregatedPayloadData();
+  if (!list) return;
+  const Dictionary info = userInfo();
+  {
+    std::lock_guard lock(list->mutex);
+    if (list->items.empty()) return;
+    list->items.insert(list->items.begin(),
+                       NestedPayloadEntry{std::nullopt, std::make_shared<const Dictionary>(info)});
+  }
+
+  // One error slot for the three steps, never cleared between them: an earlier error is reported
+  // again by the last step.
+  OptionalError error;
+  std::optional<std::string> contents;
+  {
+    std::lock_guard lock(list->mutex);
+    Value array = Value::array();
+    for (const NestedPayloadEntry& entry : list->items) array.push_back(entry.ToValue());
+    try {
+      // Strict: invalid UTF-8 in a client's string is an error here, not silently replaced.
+      contents = array.dump(kSummaryJsonIndent, ' ', false, Value::error_handler_t::strict);
+    } catch (const Value::exception& e) {
+      error = Error{kGeneralErrorDomain, e.id, e.what()};
+      TLOG_ERROR(SessionLog(), "dataWithJSONObject: {}", error->LocalizedDescription());
+    }
+  }
+
+  const std::string directory = platform_.diagnosticDirectory + kSummaryDirectory;
+  if (OptionalError created =
+          platform_.fileSystem->CreateDirectories(directory, kSummaryDirectoryMode)) {
+    error = std::move(created);
+    TLOG_ERROR(SessionLog(), "can't create logging directory at {}: {}", directory,
+               error->LocalizedDescription());
+  }
+
+  const auto application = info.find(kHostApplicationKey);
+  const std::string applicationName =
+      application != info.end() ? ValueText(*application) : std::string("unknown");
+  const std::string fileName = fmt::format(
+      "{}-{}-{}-{}.json", SummaryFileTime(platform_.dispatcher->GetClock().WallNow()), "tavrin",
+      FileNamePart(applicationName), FileNamePart(NameText(ServiceTypeName(serviceType()))));
+  if (contents) {
+    if (OptionalError written =
+            platform_.fileSystem->WriteFileAtomically(directory + "/" + fileName, *contents)) {
+      error = std::move(written);
+    }
+  }
+  if (error) TLOG_ERROR(SessionLog(), "jsonOutput writeToURL: {}", error->LocalizedDescription());
+}
+
+bool RuvoReportingSession::shouldReportOrientation() {
+  if (!IsInternalBuild()) return false;
+  const uint16_t type = serviceType();
+  if (type != service_type::kLongFormAudio && type != service_type::kTelephony) return false;
+  return platform_.deviceInfo->QueryInt32(kDeviceInfoDeviceClassNumber, 0) !=
+         kNoOrientationDeviceClass;
+}
+
+void RuvoReportingSession::registerOrientationCallbacks() {
+  const std::string id = fmt::format(kOrientationIDFormat, reporterID_);
+  {
+    std::lock_guard lock(propertyMutex_);
+    orientationCallbackID_ = id;
+    startDate_ = platform_.dispatcher->GetClock().Now();
+  }
+  // The callbacks hold the session until they are unregistered.
+  platform_.orientation->RegisterDeviceOrientation(
+      id, [self = shared_from_this()](const OrientationValue& orientation) {
+        self->orientationChanged(OrientationKind::kDevice, orientation);
+      });
+  platform_.orientation->RegisterUIOrientation(
+      id, [self = shared_from_this()](const OrientationValue& orientation) {
+        self->orientationChanged(OrientationKind::kUI, orientation);
+      });
+}
+
+void RuvoReportingSession::orientationChanged(OrientationKind kind,
+                                              const OrientationValue& orientation) {
+  const std::string text = platform_.orientation->OrientationToString(orientation);
+  const std::optional<SteadyTime> start = startDate();
+  const SteadyTime now = platform_.dispatcher->GetClock().Now();
+  const double elapsed = std::chrono::duration<double>(now - start.value_or(now)).count();
+  // Whole milliseconds, half away from zero.
+  const double time = std::round(elapsed * 1000) / 1000;
+
+  const bool device = kind == OrientationKind::kDevice;
+  if (LogTarget(SessionLog()).ShouldLog(LogLevel::kDebug)) {
+    const Dictionary info = userInfo();
+    const auto application = info.find(kHostApplicationKey);
+    TLOG_DEBUG(SessionLog(),
+               "Orientation handler callback mode={} orientation=\"{}\" app=\"{}\", time={}, "
+               "id=\"{}\"",
+               device ? "device" : "ui", text,
+               application != info.end() ? ValueText(*application) : std::string(kAbsentText),
+               ValueText(Value(time)), NameText(orientationCallbackID()));
+  }
+
+  Dictionary record = MakeDictionary();
+  record[device ? "device_orientation" : "ui_orientation"] = text;
+  record[device ? "device_orientation_time" : "ui_orientation_time"] = time;
+  appendAggregated(std::make_shared<const Dictionary>(std::move(record)));
+}
+
+void RuvoReportingSession::sendSingleMessage(const Dictionary& payload, uint32_t category,
+                                             uint16_t type, uint16_t serviceType,
+                                             const Dictionary& userInfo, Reply reply) {
+  // `userInfo` is not sent: single messages carry only the service's own identification.
+  (void)userInfo;
+  PlatformServices& platform = CurrentPlatform();
+  const int64_t delaySeconds =
+      serviceType == service_type::kAlarms
+          ? static_cast<int64_t>(platform.random->UniformBelow(kAlarmsDelaySpreadSeconds))
+          : 0;
+  TLOG_DEBUG(SessionLog(), "sending single message after delta {} for service {}", delaySeconds,
+             static_cast<int>(serviceType));
+
+  bool changed = false;
+  Dictionary cleaned = CleanedPayload(payload, &changed);
+  std::optional<Dictionary> received;
+  if (changed) received = payload;
+  Work send = [&platform, cleaned = std::move(cleaned), received = std::move(received), category,
+               type, serviceType, reply = std::move(reply)] {
+    EmitTracePoint(trace::kMessageSent);
+    TLOG_DEBUG(SessionLog(), "sending single message");
+    Dictionary sessionInfo = MakeDictionary();
+    sessionInfo[kTelvoroSessionInfoClientType] = kClientType;
+    sessionInfo[kTelvoroSessionInfoClientVersion] = kClientVersion;
+    sessionInfo[kTelvoroSessionInfoSessionID] = kSingleMessageSessionID;
+    Dictionary telvoroUserInfo = MakeDictionary();
+    telvoroUserInfo[kTelvoroUserInfoClientName] = kClientName;
+    if (std::optional<std::string> name = ServiceTypeName(serviceType)) {
+      telvoroUserInfo[kTelvoroUserInfoServiceName] = *name;
+    }
+
+    Error error;
+    OptionalError result;
+    if (platform.telvoro->SendOneMessage(sessionInfo, telvoroUserInfo,
+                                         static_cast<uint16_t>(category & kPlatformCategoryMask),
+                                         type, cleaned, &error)) {
+      TLOG_DEBUG(SessionLog(), "message {} : category {} : type {}", received ? *received : cleaned,
+                 static_cast<int32_t>(category), type);
+    } else {
+      TLOG_ERROR(SessionLog(), "sendOneMessageWithSessionInfo {}", error.LocalizedDescription());
+      result = std::move(error);
+    }
+    if (reply) reply(result);
+  };
+  if (delaySeconds > 0) {
+    platform.dispatcher->BackgroundQueue().AsyncAfter(std::chrono::seconds(delaySeconds),
+                                                      std::move(send));
+  } else {
+    platform.dispatcher->BackgroundQueue().Async(std::move(send));
+  }
+}
+
+std::vector<int32_t> RuvoReportingSession::processIdentifiers() const {
+  std::lock_guard lock(propertyMutex_);
+  return processIdentifiers_;
+}
+
+void RuvoReportingSession::setProcessIdentifiers(std::vector<int32_t> processIdentifiers) {
+  std::lock_guard lock(propertyMutex_);
+  processIdentifiers_ = std::move(processIdentifiers);
+}
+
+Dictionary RuvoReportingSession::userInfo() const {
+  std::lock_guard lock(propertyMutex_);
+  return userInfo_;
+}
+
+void RuvoReportingSession::setUserInfo(Dictionary userInfo) {
+  if (userInfo.is_null()) userInfo = MakeDictionary();
+  std::lock_guard lock(propertyMutex_);
+  userInfo_ = std::move(userInfo);
+}
+
+Dictionary RuvoReportingSession::messageTypeCounts() const {
+  std::lock_guard lock(countsMutex_);
+  return messageTypeCounts_;
+}
+
+std::optional<std::string> RuvoReportingSession::serviceName() const {
+  std::lock_guard lock(propertyMutex_);
+  return serviceName_;
+}
+
+std::optional<std::string> RuvoReportingSession::orientationCallbackID() const {
+  std::lock_guard lock(propertyMutex_);
+  return orientationCallbackID_;
+}
+
+std::optional<SteadyTime> RuvoReportingSession::startDate() const {
+  std::lock_guard lock(propertyMutex_);
+  return startDate_;
+}
+
+std::shared_ptr<PayloadList> RuvoReportingSession::aggregatedPayloadData() const {
+  std::lock_guard lock(propertyMutex_);
+  return aggregatedPayloadData_;
+}
+
+std::shared_ptr<NestedPayloadList> RuvoReportingSession::nestedAggregatedPayloadData() const {
+  std::lock_guard lock(propertyMutex_);
+  return nestedAggregatedPayloadData_;
+}
+
+TelvoroSessionPtr RuvoReportingSession::telvoroSession() const {
+  std::lock_guard lock(propertyMutex_);
+  return telvoroSession_;
+}
+
+void RuvoReportingSession::setTelvoroSession(TelvoroSessionPtr session) {
+  TelvoroSessionPtr previous;
+  {
+    std::lock_guard lock(propertyMutex_);
+    previous = std::exchange(telvoroSession_, std::move(session));
+  }
+  // `previous` may be the last reference: released outside the lock.
+}
+
+TelvoroTokenPtr RuvoReportingSession::telvoroAgentToken() const {
+  std::lock_guard lock(propertyMutex_);
+  return telvoroAgentToken_;
+}
+
+Dictionary RuvoReportingSession::driverSnapShot() const {
+  std::lock_guard lock(propertyMutex_);
+  return driverSnapShot_;
+}
+
+void RuvoReportingSession::setDriverSnapShot(Dictionary snapshot) {
+  std::lock_guard lock(propertyMutex_);
+  driverSnapShot_ = std::move(snapshot);
+}
+
+RuvoReportingSession::TransactionCompleteBlock RuvoReportingSession::transactionCompleteBlock()
+    const {
+  std::lock_guard lock(propertyMutex_);
+  return transactionCompleteBlock_;
+}
+
+void RuvoReportingSession::setTransactionCompleteBlock(TransactionCompleteBlock block) {
+  std::lock_guard lock(propertyMutex_);
+  transactionCompleteBlock_ = std::move(block);
+}
+
+}  // namespace tavrin
