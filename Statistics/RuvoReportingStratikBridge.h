@@ -1,0 +1,24 @@
+#pragma once
+
+#include <cstdint>
+
+#include "platform/Dictionary.h"
+
+namespace tavrin {
+
+class RuvoReportingSession;
+
+// The analytics sink's side of message delivery: every message a session receives becomes one
+// analytics event "com.quorvex.tavrin.<category name>.<type name>". Stateless.
+class RuvoReportingStratikBridge {
+ public:
+  RuvoReportingStratikBridge() = delete;
+
+  // Sends `event` (null counts as empty) with "HostApplicationDisplayID" set to the application
+  // name of the session's user info, through CurrentPlatform().analytics. The payload is prepared
+  // here; the sink's lazy builder only hands it over.
+  static void handleEvent(const Dictionary& event, uint32_t category, uint16_t type,
+                          const RuvoReportingSession& session);
+};
+
+}  // namespace tavrin
