@@ -1,0 +1,62 @@
+#pragma once
+
+#include <cstddef>
+#include <map>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <utility>
+#include <vector>
+
+#include "platform/FileSystem.h"
+
+namespace tavrin::testing {
+
+// Files and directories in memory, with errors that can be injected per operation. Like a real
+// file system, a write needs its parent directory (unless SetRequireParents(false)), and a path
+// cannot be both a file and a directory. Paths are absolute; repeated and trailing "/" are
+// ignored. Thread-safe.
+class FakeFileSystem final : public FileSystem {
+ public:
+  static constexpr const char* kErrorDomain = "com.quorvex.tavrin.fake.files";
+  static constexpr int64_t kNoSuchFile = 2;      // ENOENT
+  static constexpr int64_t kNotADirectory = 20;  // ENOTDIR
+  static constexpr int64_t kIsADirectory = 21;   // EISDIR
+
+  OptionalError CreateDirectories(const std::string& path, unsigned mode) override;
+  OptionalError WriteFileAtomically(const std::string& path, std::string_view contents) override;
+
+  // Every CreateDirectories or WriteFileAtomically call fails with `error` while it is set (and
+  // changes nothing).
+  void FailCreateDirectories(OptionalError error);
+  void FailWrites(OptionalError error);
+  void SetRequireParents(bool require);
+
+  // Adds a directory (and its parents) directly, as if it had been there before.
+  void AddDirectory(const std::string& path, unsigned mode = 0755);
+
+  std::optional<std::string> ReadFile(const std::string& path) const;
+  // Every file by path.
+  std::map<std::string, std::string> Files() const;
+  // Every directory by path, with its mode.
+  std::map<std::string, unsigned> Directories() const;
+  std::vector<std::pair<std::string, unsigned>> CreateDirectoriesCalls() const;
+  std::vector<std::string> WriteCalls() const;
+
+  static std::string Normalize(std::string_view path);
+
+ private:
+  void AddDirectoryLocked(const std::string& path, unsigned mode);
+
+  mutable std::mutex mutex_;
+  std::map<std::string, std::string> files_;                   // guarded by mutex_
+  std::map<std::string, unsigned> directories_{{"/", 0755}};   // guarded by mutex_
+  OptionalError createError_;                                  // guarded by mutex_
+  OptionalError writeError_;                                   // guarded by mutex_
+  bool requireParents_ = true;                                 // guarded by mutex_
+  std::vector<std::pair<std::string, unsigned>> createCalls_;  // guarded by mutex_
+  std::vector<std::string> writeCalls_;                        // guarded by mutex_
+};
+
+}  // namespace tavrin::testing

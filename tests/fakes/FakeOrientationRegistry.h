@@ -1,0 +1,126 @@
+#pragma once
+
+#include <cstddef>
+#include <map>
+#include <mutex>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "platform/OrientationRegistry.h"
+
+namespace tavrin::testing {
+
+// Orientation callbacks that fire only when the test says so, on the test's thread (standing in
+// for the registry's own thread). Keeps the real contract: once Unregister returns, the
+// callbacks of that id are not called again, even when another thread is firing meanwhile.
+// Callbacks must not register or unregister from inside a firing. Thread-safe.
+class FakeOrientationRegistry final : public OrientationRegistry {
+ public:
+  enum class Kind { kDevice, kUI };
+  // One registration or unregistration, in call order.
+  struct Change {
+    Kind kind;
+    bool registered;  // false: unregistered
+    std::string id;
+  };
+
+  void RegisterDeviceOrientation(const std::string& id, Callback callback) override {
+    Register(Kind::kDevice, id, std::move(callback));
+  }
+  void RegisterUIOrientation(const std::string& id, Callback callback) override {
+    Register(Kind::kUI, id, std::move(callback));
+  }
+  void UnregisterDeviceOrientation(const std::string& id) override {
+    Unregister(Kind::kDevice, id);
+  }
+  void UnregisterUIOrientation(const std::string& id) override { Unregister(Kind::kUI, id); }
+
+  // The text given to the value by SetText, else the value itself.
+  std::string OrientationToString(const OrientationValue& value) override {
+    std::lock_guard lock(mutex_);
+    const auto found = texts_.find(value);
+    return found == texts_.end() ? value : found->second;
+  }
+  void SetText(const OrientationValue& value, std::string text) {
+    std::lock_guard lock(mutex_);
+    texts_[value] = std::move(text);
+  }
+
+  // Calls every registered callback of the kind with `value`; returns how many were called.
+  size_t FireDevice(const OrientationValue& value) { return Fire(Kind::kDevice, value); }
+  size_t FireUI(const OrientationValue& value) { return Fire(Kind::kUI, value); }
+
+  bool IsRegistered(Kind kind, const std::string& id) const {
+    std::lock_guard lock(mutex_);
+    return Callbacks(kind).count(id) > 0;
+  }
+  size_t RegisteredCount(Kind kind) const {
+    std::lock_guard lock(mutex_);
+    return Callbacks(kind).size();
+  }
+  std::vector<Change> History() const {
+    std::lock_guard lock(mutex_);
+    return history_;
+  }
+  // Drops every callback (and what they hold), as a registry that goes away does.
+  void Clear() {
+    std::map<std::string, Callback> device, ui;
+    {
+      std::lock_guard firing(fireMutex_);
+      std::lock_guard lock(mutex_);
+      device.swap(device_);
+      ui.swap(ui_);
+    }
+  }
+
+ private:
+  std::map<std::string, Callback>& Callbacks(Kind kind) {
+    return kind == Kind::kDevice ? device_ : ui_;
+  }
+  const std::map<std::string, Callback>& Callbacks(Kind kind) const {
+    return kind == Kind::kDevice ? device_ : ui_;
+  }
+
+  void Register(Kind kind, const std::string& id, Callback callback) {
+    Callback previous;
+    std::lock_guard lock(mutex_);
+    previous = std::exchange(Callbacks(kind)[id], std::move(callback));
+    history_.push_back(Change{kind, true, id});
+  }
+
+  void Unregister(Kind kind, const std::string& id) {
+    Callback removed;  // released after the locks: it may hold the last reference to its owner
+    {
+      std::lock_guard firing(fireMutex_);
+      std::lock_guard lock(mutex_);
+      auto& callbacks = Callbacks(kind);
+      const auto found = callbacks.find(id);
+      if (found != callbacks.end()) {
+        removed = std::move(found->second);
+        callbacks.erase(found);
+      }
+      history_.push_back(Change{kind, false, id});
+    }
+  }
+
+  size_t Fire(Kind kind, const OrientationValue& value) {
+    std::lock_guard firing(fireMutex_);
+    std::vector<Callback> callbacks;
+    {
+      std::lock_guard lock(mutex_);
+      for (const auto& entry : Callbacks(kind)) callbacks.push_back(entry.second);
+    }
+    for (const auto& callback : callbacks) callback(value);
+    return callbacks.size();
+  }
+
+  std::mutex fireMutex_;  // held while callbacks run, so Unregister waits for a firing to end
+  mutable std::mutex mutex_;
+  std::map<std::string, Callback> device_;         // guarded by mutex_
+  std::map<std::string, Callback> ui_;             // guarded by mutex_
+  std::map<OrientationValue, std::string> texts_;  // guarded by mutex_
+  std::vector<Change> history_;                    // guarded by mutex_
+};
+
+}  // namespace tavrin::testing

@@ -1,0 +1,48 @@
+#pragma once
+
+#include "platform/Platform.h"
+#include "tests/fakes/FakeAnalyticsSink.h"
+#include "tests/fakes/FakeClock.h"
+#include "tests/fakes/FakeDeviceInfo.h"
+#include "tests/fakes/FakeDispatcher.h"
+#include "tests/fakes/FakeDriverStatsService.h"
+#include "tests/fakes/FakeFileSystem.h"
+#include "tests/fakes/FakeOrientationRegistry.h"
+#include "tests/fakes/FakePowerEventLog.h"
+#include "tests/fakes/FakeRandom.h"
+#include "tests/fakes/FakeTelvoroService.h"
+
+namespace tavrin::testing {
+
+// One fake of each platform service, gathered in `services` and installed as the process's
+// platform for the lifetime of the object (the previous one is put back afterwards). Time moves
+// only through `dispatcher` (or `clock`); nothing runs until the test runs the dispatcher.
+//
+// Members are declared so that the dispatcher goes first on destruction: work still queued may
+// hold sessions, and those hold references into the other fakes.
+struct FakePlatform {
+  FakePlatform();
+  ~FakePlatform();
+  FakePlatform(const FakePlatform&) = delete;
+  FakePlatform& operator=(const FakePlatform&) = delete;
+
+  static constexpr const char* kDiagnosticDirectory = "/fake/log/DiagnosticLogs";
+
+  FakeClock clock;
+  FakeRandom random;
+  FakeTelvoroService telvoro;
+  FakeAnalyticsSink analytics;
+  FakePowerEventLog powerLog;
+  FakeDriverStatsService driverStats;
+  FakeOrientationRegistry orientation;
+  FakeDeviceInfo deviceInfo;
+  FakeFileSystem fileSystem;
+  FakeDispatcher dispatcher{clock};
+  // processInfo, notifications and defaults are left null: fill them in a test that needs them.
+  PlatformServices services;
+
+ private:
+  PlatformServices* previous_ = nullptr;
+};
+
+}  // namespace tavrin::testing

@@ -1,0 +1,40 @@
+#pragma once
+
+#include <cstdint>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "platform/PowerEventLog.h"
+
+namespace tavrin::testing {
+
+// Records every power event. Thread-safe.
+class FakePowerEventLog final : public PowerEventLog {
+ public:
+  struct Event {
+    int32_t agent = 0;
+    std::string name;
+    Dictionary payload;
+    std::optional<Dictionary> extra;  // the fourth argument, when one was given
+  };
+
+  void LogRegisteredEvent(int32_t agent, const std::string& name, const Dictionary& payload,
+                          const Dictionary* extra) override {
+    std::lock_guard lock(mutex_);
+    events_.push_back(
+        Event{agent, name, payload, extra ? std::optional<Dictionary>(*extra) : std::nullopt});
+  }
+
+  std::vector<Event> Events() const {
+    std::lock_guard lock(mutex_);
+    return events_;
+  }
+
+ private:
+  mutable std::mutex mutex_;
+  std::vector<Event> events_;  // guarded by mutex_
+};
+
+}  // namespace tavrin::testing
