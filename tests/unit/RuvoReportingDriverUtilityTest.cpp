@@ -1,0 +1,445 @@
+#include "Statistics/RuvoReportingDriverUtility.h"
+
+#include <gtest/gtest.h>
+
+#include <algorithm>
+
+#include "platform/linux/CountersTreeDriverStats.h"
+#include "tests/fakes/FakeDriverStatsService.h"
+#include "tests/fakes/FakeLogSystem.h"
+#include "tests/support/TempCountersTree.h"
+
+namespace tavrin {
+namespace {
+
+using testing::FakeDriverStatsService;
+using testing::FakeLogSystem;
+using testing::TempCountersTree;
+using Failure = FakeDriverStatsService::Failure;
+using std::nullopt;
+
+std::vector<std::string> Texts(const FakeLogSystem& log, LogLevel level) {
+  std::vector<std::string> texts;
+  for (const auto& line : log.Lines()) {
+    if (line.level != level) continue;
+    // Drop the "file:line:function: " prefix.
+    const auto colon = line.text.find(": ");
+    texts.push_back(colon == std::string::npos ? line.text : line.text.substr(colon + 2));
+  }
+  return texts;
+}
+
+std::vector<std::string> Descriptions(const RuvoReportingDriverUtility& utility) {
+  std::vector<std::string> names;
+  for (const auto& subscription : utility.ioChannelSubscriptions()) {
+    names.push_back(subscription->driver()->description());
+  }
+  return names;
+}
+
+std::vector<std::string> Keys(const Dictionary& dictionary) {
+  std::vector<std::string> keys;
+  for (const auto& [key, value] : dictionary.items()) keys.push_back(key);
+  return keys;
+}
+
+class DriverUtilityTest : public ::testing::Test {
+ protected:
+  DriverUtilityTest() { RuvoReportingDriverUtility::ResetLogScopeForTesting(); }
+  ~DriverUtilityTest() override { RuvoReportingDriverUtility::ResetLogScopeForTesting(); }
+
+  FakeLogSystem log;
+  FakeDriverStatsService fake;
+};
+
+// --- Drivers, subscriptions and keys ---
+
+TEST(RuvoReportingDriverTest, DescriptionsOfTheDriverTableWriteAbsentNamesAsNull) {
+  std::vector<std::string> descriptions;
+  for (const auto& entry : RuvoReportingDriverUtility::kDriverTable) {
+    auto name = [](const char* text) {
+      return text ? std::optional<std::string>(text) : std::nullopt;
+    };
+    descriptions.push_back(
+        RuvoReportingDriver::driverWithGroupName(name(entry.groupName), name(entry.subGroupName))
+            ->description());
+  }
+  EXPECT_EQ(descriptions, (std::vector<std::string>{"QuorvexAE2MCA-(null)", "Speaker-(null)",
+                                                    "(null)-MCA", "Haptics-Stats"}));
+  EXPECT_EQ(RuvoReportingDriver::driverWithGroupName(nullopt, nullopt)->description(),
+            "(null)-(null)");
+}
+
+TEST(RuvoReportingDriverTest, ChannelKeysJoinThePresentNamesWithUnderscores) {
+  const auto both = RuvoReportingDriver::driverWithGroupName("Haptics", "Stats");
+  const auto group = RuvoReportingDriver::driverWithGroupName("Speaker", nullopt);
+  const auto subgroup = RuvoReportingDriver::driverWithGroupName(nullopt, "MCA");
+  const auto neither = RuvoReportingDriver::driverWithGroupName(nullopt, nullopt);
+  EXPECT_EQ(RuvoReportingDriverUtility::ChannelKey(*both, "kicks"), "Haptics_Stats_kicks");
+  EXPECT_EQ(RuvoReportingDriverUtility::ChannelKey(*group, "temp"), "Speaker_temp");
+  EXPECT_EQ(RuvoReportingDriverUtility::ChannelKey(*subgroup, "resets"), "MCA_resets");
+  EXPECT_EQ(RuvoReportingDriverUtility::ChannelKey(*both, nullopt), "Haptics_Stats_");
+  EXPECT_EQ(RuvoReportingDriverUtility::ChannelKey(*neither, "x"), "x");
+  EXPECT_EQ(RuvoReportingDriverUtility::ChannelKey(*neither, nullopt), "");
+}
+
+TEST(RuvoReportingIOChannelSubscriptionTest, StartsWithoutHandleOrChannels) {
+  const auto driver = RuvoReportingDriver::driverWithGroupName("Speaker", nullopt);
+  RuvoReportingIOChannelSubscription subscription(driver);
+  EXPECT_EQ(subscription.subscription(), 0u);
+  EXPECT_EQ(subscription.subscribedChannels(), nullopt);
+  EXPECT_EQ(subscription.driver(), driver);
+}
+
+// --- Creation ---
+
+TEST_F(DriverUtilityTest, RegistersTheRvrdScopeOncePerProcessAndLogsToIt) {
+  RuvoReportingDriverUtility first(fake);
+  const auto registrations = log.Registrations();
+  ASSERT_EQ(registrations.count("rvrd"), 1u);
+  const auto& rvrd = registrations.at("rvrd");
+  EXPECT_TRUE(rvrd.enabled);
+  EXPECT_EQ(rvrd.code, FourCharCode("rvrd"));
+  EXPECT_EQ(rvrd.subsystem, "com.quorvex.tavrin");
+  EXPECT_EQ(rvrd.verbosityKey, "reporting_driver_verbose");
+  EXPECT_EQ(rvrd.level, 31);
+
+  // A second registration would now answer none and send the lines to the default log.
+  log.FailRegistrations(true);
+  log.Clear();
+  RuvoReportingDriverUtility second(fake);
+  const auto lines = log.Matching("creating metrioning driver utility");
+  ASSERT_EQ(lines.size(), 1u);
+  EXPECT_EQ(lines[0].scope, "rvrd");
+  EXPECT_EQ(lines[0].level, LogLevel::kInfo);
+}
+
+TEST_F(DriverUtilityTest, FailedRegistrationWritesToTheDefaultLog) {
+  log.FailRegistrations(true);
+  RuvoReportingDriverUtility utility(fake);
+  const auto lines = log.Matching("creating metrioning driver utility");
+  ASSERT_EQ(lines.size(), 1u);
+  EXPECT_EQ(lines[0].scope, "default");
+  EXPECT_EQ(lines[0].text.rfind("RuvoReportingDriverUtility.cpp:", 0), 0u) << lines[0].text;
+}
+
+TEST_F(DriverUtilityTest, SubscribesInTableOrderOnlyDriversWithChannels) {
+  fake.AddChannel("Haptics", "Stats", "kicks", 1);
+  fake.AddChannel("QuorvexAE2MCA", nullopt, "underruns", 1);
+  fake.AnswerNoChannels(nullopt, "MCA");  // no description at all: nothing logged for it
+  RuvoReportingDriverUtility utility(fake);
+
+  using Query = std::pair<std::optional<std::string>, std::optional<std::string>>;
+  EXPECT_EQ(fake.Queries(), (std::vector<Query>{{"QuorvexAE2MCA", nullopt},
+                                                {"Speaker", nullopt},
+                                                {nullopt, "MCA"},
+                                                {"Haptics", "Stats"}}));
+  EXPECT_EQ(Descriptions(utility),
+            (std::vector<std::string>{"QuorvexAE2MCA-(null)", "Haptics-Stats"}));
+  EXPECT_EQ(fake.CreateSubscriptionCalls(), 2);
+  for (const auto& subscription : utility.ioChannelSubscriptions()) {
+    EXPECT_NE(subscription->subscription(), 0u);
+    ASSERT_TRUE(subscription->subscribedChannels());
+    EXPECT_EQ(fake.ChannelCount(*subscription->subscribedChannels()), 1);
+  }
+  EXPECT_EQ(
+      Texts(log, LogLevel::kInfo),
+      (std::vector<std::string>{"creating metrioning driver utility",
+                                "couldn't find any channels for driver group Speaker-(null)"}));
+  // Speaker had a description without channels and is still reported as subscribed.
+  EXPECT_EQ(Texts(log, LogLevel::kDefault),
+            (std::vector<std::string>{"subscribed to group group QuorvexAE2MCA-(null)",
+                                      "subscribed to group group Speaker-(null)",
+                                      "subscribed to group group Haptics-Stats"}));
+  EXPECT_TRUE(Texts(log, LogLevel::kError).empty());
+}
+
+TEST_F(DriverUtilityTest, ChannelsThatComeBackWithAnErrorAreStillUsed) {
+  fake.AddChannel("Speaker", nullopt, "temp", 4);
+  fake.AddChannel("Haptics", "Stats", "kicks", 5);
+  fake.FailCopyChannels("Speaker", nullopt, Failure{.code = 35, .withResult = true});
+  fake.FailCopyChannels("Haptics", "Stats", Failure{.code = 2, .withResult = false});
+  RuvoReportingDriverUtility utility(fake);
+
+  EXPECT_EQ(Texts(log, LogLevel::kError),
+            (std::vector<std::string>{"error 35 getting channels for driver Speaker-(null)",
+                                      "error 2 getting channels for driver Haptics-Stats"}));
+  EXPECT_EQ(Descriptions(utility), (std::vector<std::string>{"Speaker-(null)"}));
+  const auto subscribed = Texts(log, LogLevel::kDefault);
+  EXPECT_EQ(
+      std::count(subscribed.begin(), subscribed.end(), "subscribed to group group Speaker-(null)"),
+      1);
+  EXPECT_EQ(
+      std::count(subscribed.begin(), subscribed.end(), "subscribed to group group Haptics-Stats"),
+      0);
+  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(nullptr),
+            (Dictionary{{"Speaker_temp", 4}}));
+}
+
+TEST_F(DriverUtilityTest, NoDriverAtAllGivesAnEmptySnapshotAndNoDelta) {
+  fake.AddChannel("PipeWire", "alsa_output", "xruns", 3);
+  RuvoReportingDriverUtility utility(fake);
+  EXPECT_TRUE(utility.ioChannelSubscriptions().empty());
+  const Dictionary snapShot = utility.getSnapShot();
+  EXPECT_TRUE(snapShot.is_object());
+  EXPECT_TRUE(snapShot.empty());
+  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(&snapShot), nullopt);
+  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(nullptr), nullopt);
+  EXPECT_EQ(fake.CreateSamplesCalls(), 0);
+}
+
+// --- Snapshots and deltas ---
+
+TEST_F(DriverUtilityTest, SnapshotHoldsEachDriversSampleSetUnderItsDescription) {
+  fake.AddChannel("QuorvexAE2MCA", nullopt, "underruns", 3);
+  fake.AddChannel("Speaker", "MCA", "resets", 8);  // matched by Speaker and by (null)-MCA
+  fake.AddChannel("Haptics", "Stats", "kicks", 1);
+  RuvoReportingDriverUtility utility(fake);
+  log.Clear();
+  const Dictionary snapShot = utility.getSnapShot();
+  EXPECT_EQ(Keys(snapShot), (std::vector<std::string>{"QuorvexAE2MCA-(null)", "Speaker-(null)",
+                                                      "(null)-MCA", "Haptics-Stats"}));
+  EXPECT_EQ(snapShot.at("(null)-MCA").at("samples").at(0).at("value"), 8);
+  EXPECT_EQ(Texts(log, LogLevel::kInfo),
+            (std::vector<std::string>{
+                "sampling driver QuorvexAE2MCA-(null)", "sampling driver Speaker-(null)",
+                "sampling driver (null)-MCA", "sampling driver Haptics-Stats"}));
+}
+
+TEST_F(DriverUtilityTest, OnlyCountersThatRoseAppearAndNothingChangedIsNone) {
+  const int rise = fake.AddChannel("QuorvexAE2MCA", nullopt, "rise", 10);
+  fake.AddChannel("QuorvexAE2MCA", nullopt, "stay", 10);
+  const int fall = fake.AddChannel("QuorvexAE2MCA", nullopt, "fall", 10);
+  fake.AddChannel("QuorvexAE2MCA", nullopt, "zero", 0);
+  const int negative = fake.AddChannel("Speaker", nullopt, "negative", -5);
+  const int mca = fake.AddChannel("Speaker", "MCA", "resets", 1);
+  const int haptics = fake.AddChannel("Haptics", "Stats", "kicks", 100);
+  const int unnamed = fake.AddChannel("Haptics", "Stats", nullopt, 0);
+  RuvoReportingDriverUtility utility(fake);
+
+  const Dictionary unchanged = utility.getSnapShot();
+  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(&unchanged), nullopt);
+
+  fake.SetValue(rise, 17);
+  fake.SetValue(fall, 3);
+  fake.SetValue(negative, -2);  // rose by 3 while below zero
+  fake.SetValue(mca, 4);
+  fake.SetValue(haptics, 101);
+  fake.SetValue(unnamed, 2);
+  log.Clear();
+  const auto delta = utility.getDriverStatisticsRelativeToSnapShot(&unchanged);
+  ASSERT_TRUE(delta);
+  EXPECT_EQ(*delta, (Dictionary{{"QuorvexAE2MCA_rise", 7},
+                                {"Speaker_negative", 3},
+                                {"Speaker_resets", 3},
+                                {"MCA_resets", 3},
+                                {"Haptics_Stats_kicks", 1},
+                                {"Haptics_Stats_", 2}}));
+  EXPECT_TRUE((*delta)["QuorvexAE2MCA_rise"].is_number_integer());
+  EXPECT_EQ(Texts(log, LogLevel::kInfo).size(), 8u);  // getting / done getting, per driver
+  EXPECT_EQ(log.Count("getting latest samples", LogLevel::kInfo), 8u);
+  EXPECT_EQ(log.Count("done getting latest samples", LogLevel::kInfo), 4u);
+}
+
+TEST_F(DriverUtilityTest, WithoutSnapshotThePositiveAbsoluteValuesAreReported) {
+  fake.AddChannel("QuorvexAE2MCA", nullopt, "underruns", 12);
+  fake.AddChannel("QuorvexAE2MCA", nullopt, "zero", 0);
+  fake.AddChannel("Speaker", nullopt, "negative", -3);
+  fake.AddChannel("Haptics", "Stats", "kicks", 1);
+  RuvoReportingDriverUtility utility(fake);
+  const Dictionary expected{{"QuorvexAE2MCA_underruns", 12}, {"Haptics_Stats_kicks", 1}};
+  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(nullptr), expected);
+  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(std::optional<Dictionary>()), expected);
+  EXPECT_TRUE(fake.DeltaCalls().empty());
+}
+
+TEST_F(DriverUtilityTest, LaterChannelWithTheSameKeyReplacesTheEarlierValue) {
+  const int own = fake.AddChannel("QuorvexAE2MCA", nullopt, "x", 0);
+  const int sub = fake.AddChannel("QuorvexAE2MCA", "Sub", "x", 0);
+  RuvoReportingDriverUtility utility(fake);
+  const Dictionary snapShot = utility.getSnapShot();
+  fake.SetValue(own, 5);
+  fake.SetValue(sub, 9);
+  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(&snapShot),
+            (Dictionary{{"QuorvexAE2MCA_x", 9}}));
+  fake.SetValue(sub, 0);  // the later one is not positive: the earlier value stays
+  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(&snapShot),
+            (Dictionary{{"QuorvexAE2MCA_x", 5}}));
+}
+
+TEST_F(DriverUtilityTest, SamplingErrorAtSnapshotLeavesTheDriverOutAndItsDeltaCountsFromNone) {
+  fake.AddChannel("Speaker", nullopt, "temp", 40);
+  const int kicks = fake.AddChannel("Haptics", "Stats", "kicks", 10);
+  fake.FailCreateSamples("Speaker", nullopt, Failure{.code = 7, .withResult = true, .times = 1});
+  RuvoReportingDriverUtility utility(fake);
+  const Dictionary snapShot = utility.getSnapShot();
+  EXPECT_EQ(Keys(snapShot), (std::vector<std::string>{"Haptics-Stats"}));
+  EXPECT_EQ(Texts(log, LogLevel::kError),
+            (std::vector<std::string>{"MetrionCreateSamples error 7"}));
+
+  fake.SetValue(kicks, 11);
+  const auto delta = utility.getDriverStatisticsRelativeToSnapShot(&snapShot);
+  EXPECT_EQ(delta, (Dictionary{{"Speaker_temp", 40}, {"Haptics_Stats_kicks", 1}}));
+  const auto calls = fake.DeltaCalls();
+  ASSERT_EQ(calls.size(), 2u);
+  EXPECT_EQ(calls[0].earlier, nullopt);  // the Speaker key is missing from the snapshot
+  EXPECT_EQ(calls[1].earlier, snapShot.at("Haptics-Stats"));
+}
+
+TEST_F(DriverUtilityTest, SamplingErrorAtStopLeavesOnlyThatDriverOut) {
+  const int temp = fake.AddChannel("Speaker", nullopt, "temp", 1);
+  const int kicks = fake.AddChannel("Haptics", "Stats", "kicks", 1);
+  RuvoReportingDriverUtility utility(fake);
+  const Dictionary snapShot = utility.getSnapShot();
+  fake.SetValue(temp, 5);
+  fake.SetValue(kicks, 5);
+  fake.FailCreateSamples("Haptics", "Stats", Failure{.code = 12, .withResult = true});
+  log.Clear();
+  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(&snapShot),
+            (Dictionary{{"Speaker_temp", 4}}));
+  EXPECT_EQ(Texts(log, LogLevel::kError),
+            (std::vector<std::string>{"MetrionCreateSamples error 12"}));
+  EXPECT_EQ(fake.DeltaCalls().size(), 1u);
+
+  fake.FailCreateSamples("Speaker", nullopt, Failure{.code = 12});
+  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(&snapShot), nullopt);
+}
+
+TEST_F(DriverUtilityTest, FailedDifferenceFallsBackToTheAbsoluteValues) {
+  const int temp = fake.AddChannel("Speaker", nullopt, "temp", 50);
+  fake.AddChannel("Speaker", nullopt, "zero", 0);
+  const int kicks = fake.AddChannel("Haptics", "Stats", "kicks", 10);
+  RuvoReportingDriverUtility utility(fake);
+  const Dictionary snapShot = utility.getSnapShot();
+  fake.SetValue(temp, 51);
+  fake.SetValue(kicks, 12);
+  // The first difference fails (its partial result is ignored too), the second works.
+  fake.FailCreateSamplesDelta(Failure{.code = 9, .withResult = true, .times = 1});
+  log.Clear();
+  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(&snapShot),
+            (Dictionary{{"Speaker_temp", 51}, {"Haptics_Stats_kicks", 2}}));
+  EXPECT_EQ(Texts(log, LogLevel::kError),
+            (std::vector<std::string>{"MetrionCreateSamplesDelta error 9"}));
+}
+
+TEST_F(DriverUtilityTest, SnapshotThatIsNotADictionaryCountsAsMissingKeys) {
+  fake.AddChannel("Speaker", nullopt, "temp", 6);
+  RuvoReportingDriverUtility utility(fake);
+  const Dictionary odd = Value::array();
+  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(&odd), (Dictionary{{"Speaker_temp", 6}}));
+  ASSERT_EQ(fake.DeltaCalls().size(), 1u);
+  EXPECT_EQ(fake.DeltaCalls()[0].earlier, nullopt);
+}
+
+// --- Against a real counters tree ---
+
+class DriverUtilityTreeTest : public DriverUtilityTest {
+ protected:
+  TempCountersTree tree;
+  CountersTreeDriverStats service{tree.root()};
+};
+
+TEST_F(DriverUtilityTreeTest, SessionLifetimeReportsWhatRoseInEveryDriver) {
+  tree.write("QuorvexAE2MCA/rise", 10);
+  tree.write("QuorvexAE2MCA/stay", 10);
+  tree.write("QuorvexAE2MCA/fall", 10);
+  tree.write("QuorvexAE2MCA/zero", 0);
+  tree.write("Speaker/temperature", 30);
+  tree.write("Speaker/MCA/resets", 2);  // Speaker's subgroup, and subgroup MCA for (null)-MCA
+  tree.write("Mic/MCA/resets", 1);
+  tree.write("Haptics/Stats/kicks", 100);
+  tree.write("Haptics/clicks", 100);  // Haptics' own channel: not in Haptics-Stats
+  RuvoReportingDriverUtility utility(service);
+  EXPECT_EQ(Descriptions(utility),
+            (std::vector<std::string>{"QuorvexAE2MCA-(null)", "Speaker-(null)", "(null)-MCA",
+                                      "Haptics-Stats"}));
+  const Dictionary snapShot = utility.getSnapShot();
+  EXPECT_EQ(Keys(snapShot).size(), 4u);
+
+  tree.write("QuorvexAE2MCA/rise", 15);  // replaced by rename: the new value is read
+  tree.write("QuorvexAE2MCA/fall", 4);
+  tree.write("Speaker/MCA/resets", 5);
+  tree.write("Mic/MCA/resets", 2);
+  tree.write("Haptics/Stats/kicks", 107);
+  tree.write("Haptics/clicks", 900);
+  const auto delta = utility.getDriverStatisticsRelativeToSnapShot(&snapShot);
+  ASSERT_TRUE(delta);
+  // (null)-MCA reads Mic/MCA/resets (+1), then Speaker/MCA/resets (+3) under the same key
+  // "MCA_resets": the later one wins.
+  EXPECT_EQ(*delta, (Dictionary{{"QuorvexAE2MCA_rise", 5},
+                                {"Speaker_resets", 3},
+                                {"MCA_resets", 3},
+                                {"Haptics_Stats_kicks", 7}}));
+  EXPECT_TRUE(Texts(log, LogLevel::kError).empty());
+
+  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(nullptr),
+            (Dictionary{{"QuorvexAE2MCA_fall", 4},
+                        {"QuorvexAE2MCA_rise", 15},
+                        {"QuorvexAE2MCA_stay", 10},
+                        {"Speaker_temperature", 30},
+                        {"Speaker_resets", 5},
+                        {"MCA_resets", 5},
+                        {"Haptics_Stats_kicks", 107}}));
+}
+
+TEST_F(DriverUtilityTreeTest, TreeWithoutTheFourGroupsSubscribesNothingButSaysSo) {
+  tree.write("PipeWire/alsa_output.card0/xruns", 4);
+  RuvoReportingDriverUtility utility(service);
+  EXPECT_TRUE(utility.ioChannelSubscriptions().empty());
+  for (const char* driver :
+       {"QuorvexAE2MCA-(null)", "Speaker-(null)", "(null)-MCA", "Haptics-Stats"}) {
+    EXPECT_EQ(log.Count(std::string("couldn't find any channels for driver group ") + driver,
+                        LogLevel::kInfo),
+              1u);
+    EXPECT_EQ(log.Count(std::string("subscribed to group group ") + driver, LogLevel::kDefault),
+              1u);
+  }
+  const Dictionary snapShot = utility.getSnapShot();
+  EXPECT_EQ(snapShot, MakeDictionary());
+  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(&snapShot), nullopt);
+}
+
+TEST_F(DriverUtilityTreeTest, MissingRootLogsTheErrorCodeForEveryDriver) {
+  tree.remove("");
+  RuvoReportingDriverUtility utility(service);
+  EXPECT_EQ(Texts(log, LogLevel::kError),
+            (std::vector<std::string>{"error 2 getting channels for driver QuorvexAE2MCA-(null)",
+                                      "error 2 getting channels for driver Speaker-(null)",
+                                      "error 2 getting channels for driver (null)-MCA",
+                                      "error 2 getting channels for driver Haptics-Stats"}));
+  EXPECT_TRUE(Texts(log, LogLevel::kDefault).empty());
+  EXPECT_EQ(utility.getSnapShot(), MakeDictionary());
+  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(nullptr), nullopt);
+}
+
+TEST_F(DriverUtilityTreeTest, FilesThatVanishOrHoldGarbageCostOnlyTheirOwnChannel) {
+  tree.write("Speaker/temperature", 30);
+  tree.write("Speaker/vanishes", 1);
+  tree.write("Speaker/returns", 5);
+  tree.write("Speaker/garbage", 1);
+  RuvoReportingDriverUtility utility(service);
+  ASSERT_EQ(utility.ioChannelSubscriptions().size(), 1u);
+
+  tree.remove("Speaker/returns");      // gone before the snapshot, back before the stop
+  tree.write("Speaker/garbage", "x");  // garbage at the snapshot, repaired at the stop
+  const Dictionary snapShot = utility.getSnapShot();
+  EXPECT_EQ(snapShot.at("Speaker-(null)").at("samples").size(), 2u);
+
+  tree.write("Speaker/temperature", 31);
+  tree.remove("Speaker/vanishes");  // gone at the stop: no entry, no crash
+  tree.write("Speaker/returns", 6);
+  tree.write("Speaker/garbage", 2);
+  const auto delta = utility.getDriverStatisticsRelativeToSnapShot(&snapShot);
+  // Channels missing from the snapshot count from zero.
+  EXPECT_EQ(
+      delta,
+      (Dictionary{{"Speaker_garbage", 2}, {"Speaker_returns", 6}, {"Speaker_temperature", 1}}));
+  EXPECT_EQ(log.Count("Speaker/returns: No such file or directory", LogLevel::kError), 1u);
+  EXPECT_EQ(log.Count("Speaker/garbage: not one signed 64-bit decimal integer", LogLevel::kError),
+            1u);
+  EXPECT_EQ(log.Count("Speaker/vanishes: No such file or directory", LogLevel::kError), 1u);
+  EXPECT_EQ(log.Count("MetrionCreateSamples error"), 0u);
+}
+
+}  // namespace
+}  // namespace tavrin
