@@ -11,179 +11,126 @@ uint64_t ReadBigEndian(const uint8_t* bytes, size_t size) {
   return value;
 }
 
-// One value's header, as far as the scan needs it.
+// What the scan needs to know about a format byte.
 struct Header {
   enum class Kind { kScalar, kArray, kMap, kInvalid };
+  enum class Number { kNone, kUnsigned, kSigned };
   Kind kind = Kind::kScalar;
-  size_t headerSize = 1;   // format byte plus fixed-size fields, including the ext type byte
   size_t lengthSize = 0;   // bytes of a big-endian length after the format byte
-  size_t payloadSize = 0;  // fixed payload after the header; variable ones come from the length
-  bool lengthIsPayload = false;  // str, bin, ext: the length counts payload bytes
-  uint64_t count = 0;            // array elements or map pairs for fix formats
-  std::string_view unsupported;  // bin/ext name
+  size_t typeSize = 0;     // the ext type byte, after the length
+  size_t payloadSize = 0;  // fixed payload; str, bin and ext take theirs from the length
+  bool lengthIsPayload = false;
+  uint64_t count = 0;  // elements or pairs of a fixarray or fixmap
+  Number number = Number::kNone;
   bool isString = false;
-  enum class Number { kNone, kUnsigned, kSigned } number = Number::kNone;
   bool isNil = false;
+  std::string_view unsupported;  // name of a bin or ext format
+};
+
+constexpr Header Scalar(size_t payload) {
+  Header h;
+  h.payloadSize = payload;
+  return h;
+}
+constexpr Header Integer(size_t payload, Header::Number number) {
+  Header h = Scalar(payload);
+  h.number = number;
+  return h;
+}
+constexpr Header Nil() {
+  Header h;
+  h.isNil = true;
+  return h;
+}
+constexpr Header Invalid() {
+  Header h;
+  h.kind = Header::Kind::kInvalid;
+  return h;
+}
+constexpr Header Str(size_t lengthSize) {
+  Header h;
+  h.lengthSize = lengthSize;
+  h.lengthIsPayload = true;
+  h.isString = true;
+  return h;
+}
+constexpr Header FixStr(size_t payload) {
+  Header h = Scalar(payload);
+  h.isString = true;
+  return h;
+}
+constexpr Header Bin(size_t lengthSize, std::string_view name) {
+  Header h;
+  h.lengthSize = lengthSize;
+  h.lengthIsPayload = true;
+  h.unsupported = name;
+  return h;
+}
+constexpr Header Ext(size_t lengthSize, std::string_view name) {
+  Header h = Bin(lengthSize, name);
+  h.typeSize = 1;
+  return h;
+}
+constexpr Header FixExt(size_t payload, std::string_view name) {
+  Header h = Scalar(payload);
+  h.typeSize = 1;
+  h.unsupported = name;
+  return h;
+}
+constexpr Header Container(Header::Kind kind, size_t lengthSize, uint64_t count = 0) {
+  Header h;
+  h.kind = kind;
+  h.lengthSize = lengthSize;
+  h.count = count;
+  return h;
+}
+
+constexpr auto kUnsigned = Header::Number::kUnsigned;
+constexpr auto kSigned = Header::Number::kSigned;
+
+// Formats 0xc0 to 0xdf, in byte order.
+constexpr std::array<Header, 32> kFormats = {
+    Nil(),                               // c0 nil
+    Invalid(),                           // c1 never used
+    Scalar(0),                           // c2 false
+    Scalar(0),                           // c3 true
+    Bin(1, "bin8"),                      // c4
+    Bin(2, "bin16"),                     // c5
+    Bin(4, "bin32"),                     // c6
+    Ext(1, "ext8"),                      // c7
+    Ext(2, "ext16"),                     // c8
+    Ext(4, "ext32"),                     // c9
+    Scalar(4),                           // ca float32
+    Scalar(8),                           // cb float64
+    Integer(1, kUnsigned),               // cc uint8
+    Integer(2, kUnsigned),               // cd uint16
+    Integer(4, kUnsigned),               // ce uint32
+    Integer(8, kUnsigned),               // cf uint64
+    Integer(1, kSigned),                 // d0 int8
+    Integer(2, kSigned),                 // d1 int16
+    Integer(4, kSigned),                 // d2 int32
+    Integer(8, kSigned),                 // d3 int64
+    FixExt(1, "fixext1"),                // d4
+    FixExt(2, "fixext2"),                // d5
+    FixExt(4, "fixext4"),                // d6
+    FixExt(8, "fixext8"),                // d7
+    FixExt(16, "fixext16"),              // d8
+    Str(1),                              // d9 str8
+    Str(2),                              // da str16
+    Str(4),                              // db str32
+    Container(Header::Kind::kArray, 2),  // dc array16
+    Container(Header::Kind::kArray, 4),  // dd array32
+    Container(Header::Kind::kMap, 2),    // de map16
+    Container(Header::Kind::kMap, 4),    // df map32
 };
 
 Header Classify(uint8_t b) {
-  Header h;
-  if (b <= 0x7f) {
-    h.number = Header::Number::kUnsigned;  // positive fixint, value in the byte
-  } else if (b <= 0x8f) {
-    h.kind = Header::Kind::kMap;
-    h.count = b & 0x0fu;
-  } else if (b <= 0x9f) {
-    h.kind = Header::Kind::kArray;
-    h.count = b & 0x0fu;
-  } else if (b <= 0xbf) {
-    h.isString = true;
-    h.payloadSize = b & 0x1fu;
-  } else if (b >= 0xe0) {
-    h.number = Header::Number::kSigned;  // negative fixint
-  } else {
-    switch (b) {
-      case 0xc0:
-        h.isNil = true;
-        break;
-      case 0xc1:
-        h.kind = Header::Kind::kInvalid;
-        break;
-      case 0xc2:
-      case 0xc3:
-        break;
-      case 0xc4:
-        h.lengthSize = 1;
-        h.lengthIsPayload = true;
-        h.unsupported = "bin8";
-        break;
-      case 0xc5:
-        h.lengthSize = 2;
-        h.lengthIsPayload = true;
-        h.unsupported = "bin16";
-        break;
-      case 0xc6:
-        h.lengthSize = 4;
-        h.lengthIsPayload = true;
-        h.unsupported = "bin32";
-        break;
-      case 0xc7:
-        h.lengthSize = 1;
-        h.headerSize = 2;
-        h.lengthIsPayload = true;
-        h.unsupported = "ext8";
-        break;
-      case 0xc8:
-        h.lengthSize = 2;
-        h.headerSize = 2;
-        h.lengthIsPayload = true;
-        h.unsupported = "ext16";
-        break;
-      case 0xc9:
-        h.lengthSize = 4;
-        h.headerSize = 2;
-        h.lengthIsPayload = true;
-        h.unsupported = "ext32";
-        break;
-      case 0xca:
-        h.payloadSize = 4;
-        break;
-      case 0xcb:
-        h.payloadSize = 8;
-        break;
-      case 0xcc:
-        h.payloadSize = 1;
-        h.number = Header::Number::kUnsigned;
-        break;
-      case 0xcd:
-        h.payloadSize = 2;
-        h.number = Header::Number::kUnsigned;
-        break;
-      case 0xce:
-        h.payloadSize = 4;
-        h.number = Header::Number::kUnsigned;
-        break;
-      case 0xcf:
-        h.payloadSize = 8;
-        h.number = Header::Number::kUnsigned;
-        break;
-      case 0xd0:
-        h.payloadSize = 1;
-        h.number = Header::Number::kSigned;
-        break;
-      case 0xd1:
-        h.payloadSize = 2;
-        h.number = Header::Number::kSigned;
-        break;
-      case 0xd2:
-        h.payloadSize = 4;
-        h.number = Header::Number::kSigned;
-        break;
-      case 0xd3:
-        h.payloadSize = 8;
-        h.number = Header::Number::kSigned;
-        break;
-      case 0xd4:
-        h.headerSize = 2;
-        h.payloadSize = 1;
-        h.unsupported = "fixext1";
-        break;
-      case 0xd5:
-        h.headerSize = 2;
-        h.payloadSize = 2;
-        h.unsupported = "fixext2";
-        break;
-      case 0xd6:
-        h.headerSize = 2;
-        h.payloadSize = 4;
-        h.unsupported = "fixext4";
-        break;
-      case 0xd7:
-        h.headerSize = 2;
-        h.payloadSize = 8;
-        h.unsupported = "fixext8";
-        break;
-      case 0xd8:
-        h.headerSize = 2;
-        h.payloadSize = 16;
-        h.unsupported = "fixext16";
-        break;
-      case 0xd9:
-        h.lengthSize = 1;
-        h.lengthIsPayload = true;
-        h.isString = true;
-        break;
-      case 0xda:
-        h.lengthSize = 2;
-        h.lengthIsPayload = true;
-        h.isString = true;
-        break;
-      case 0xdb:
-        h.lengthSize = 4;
-        h.lengthIsPayload = true;
-        h.isString = true;
-        break;
-      case 0xdc:
-        h.kind = Header::Kind::kArray;
-        h.lengthSize = 2;
-        break;
-      case 0xdd:
-        h.kind = Header::Kind::kArray;
-        h.lengthSize = 4;
-        break;
-      case 0xde:
-        h.kind = Header::Kind::kMap;
-        h.lengthSize = 2;
-        break;
-      case 0xdf:
-        h.kind = Header::Kind::kMap;
-        h.lengthSize = 4;
-        break;
-      default:
-        break;
-    }
-  }
-  return h;
+  if (b <= 0x7f) return Integer(0, kUnsigned);  // positive fixint, the value in the byte
+  if (b <= 0x8f) return Container(Header::Kind::kMap, 0, b & 0x0fu);
+  if (b <= 0x9f) return Container(Header::Kind::kArray, 0, b & 0x0fu);
+  if (b <= 0xbf) return FixStr(b & 0x1fu);
+  if (b >= 0xe0) return Integer(0, kSigned);  // negative fixint
+  return kFormats[b - 0xc0];
 }
 
 // Whether element 0 of an integer value is >= 0, and its value then. `format` is the format
@@ -233,9 +180,9 @@ ScanResult ScanMessagePack(std::span<const uint8_t> bytes) {
     const Header h = Classify(format);
     if (h.kind == Header::Kind::kInvalid) return fail(ScanResult::Form::kInvalidByte);
     const size_t left = size - pos;
-    if (left < h.headerSize + h.lengthSize) return fail(ScanResult::Form::kTruncated);
-    const uint64_t length = ReadBigEndian(data + pos + h.headerSize, h.lengthSize);
-    pos += h.headerSize + h.lengthSize;
+    if (left < 1 + h.lengthSize + h.typeSize) return fail(ScanResult::Form::kTruncated);
+    const uint64_t length = ReadBigEndian(data + pos + 1, h.lengthSize);
+    pos += 1 + h.lengthSize + h.typeSize;
 
     uint64_t payload = h.payloadSize;
     if (h.lengthIsPayload) payload = length;

@@ -1,0 +1,169 @@
+#include "protocol/Frame.h"
+
+#include <gtest/gtest.h>
+
+#include <cstdint>
+#include <stdexcept>
+#include <vector>
+
+namespace tavrin::protocol {
+namespace {
+
+using Bytes = std::vector<uint8_t>;
+
+Bytes Body(size_t size, uint8_t seed) {
+  Bytes body(size);
+  for (size_t i = 0; i < size; ++i) body[i] = static_cast<uint8_t>(seed + i * 7);
+  return body;
+}
+
+Bytes Concat(const std::vector<Bytes>& parts) {
+  Bytes all;
+  for (const Bytes& part : parts) all.insert(all.end(), part.begin(), part.end());
+  return all;
+}
+
+// Drains every complete frame; stops at kNeedMore or kBadLength and reports which.
+FrameReader::Status Drain(FrameReader& reader, std::vector<Bytes>& frames) {
+  for (;;) {
+    const FrameReader::Status status = reader.Next();
+    if (status != FrameReader::Status::kFrame) return status;
+    frames.emplace_back(reader.Body().begin(), reader.Body().end());
+  }
+}
+
+TEST(FrameTest, EncodeWritesBigEndianLengthThenBody) {
+  const Bytes body = Body(0x010203, 1);
+  const Bytes frame = EncodeFrame(body);
+  ASSERT_EQ(frame.size(), 4 + body.size());
+  EXPECT_EQ(frame[0], 0x00);
+  EXPECT_EQ(frame[1], 0x01);
+  EXPECT_EQ(frame[2], 0x02);
+  EXPECT_EQ(frame[3], 0x03);
+  EXPECT_EQ(Bytes(frame.begin() + 4, frame.end()), body);
+}
+
+TEST(FrameTest, EncodeRefusesAnEmptyBody) { EXPECT_THROW(EncodeFrame({}), std::length_error); }
+
+TEST(FrameTest, ByteAtATimeYieldsEveryFrameOnceAndInOrder) {
+  const std::vector<Bytes> bodies = {Body(1, 0), Body(300, 1), Body(5, 2), Body(70000, 3)};
+  std::vector<Bytes> encoded;
+  for (const Bytes& body : bodies) encoded.push_back(EncodeFrame(body));
+  const Bytes stream = Concat(encoded);
+
+  FrameReader reader;
+  std::vector<Bytes> frames;
+  size_t boundary = 0;
+  size_t frameIndex = 0;
+  for (size_t i = 0; i < stream.size(); ++i) {
+    reader.Append({&stream[i], 1});
+    ASSERT_EQ(Drain(reader, frames), FrameReader::Status::kNeedMore);
+    if (i + 1 == boundary + encoded[frameIndex].size()) {
+      // The last byte of a frame completes it, and the stream is then at a boundary.
+      ASSERT_EQ(frames.size(), frameIndex + 1);
+      EXPECT_FALSE(reader.InsideFrame());
+      boundary = i + 1;
+      ++frameIndex;
+    } else {
+      ASSERT_EQ(frames.size(), frameIndex) << "frame yielded early at byte " << i;
+      EXPECT_TRUE(reader.InsideFrame()) << "byte " << i;
+    }
+  }
+  EXPECT_EQ(frames, bodies);
+  EXPECT_EQ(reader.Buffered(), 0u);
+}
+
+TEST(FrameTest, OneBigChunkYieldsAllFramesAndKeepsThePartialTail) {
+  std::vector<Bytes> bodies;
+  std::vector<Bytes> encoded;
+  for (int i = 0; i < 200; ++i) {
+    bodies.push_back(Body(1 + i * 13, static_cast<uint8_t>(i)));
+    encoded.push_back(EncodeFrame(bodies.back()));
+  }
+  Bytes stream = Concat(encoded);
+  const Bytes next = EncodeFrame(Body(40, 9));
+  stream.insert(stream.end(), next.begin(), next.begin() + 10);  // header and 6 body bytes
+
+  FrameReader reader;
+  reader.Append(stream);
+  std::vector<Bytes> frames;
+  EXPECT_EQ(Drain(reader, frames), FrameReader::Status::kNeedMore);
+  EXPECT_EQ(frames, bodies);
+  EXPECT_TRUE(reader.InsideFrame());
+  EXPECT_EQ(reader.Buffered(), 10u);
+
+  reader.Append({next.data() + 10, next.size() - 10});
+  ASSERT_EQ(reader.Next(), FrameReader::Status::kFrame);
+  EXPECT_EQ(Bytes(reader.Body().begin(), reader.Body().end()), Body(40, 9));
+  EXPECT_FALSE(reader.InsideFrame());
+}
+
+TEST(FrameTest, PartialHeaderCountsAsInsideAFrame) {
+  FrameReader reader;
+  EXPECT_FALSE(reader.InsideFrame());
+  const Bytes half = {0x00, 0x00};
+  reader.Append(half);
+  EXPECT_EQ(reader.Next(), FrameReader::Status::kNeedMore);
+  EXPECT_TRUE(reader.InsideFrame());
+}
+
+TEST(FrameTest, ZeroLengthIsABadLength) {
+  FrameReader reader;
+  const Bytes stream = {0, 0, 0, 0, 0xc0};
+  reader.Append(stream);
+  EXPECT_EQ(reader.Next(), FrameReader::Status::kBadLength);
+  EXPECT_TRUE(reader.Failed());
+  EXPECT_EQ(reader.BadLength(), 0u);
+}
+
+TEST(FrameTest, LengthOverTheLimitFailsBeforeTheBodyArrives) {
+  FrameReader reader;
+  const uint32_t over = kDefaultFrameLimit + 1;
+  const Bytes header = {static_cast<uint8_t>(over >> 24), static_cast<uint8_t>(over >> 16),
+                        static_cast<uint8_t>(over >> 8), static_cast<uint8_t>(over)};
+  reader.Append(header);
+  EXPECT_EQ(reader.Next(), FrameReader::Status::kBadLength);
+  EXPECT_EQ(reader.BadLength(), over);
+  EXPECT_EQ(reader.Buffered(), 0u);
+}
+
+TEST(FrameTest, LargestLengthIsRefusedWithoutBuffering) {
+  FrameReader reader;
+  const Bytes header = {0xff, 0xff, 0xff, 0xff};
+  reader.Append(header);
+  EXPECT_EQ(reader.Next(), FrameReader::Status::kBadLength);
+  EXPECT_EQ(reader.BadLength(), 0xffffffffu);
+}
+
+TEST(FrameTest, LengthExactlyAtTheLimitIsAccepted) {
+  FrameReader reader(1000);
+  EXPECT_EQ(reader.FrameLimit(), 1000u);
+  const Bytes body = Body(1000, 4);
+  reader.Append(EncodeFrame(body));
+  ASSERT_EQ(reader.Next(), FrameReader::Status::kFrame);
+  EXPECT_EQ(Bytes(reader.Body().begin(), reader.Body().end()), body);
+
+  reader.Append(EncodeFrame(Body(1001, 4)));
+  EXPECT_EQ(reader.Next(), FrameReader::Status::kBadLength);
+  EXPECT_EQ(reader.BadLength(), 1001u);
+}
+
+TEST(FrameTest, BadLengthIsFinalAndLaterBytesAreIgnored) {
+  FrameReader reader(16);
+  const Bytes good = EncodeFrame(Body(3, 1));
+  Bytes stream = good;
+  const Bytes bad = EncodeFrame(Body(17, 1));
+  stream.insert(stream.end(), bad.begin(), bad.end());
+  reader.Append(stream);
+
+  // The frame before the bad length is still delivered.
+  ASSERT_EQ(reader.Next(), FrameReader::Status::kFrame);
+  EXPECT_EQ(reader.Next(), FrameReader::Status::kBadLength);
+  reader.Append(good);
+  EXPECT_EQ(reader.Next(), FrameReader::Status::kBadLength);
+  EXPECT_EQ(reader.Buffered(), 0u);
+  EXPECT_FALSE(reader.InsideFrame());
+}
+
+}  // namespace
+}  // namespace tavrin::protocol

@@ -1,0 +1,257 @@
+#include "protocol/MessagePack.h"
+
+#include <gtest/gtest.h>
+
+#include <cstdint>
+#include <limits>
+#include <string>
+#include <vector>
+
+#include "tests/support/MessagePackBytes.h"
+
+namespace tavrin::protocol {
+namespace {
+
+using Bytes = std::vector<uint8_t>;
+using Form = ScanResult::Form;
+using tavrin::testing::IntFormat;
+using tavrin::testing::Pack;
+
+// `levels` arrays, each holding the next, around a nil.
+Bytes NestedArrays(int levels) {
+  Pack pack;
+  for (int i = 0; i < levels; ++i) pack.array(1);
+  pack.nil();
+  return pack;
+}
+
+// A value using every format that the parser accepts, nested a few levels.
+Bytes Mixed() {
+  return Pack()
+      .array(5)
+      .uint(7)
+      .map(3)
+      .str("a")
+      .integer(IntFormat::kInt16, static_cast<uint64_t>(-300))
+      .str("nested")
+      .array(3)
+      .float64(4.5)
+      .float32(0.25f)
+      .boolean(false)
+      .str(std::string(40, 'x'))
+      .array(2)
+      .nil()
+      .boolean(true)
+      .str(std::string(300, 'y'))
+      .integer(IntFormat::kUint64, std::numeric_limits<uint64_t>::max())
+      .integer(IntFormat::kNegativeFixint, static_cast<uint64_t>(-5));
+}
+
+TEST(MessagePackTest, MixedValueDecodesWithWireOrderAndSignedness) {
+  const DecodedValue decoded = DecodeMessagePack(Mixed());
+  ASSERT_TRUE(decoded.scan.Parsable()) << FormName(decoded.scan.form);
+  ASSERT_TRUE(decoded.value);
+  const Value& v = *decoded.value;
+  EXPECT_EQ(decoded.scan.depth, 3);
+  EXPECT_EQ(decoded.scan.topLevelArraySize, 5u);
+  ASSERT_EQ(v.size(), 5u);
+  EXPECT_TRUE(v[0].is_number_unsigned());
+  EXPECT_EQ(v[1].begin().key(), "a");
+  EXPECT_EQ(v[1]["a"].get<int64_t>(), -300);
+  EXPECT_EQ(v[1]["nested"][1].get<double>(), 0.25);
+  EXPECT_EQ(v[1][std::string(40, 'x')], Value::array({nullptr, true}));
+  EXPECT_EQ(v[2].get<std::string>().size(), 300u);
+  EXPECT_EQ(v[3].get<uint64_t>(), std::numeric_limits<uint64_t>::max());
+  EXPECT_EQ(v[4].get<int64_t>(), -5);
+}
+
+TEST(MessagePackTest, EncodeThenDecodeGivesTheSameValue) {
+  Value value = *DecodeMessagePack(Mixed()).value;
+  const DecodedValue again = DecodeMessagePack(EncodeMessagePack(value));
+  ASSERT_TRUE(again.value);
+  EXPECT_EQ(*again.value, value);
+}
+
+TEST(MessagePackTest, DepthCountsArraysAndMapsOneLevelEach) {
+  EXPECT_EQ(ScanMessagePack(Pack().nil()).depth, 0);
+  EXPECT_EQ(ScanMessagePack(Pack().array(0)).depth, 1);
+  EXPECT_EQ(ScanMessagePack(Pack().map(0)).depth, 1);
+  EXPECT_EQ(ScanMessagePack(Pack().array(2).uint(1).array(0)).depth, 2);
+  // The deepest branch counts, not the last one.
+  EXPECT_EQ(ScanMessagePack(Pack().array(2).map(1).str("k").array(1).nil().uint(1)).depth, 3);
+}
+
+TEST(MessagePackTest, DepthAtTheLimitIsAcceptedAndOneMoreIsNot) {
+  const DecodedValue atLimit = DecodeMessagePack(NestedArrays(kMaxNestingDepth));
+  EXPECT_EQ(atLimit.scan.depth, kMaxNestingDepth);
+  EXPECT_FALSE(atLimit.scan.tooDeep);
+  EXPECT_TRUE(atLimit.value);
+
+  const DecodedValue over = DecodeMessagePack(NestedArrays(kMaxNestingDepth + 1));
+  EXPECT_TRUE(over.scan.WellFormed());
+  EXPECT_TRUE(over.scan.tooDeep);
+  EXPECT_FALSE(over.value);
+}
+
+TEST(MessagePackTest, EmptyContainerBeyondTheLimitIsTooDeep) {
+  Pack pack;
+  for (int i = 0; i < kMaxNestingDepth; ++i) pack.array(1);
+  pack.map(0);
+  EXPECT_TRUE(ScanMessagePack(pack).tooDeep);
+}
+
+// 12 KB of nested arrays would overflow the stack of a recursive parser in a debug build; the
+// scan must refuse it without parsing, and still check the form of what follows.
+TEST(MessagePackTest, TwelveKilobytesOfNestingIsTooDeepNotACrash) {
+  const Bytes deep = NestedArrays(12 * 1024);
+  const DecodedValue decoded = DecodeMessagePack(deep);
+  EXPECT_TRUE(decoded.scan.WellFormed());
+  EXPECT_TRUE(decoded.scan.tooDeep);
+  EXPECT_EQ(decoded.scan.depth, kMaxNestingDepth + 1);
+  EXPECT_FALSE(decoded.value);
+
+  // The same nesting of maps, each with a key and a sibling after the nested value.
+  Pack maps;
+  for (int i = 0; i < 4000; ++i) maps.map(2).str("k");
+  maps.nil();
+  for (int i = 0; i < 4000; ++i) maps.str("s").uint(1);
+  const ScanResult scan = ScanMessagePack(maps);
+  EXPECT_TRUE(scan.WellFormed());
+  EXPECT_TRUE(scan.tooDeep);
+
+  // Cut one byte short: a form fault, which the depth must not hide.
+  Bytes cut = maps.bytes();
+  cut.pop_back();
+  EXPECT_EQ(ScanMessagePack(cut).form, Form::kTruncated);
+}
+
+TEST(MessagePackTest, EveryPrefixOfAValueIsTruncated) {
+  const Bytes whole = Mixed();
+  for (size_t size = 0; size < whole.size(); ++size) {
+    const DecodedValue decoded = DecodeMessagePack({whole.data(), size});
+    EXPECT_EQ(decoded.scan.form, Form::kTruncated) << "prefix of " << size << " bytes";
+    EXPECT_FALSE(decoded.value);
+  }
+}
+
+TEST(MessagePackTest, BytesAfterTheValueAreRefused) {
+  Bytes bytes = Pack().array(1).uint(1);
+  bytes.push_back(0xc0);
+  const DecodedValue decoded = DecodeMessagePack(bytes);
+  EXPECT_EQ(decoded.scan.form, Form::kTrailingBytes);
+  EXPECT_EQ(decoded.scan.offset, 2u);
+  EXPECT_FALSE(decoded.value);
+}
+
+TEST(MessagePackTest, NeverUsedByteIsInvalid) {
+  EXPECT_EQ(ScanMessagePack(Pack().array(2).uint(1).raw({0xc1})).form, Form::kInvalidByte);
+}
+
+// Declared lengths are checked against what is left before anything is believed.
+TEST(MessagePackTest, HugeDeclaredLengthsAreTruncationsNotAllocations) {
+  const std::vector<Bytes> claims = {
+      Pack().big(0xdb, 0xffffffff, 4).str("abc"),                 // str32 of 4 GB
+      Pack().big(0xdd, 0xffffffff, 4).nil(),                      // array32 of 4G elements
+      Pack().big(0xdf, 0xffffffff, 4).str("k").nil(),             // map32 of 4G pairs
+      Pack().array(2).uint(1).big(0xc6, 0xfffffff0, 4),           // bin32
+      Pack().array(2).uint(1).big(0xc9, 0xfffffff0, 4).raw({1}),  // ext32
+      Pack().big(0xdc, 3, 2).nil().nil(),                         // one element short
+      Pack().map(1).str("k"),                                     // a key without its value
+  };
+  for (size_t i = 0; i < claims.size(); ++i) {
+    const DecodedValue decoded = DecodeMessagePack(claims[i]);
+    EXPECT_EQ(decoded.scan.form, Form::kTruncated) << "claim " << i;
+    EXPECT_FALSE(decoded.value);
+  }
+}
+
+TEST(MessagePackTest, BinAndExtAreNamedAndNotParsed) {
+  struct Case {
+    Bytes bytes;
+    std::string_view name;
+  };
+  const std::vector<Case> cases = {
+      {Pack().big(0xc4, 2, 1).raw({1, 2}), "bin8"},
+      {Pack().big(0xc5, 1, 2).raw({1}), "bin16"},
+      {Pack().big(0xc6, 0, 4), "bin32"},
+      {Pack().big(0xc7, 1, 1).raw({5, 9}), "ext8"},
+      {Pack().big(0xc8, 0, 2).raw({5}), "ext16"},
+      {Pack().big(0xc9, 2, 4).raw({5, 9, 9}), "ext32"},
+      {Pack().raw({0xd4, 5, 1}), "fixext1"},
+      {Pack().raw({0xd5, 5, 1, 2}), "fixext2"},
+      {Pack().raw({0xd6, 5, 1, 2, 3, 4}), "fixext4"},
+      {Pack().raw({0xd7, 5}).big(0, 0, 7), "fixext8"},
+      {Pack().raw({0xd8, 5}).big(0, 0, 15), "fixext16"},
+  };
+  for (const Case& c : cases) {
+    // Inside a request, after other elements, so the scan must skip over it correctly.
+    const Bytes wrapped = Pack().array(3).uint(4).map(1).str("k").append(c.bytes).uint(9);
+    const DecodedValue decoded = DecodeMessagePack(wrapped);
+    EXPECT_TRUE(decoded.scan.WellFormed()) << c.name;
+    EXPECT_EQ(decoded.scan.unsupportedType, c.name);
+    EXPECT_FALSE(decoded.value) << c.name;
+    EXPECT_EQ(decoded.scan.firstValue, 4u);
+  }
+}
+
+TEST(MessagePackTest, NonStringMapKeysAreFoundAtAnyDepth) {
+  EXPECT_TRUE(ScanMessagePack(Pack().map(1).uint(1).nil()).nonStringKey);
+  EXPECT_TRUE(ScanMessagePack(Pack().map(1).nil().nil()).nonStringKey);
+  EXPECT_TRUE(ScanMessagePack(Pack().map(1).array(0).nil()).nonStringKey);
+  EXPECT_TRUE(
+      ScanMessagePack(Pack().array(2).uint(1).map(2).str("a").nil().uint(2).nil()).nonStringKey);
+  // Values may be anything; only keys must be strings.
+  const DecodedValue ok =
+      DecodeMessagePack(Pack().map(2).str("a").uint(1).str("b").map(1).str("c").array(0));
+  EXPECT_FALSE(ok.scan.nonStringKey);
+  EXPECT_TRUE(ok.value);
+}
+
+TEST(MessagePackTest, FirstElementOfTopLevelArrayIsClassified) {
+  using First = ScanResult::First;
+  struct Case {
+    Bytes bytes;
+    First first;
+    uint64_t value;
+  };
+  const std::vector<Case> cases = {
+      {Pack().array(2).uint(0).nil(), First::kUnsigned, 0},
+      {Pack().array(1).integer(IntFormat::kUint64, ~uint64_t{0}), First::kUnsigned, ~uint64_t{0}},
+      {Pack().array(1).integer(IntFormat::kInt8, 5), First::kUnsigned, 5},
+      {Pack().array(1).integer(IntFormat::kInt64, INT64_MAX), First::kUnsigned, INT64_MAX},
+      {Pack().array(1).integer(IntFormat::kInt8, static_cast<uint64_t>(-1)), First::kOther, 0},
+      {Pack().array(1).integer(IntFormat::kNegativeFixint, static_cast<uint64_t>(-1)),
+       First::kOther, 0},
+      {Pack().array(1).nil(), First::kNil, 0},
+      {Pack().array(1).float64(1.0), First::kOther, 0},
+      {Pack().array(1).str("1"), First::kOther, 0},
+      {Pack().array(1).array(1).uint(1), First::kOther, 0},
+      {Pack().array(0), First::kAbsent, 0},
+      {Pack().map(1).str("a").uint(1), First::kAbsent, 0},
+      {Pack().uint(3), First::kAbsent, 0},
+  };
+  for (size_t i = 0; i < cases.size(); ++i) {
+    const ScanResult scan = ScanMessagePack(cases[i].bytes);
+    EXPECT_EQ(scan.first, cases[i].first) << "case " << i;
+    if (cases[i].first == First::kUnsigned) {
+      EXPECT_EQ(scan.firstValue, cases[i].value) << "case " << i;
+    }
+  }
+}
+
+TEST(MessagePackTest, DuplicateKeyKeepsFirstPlaceAndLastValue) {
+  const DecodedValue decoded =
+      DecodeMessagePack(Pack().map(3).str("a").uint(1).str("b").uint(2).str("a").uint(3));
+  ASSERT_TRUE(decoded.value);
+  EXPECT_EQ(decoded.value->dump(), R"({"a":3,"b":2})");
+}
+
+TEST(MessagePackTest, InvalidUtf8StringsDecodeAndReencode) {
+  const Bytes bytes = Pack().array(1).raw({0xa2, 0xff, 0xfe});
+  const DecodedValue decoded = DecodeMessagePack(bytes);
+  ASSERT_TRUE(decoded.value);
+  EXPECT_EQ(EncodeMessagePack(*decoded.value), bytes);
+}
+
+}  // namespace
+}  // namespace tavrin::protocol
