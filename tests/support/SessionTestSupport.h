@@ -1,0 +1,105 @@
+#pragma once
+
+#include <cstdlib>
+#include <ctime>
+#include <memory>
+#include <regex>
+#include <string>
+#include <vector>
+
+#include <gtest/gtest.h>
+
+#include "Statistics/Service/RuvoReportingSession.h"
+#include "platform/SystemLog.h"
+#include "tests/fakes/FakeLogSystem.h"
+#include "tests/fakes/FakePlatform.h"
+#include "tests/fakes/RecordingTraceRecorder.h"
+
+namespace tavrin::testing {
+
+// The log facility of a whole test executable. Sessions register their log scope once per
+// process, with whichever facility is installed at the time, so that facility must outlive every
+// test: it is made on first use and never destroyed.
+inline FakeLogSystem& ProcessLogSystem() {
+  static FakeLogSystem* const system = new FakeLogSystem();
+  return *system;
+}
+
+// The text of a logged line without its "file:line:function: " prefix.
+inline std::string LineMessage(const std::string& line) {
+  static const std::regex prefix("^[^:]+:[0-9]+:[^ ]*: ");
+  return std::regex_replace(line, prefix, "", std::regex_constants::format_first_only);
+}
+
+// Base of the session tests: a fresh fake platform per test, the process's log facility cleared,
+// trace points recorded, local time in UTC. The internal-build answer is fixed for the life of
+// the process at its first use, so every test of one executable must ask for the same answer.
+class SessionTestBase : public ::testing::Test {
+ protected:
+  explicit SessionTestBase(bool internalBuild = true) : log(ProcessLogSystem()) {
+    log.Clear();
+    log.SetVerbose(true);
+    log.FailRegistrations(false);
+    platform.deviceInfo.SetBool(kDeviceInfoInternalBuild, internalBuild);
+    setenv("TZ", "UTC", 1);
+    tzset();
+  }
+
+  std::shared_ptr<RuvoReportingSession> Create(int64_t reporterID = 42, uint16_t serviceType = 3) {
+    auto session = RuvoReportingSession::create(reporterID, {1234}, platform.services);
+    session->setServiceType(serviceType);
+    return session;
+  }
+
+  // Messages (prefix removed) of the session scope, in order; only those of `level` when given.
+  std::vector<std::string> SessionMessages() const { return Messages("rvrr", nullptr); }
+  std::vector<std::string> SessionMessages(LogLevel level) const {
+    return Messages("rvrr", &level);
+  }
+  std::vector<std::string> DefaultMessages(LogLevel level) const {
+    return Messages("default", &level);
+  }
+  size_t CountMessage(const std::string& message) const {
+    size_t count = 0;
+    for (const auto& line : log.Lines()) count += LineMessage(line.text) == message ? 1 : 0;
+    return count;
+  }
+  size_t CountMessage(const std::string& message, LogLevel level) const {
+    size_t count = 0;
+    for (const auto& line : log.Lines()) {
+      count += line.level == level && LineMessage(line.text) == message ? 1 : 0;
+    }
+    return count;
+  }
+
+  // The payloads of a list, or nothing when the list is gone.
+  static std::vector<Dictionary> Payloads(const std::shared_ptr<PayloadList>& list) {
+    std::vector<Dictionary> payloads;
+    if (!list) return payloads;
+    for (const auto& payload : list->Snapshot()) payloads.push_back(*payload);
+    return payloads;
+  }
+  static std::vector<Value> Entries(const std::shared_ptr<NestedPayloadList>& list) {
+    std::vector<Value> entries;
+    if (!list) return entries;
+    for (const auto& entry : list->Snapshot()) entries.push_back(entry.ToValue());
+    return entries;
+  }
+
+  FakeLogSystem& log;
+  FakePlatform platform;
+  RecordingTraceRecorder traces;
+
+ private:
+  std::vector<std::string> Messages(const std::string& scope, const LogLevel* level) const {
+    std::vector<std::string> messages;
+    for (const auto& line : log.Lines()) {
+      if (line.scope != scope) continue;
+      if (level != nullptr && line.level != *level) continue;
+      messages.push_back(LineMessage(line.text));
+    }
+    return messages;
+  }
+};
+
+}  // namespace tavrin::testing

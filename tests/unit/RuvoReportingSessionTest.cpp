@@ -1,0 +1,635 @@
+// Session lifecycle against the back-ends, the message path and the standalone single-message
+// path, on the fake platform (time moves only when a test moves it).
+
+#include <chrono>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include <gtest/gtest.h>
+
+#include "Statistics/RuvoReportingUtility.h"
+#include "Statistics/Service/RuvoReportingSession.h"
+#include "platform/TracePoints.h"
+#include "tests/support/SessionTestSupport.h"
+
+namespace tavrin::testing {
+namespace {
+
+using std::chrono::milliseconds;
+using std::chrono::seconds;
+using Discovery = FakeTelvoroService::Discovery;
+
+constexpr uint16_t kHaptics = 3;
+
+class SessionTest : public SessionTestBase {
+ protected:
+  // Starts `session` and runs the queued half of start (up to the back-end wait).
+  void StartAndRun(const std::shared_ptr<RuvoReportingSession>& session) {
+    session->start();
+    platform.dispatcher.RunUntilIdle();
+  }
+
+  std::vector<int64_t> Sequence(const std::shared_ptr<FakeTelvoroSession>& session) {
+    std::vector<int64_t> sequence;
+    for (const auto& message : session->Messages()) {
+      // The summary carries "seq" too, as text; only the messages themselves count here.
+      const auto seq = message.payload.find("seq");
+      if (seq != message.payload.end() && seq->is_number()) sequence.push_back(seq->get<int64_t>());
+    }
+    return sequence;
+  }
+};
+
+// --- creation and release ---------------------------------------------------------------------
+
+TEST_F(SessionTest, CreationSetsDefaultsQueueLogScopeAndTracePoint) {
+  auto session = RuvoReportingSession::create(-7, {11, 12}, platform.services);
+  EXPECT_EQ(session->reporterID(), -7);
+  EXPECT_EQ(session->processIdentifiers(), (std::vector<int32_t>{11, 12}));
+  EXPECT_EQ(session->serviceType(), 0xFFFF);
+  EXPECT_EQ(session->serviceName(), "unknown");
+  EXPECT_FALSE(session->started());
+  EXPECT_FALSE(session->telvoroSessionStarted());
+  EXPECT_EQ(session->telvoroSession(), nullptr);
+  EXPECT_EQ(session->userInfo(), Dictionary::object());
+  EXPECT_EQ(session->messageTypeCounts(), Dictionary::object());
+  ASSERT_NE(session->aggregatedPayloadData(), nullptr);
+  ASSERT_NE(session->nestedAggregatedPayloadData(), nullptr);
+  EXPECT_FALSE(session->orientationCallbackID().has_value());
+
+  const auto queues = platform.dispatcher.CreatedQueues();
+  ASSERT_EQ(queues.size(), 1u);
+  EXPECT_EQ(queues[0].label, "com.quorvex.tavrin.session.telvoro");
+  EXPECT_EQ(queues[0].qos, QualityOfService::kUtility);
+
+  const auto registrations = log.Registrations();
+  ASSERT_EQ(registrations.count("rvrr"), 1u);
+  const auto& scope = registrations.at("rvrr");
+  EXPECT_TRUE(scope.enabled);
+  EXPECT_EQ(scope.code, FourCharCode("rvrr"));
+  EXPECT_EQ(scope.subsystem, "com.quorvex.tavrin");
+  EXPECT_EQ(scope.verbosityKey, "reporting_session_verbose");
+  EXPECT_EQ(scope.level, 31);
+
+  EXPECT_EQ(CountMessage("created reporting session for ID: -7", LogLevel::kInfo), 1u);
+  EXPECT_EQ(traces.Count(trace::kSessionCreated), 1u);
+  EXPECT_EQ(traces.Count(trace::kSessionReleased), 0u);
+
+  session.reset();
+  EXPECT_EQ(traces.Count(trace::kSessionReleased), 1u);
+  EXPECT_EQ(CountMessage("deallocing this session -7", LogLevel::kInfo), 1u);
+}
+
+TEST_F(SessionTest, SettersNameTheTypeAndMergeConfiguration) {
+  auto session = Create();
+  session->setServiceType(2);
+  EXPECT_EQ(session->serviceName(), "telephony");
+  EXPECT_EQ(CountMessage("setting service type telephony", LogLevel::kInfo), 1u);
+  session->setServiceType(200);  // a code without a name
+  EXPECT_EQ(session->serviceType(), 200);
+  EXPECT_FALSE(session->serviceName().has_value());
+  EXPECT_EQ(CountMessage("setting service type (null)", LogLevel::kInfo), 1u);
+
+  session->setConfiguration(Dictionary{{"a", 1}, {"b", 2}});
+  session->updateDefaults(Dictionary{{"b", 3}, {"c", "x"}});
+  session->setConfiguration(Dictionary());               // none: nothing changes
+  session->setConfiguration(Dictionary::array({1, 2}));  // not a dictionary: refused, logged
+  EXPECT_EQ(session->userInfo(), (Dictionary{{"a", 1}, {"b", 3}, {"c", "x"}}));
+  EXPECT_EQ(SessionMessages(LogLevel::kError).size(), 1u);
+}
+
+// --- the back-end wait ------------------------------------------------------------------------
+
+TEST_F(SessionTest, BackendsThatNeverAnswerDropTheSessionAfterNineSecondsAndAggregationGoesOn) {
+  platform.telvoro.SetDiscovery(Discovery::kNeverAnswer);
+  auto session = Create();
+  StartAndRun(session);
+
+  auto fake = platform.telvoro.LastSession();
+  ASSERT_NE(fake, nullptr);
+  EXPECT_EQ(session->telvoroSession(), fake);
+  EXPECT_TRUE(fake->DiscoveryPending());
+  EXPECT_EQ(CountMessage("waiting for telvorod to find backends", LogLevel::kDefault), 1u);
+  EXPECT_TRUE(platform.dispatcher.IsSuspended(*session->telvoroQueue()));
+
+  // Messages sent during the wait queue up behind it.
+  for (int i = 0; i < 3; ++i) session->sendMessage(Dictionary{{"seq", i}}, 1, 1, nullptr);
+  platform.dispatcher.RunUntilIdle();
+  EXPECT_EQ(platform.dispatcher.PendingCount(*session->telvoroQueue()), 3u);
+
+  platform.dispatcher.AdvanceBy(milliseconds(8999));
+  EXPECT_TRUE(platform.dispatcher.IsSuspended(*session->telvoroQueue()));
+  EXPECT_EQ(session->telvoroSession(), fake);
+  EXPECT_EQ(CountMessage("failed to find backend"), 0u);
+
+  platform.dispatcher.AdvanceBy(milliseconds(1));
+  EXPECT_EQ(CountMessage("failed to find backend", LogLevel::kError), 1u);
+  EXPECT_EQ(CountMessage("continuing"), 0u);
+  EXPECT_FALSE(platform.dispatcher.IsSuspended(*session->telvoroQueue()));
+  EXPECT_EQ(platform.dispatcher.PendingCount(*session->telvoroQueue()), 0u);
+  EXPECT_EQ(session->telvoroSession(), nullptr);
+  EXPECT_FALSE(session->telvoroSessionStarted());
+  EXPECT_TRUE(session->started());
+  // The queued messages found no session: one error line each, nothing reached the back-end.
+  EXPECT_EQ(CountMessage("No valid TelvoroSession", LogLevel::kError), 3u);
+  EXPECT_TRUE(fake->Messages().empty());
+
+  // Still aggregating, so the summary is made; it too finds no session, and nothing is flushed.
+  session->sendMessage(Dictionary{{"seq", 3}}, 1, 1, nullptr);
+  EXPECT_EQ(Payloads(session->aggregatedPayloadData()).size(), 4u);
+  session->stop();
+  platform.dispatcher.RunUntilIdle();
+  EXPECT_EQ(CountMessage("sending summary event for reporter 42", LogLevel::kDefault), 1u);
+  EXPECT_EQ(CountMessage("No valid TelvoroSession", LogLevel::kError), 5u);
+  EXPECT_EQ(fake->FlushCount(), 0u);
+}
+
+TEST_F(SessionTest, BackendsAnsweringLaterReleaseQueuedMessagesInOrder) {
+  platform.telvoro.SetDiscovery(Discovery::kAnswerLater);
+  auto session = Create();
+  StartAndRun(session);
+  for (int i = 0; i < 5; ++i) session->sendMessage(Dictionary{{"seq", i}}, 1, 1, nullptr);
+  platform.dispatcher.AdvanceBy(seconds(5));
+  auto fake = platform.telvoro.LastSession();
+  EXPECT_TRUE(fake->Messages().empty());
+
+  // The answer may come from any thread; here from the test's.
+  EXPECT_EQ(platform.telvoro.AnswerPendingDiscoveries(
+                std::vector<std::string>{"sqlite:/a.db", "kafka:b"}),
+            1u);
+  EXPECT_EQ(CountMessage("List of backends [\"sqlite:/a.db\",\"kafka:b\"]", LogLevel::kDefault),
+            1u);
+  EXPECT_EQ(CountMessage("continuing", LogLevel::kDefault), 1u);
+  platform.dispatcher.RunUntilIdle();
+  EXPECT_EQ(Sequence(fake), (std::vector<int64_t>{0, 1, 2, 3, 4}));
+
+  // The time-out that was armed does nothing once the answer came.
+  platform.dispatcher.AdvanceBy(seconds(10));
+  EXPECT_EQ(CountMessage("failed to find backend"), 0u);
+  EXPECT_EQ(session->telvoroSession(), fake);
+  session->sendMessage(Dictionary{{"seq", 5}}, 1, 1, nullptr);
+  platform.dispatcher.RunUntilIdle();
+  EXPECT_EQ(Sequence(fake).size(), 6u);
+}
+
+TEST_F(SessionTest, AnAnswerBeforeTheWaitMeansNoWaitAtAll) {
+  platform.telvoro.SetDiscovery(Discovery::kAnswerAtOnce);
+  auto session = Create();
+  session->start();
+  session->sendMessage(Dictionary{{"seq", 0}}, 1, 1, nullptr);
+  platform.dispatcher.RunUntilIdle();
+  EXPECT_EQ(CountMessage("waiting for telvorod to find backends"), 0u);
+  EXPECT_EQ(CountMessage("continuing"), 0u);
+  EXPECT_EQ(CountMessage("List of backends [\"sqlite:/fake/tavrin.db\"]"), 1u);
+  EXPECT_FALSE(platform.dispatcher.IsSuspended(*session->telvoroQueue()));
+  EXPECT_EQ(Sequence(platform.telvoro.LastSession()), (std::vector<int64_t>{0}));
+}
+
+TEST_F(SessionTest, NoBackendListRunsIntoTheTimeOut) {
+  platform.telvoro.SetDiscovery(Discovery::kAnswerNil);
+  auto session = Create();
+  StartAndRun(session);
+  EXPECT_EQ(CountMessage("No backends found, this session won't get sent to the server",
+                         LogLevel::kError),
+            1u);
+  EXPECT_EQ(CountMessage("waiting for telvorod to find backends"), 1u);
+  EXPECT_NE(session->telvoroSession(), nullptr);
+  platform.dispatcher.AdvanceBy(seconds(9));
+  EXPECT_EQ(CountMessage("failed to find backend", LogLevel::kError), 1u);
+  EXPECT_EQ(session->telvoroSession(), nullptr);
+}
+
+TEST_F(SessionTest, AnAnswerAfterTheTimeOutChangesNothing) {
+  platform.telvoro.SetDiscovery(Discovery::kAnswerLater);
+  auto session = Create();
+  StartAndRun(session);
+  platform.dispatcher.AdvanceBy(seconds(9));
+  ASSERT_EQ(session->telvoroSession(), nullptr);
+  // Resuming the queue a second time would fail the test in the fake dispatcher.
+  platform.telvoro.AnswerPendingDiscoveries(std::vector<std::string>{"sqlite:/late.db"});
+  platform.dispatcher.RunUntilIdle();
+  EXPECT_EQ(CountMessage("List of backends [\"sqlite:/late.db\"]"), 1u);
+  EXPECT_EQ(CountMessage("continuing"), 0u);
+  EXPECT_EQ(session->telvoroSession(), nullptr);
+  EXPECT_FALSE(platform.dispatcher.IsSuspended(*session->telvoroQueue()));
+}
+
+TEST_F(SessionTest, AWaitingSessionStaysAliveUntilTheWaitEnds) {
+  platform.telvoro.SetDiscovery(Discovery::kNeverAnswer);
+  auto session = Create();
+  StartAndRun(session);
+  std::weak_ptr<RuvoReportingSession> weak = session;
+  session.reset();
+  EXPECT_FALSE(weak.expired());
+  platform.dispatcher.AdvanceBy(seconds(9));
+  EXPECT_TRUE(weak.expired());
+  EXPECT_EQ(CountMessage("deallocing this session 42"), 1u);
+}
+
+// --- session info and user info ---------------------------------------------------------------
+
+TEST_F(SessionTest, TheBackEndGetsSixSessionInfoEntriesAndTheMergedUserInfo) {
+  auto session = Create(-9223372036854775807LL - 1, 2);
+  session->setConfiguration(Dictionary{{"HostApplicationDisplayID", "com.example.app"}});
+  session->start();
+  // Configuration given before the queued step runs is part of what the back-end gets.
+  session->setConfiguration(Dictionary{{"late", true}});
+  platform.dispatcher.RunUntilIdle();
+
+  ASSERT_EQ(platform.telvoro.Tokens().size(), 1u);
+  EXPECT_EQ(platform.telvoro.TokenParents()[0], nullptr);
+  const auto token = platform.telvoro.Tokens()[0];
+  EXPECT_EQ(session->telvoroAgentToken(), token);
+
+  auto fake = platform.telvoro.LastSession();
+  const Dictionary& info = fake->SessionInfo();
+  EXPECT_EQ(info.size(), 6u);
+  EXPECT_TRUE(info["ClientType"].is_number_integer());
+  EXPECT_EQ(info["ClientType"], 19);
+  EXPECT_TRUE(info["ClientVersion"].is_number_float());
+  EXPECT_EQ(info["ClientVersion"].get<double>(), 2.0);
+  EXPECT_EQ(info["SessionID"].get<int64_t>(), -9223372036854775807LL - 1);
+  EXPECT_EQ(info["BatchEvent"], true);
+  EXPECT_EQ(info["HierarchyToken"].get<uint64_t>(), token->value);
+  EXPECT_EQ(info["ContainsRealtimeEvents"], false);
+
+  EXPECT_EQ(fake->UserInfo(), (Dictionary{{"ClientName", "com.quorvex.tavrin"},
+                                          {"ServiceName", "telephony_session"},
+                                          {"HostApplicationDisplayID", "com.example.app"},
+                                          {"late", true}}));
+  EXPECT_TRUE(fake->FrameworksToCheck().empty());
+}
+
+TEST_F(SessionTest, ApiUsageSessionsAreRealTimeAndAllOthersBatched) {
+  for (uint16_t type : {uint16_t{12}, uint16_t{0}, uint16_t{4}, uint16_t{0xFFFF}}) {
+    auto session = Create(1, type);
+    StartAndRun(session);
+    const Dictionary& info = platform.telvoro.LastSession()->SessionInfo();
+    EXPECT_EQ(info["BatchEvent"], type != 12) << type;
+    EXPECT_EQ(info["ContainsRealtimeEvents"], type == 12) << type;
+  }
+}
+
+TEST_F(SessionTest, ClientEntriesOverrideTheServiceNameAndEmptyUserInfoAddsNothing) {
+  auto plain = Create(1, 7);
+  StartAndRun(plain);
+  EXPECT_EQ(
+      platform.telvoro.LastSession()->UserInfo(),
+      (Dictionary{{"ClientName", "com.quorvex.tavrin"}, {"ServiceName", "longformaudio_session"}}));
+
+  auto renamed = Create(2, 7);
+  renamed->setConfiguration(Dictionary{{"ServiceName", "mine"}, {"ClientName", "other"}});
+  StartAndRun(renamed);
+  EXPECT_EQ(platform.telvoro.LastSession()->UserInfo(),
+            (Dictionary{{"ClientName", "other"}, {"ServiceName", "mine"}}));
+
+  auto unnamed = Create(3, 300);
+  StartAndRun(unnamed);
+  EXPECT_EQ(platform.telvoro.LastSession()->UserInfo(),
+            (Dictionary{{"ClientName", "com.quorvex.tavrin"}}));
+}
+
+// --- start and stop ---------------------------------------------------------------------------
+
+TEST_F(SessionTest, TestSessionsGetNoBackEndButStillSummarise) {
+  auto session = Create(5, 11);
+  StartAndRun(session);
+  EXPECT_TRUE(platform.telvoro.Tokens().empty());
+  EXPECT_TRUE(platform.telvoro.Sessions().empty());
+  EXPECT_EQ(session->telvoroAgentToken(), nullptr);
+
+  session->sendMessage(Dictionary{{"a", 1}}, 1, 1, nullptr);
+  platform.dispatcher.RunUntilIdle();
+  EXPECT_EQ(CountMessage("transactions aren't allowed on this platform", LogLevel::kInfo), 1u);
+
+  session->stop();
+  platform.dispatcher.RunUntilIdle();
+  EXPECT_EQ(CountMessage("sending summary event for reporter 5"), 1u);
+  EXPECT_EQ(CountMessage("transactions aren't allowed on this platform"), 2u);
+  EXPECT_EQ(platform.fileSystem.Files().size(), 1u);
+  EXPECT_TRUE(platform.telvoro.SingleMessages().empty());
+}
+
+TEST_F(SessionTest, StartingTwiceChangesNothing) {
+  auto session = Create();
+  StartAndRun(session);
+  session->sendMessage(Dictionary{{"a", 1}}, 1, 1, nullptr);
+  const auto list = session->aggregatedPayloadData();
+  session->start();
+  platform.dispatcher.RunUntilIdle();
+  EXPECT_EQ(CountMessage("42 is already started", LogLevel::kInfo), 1u);
+  EXPECT_EQ(session->aggregatedPayloadData(), list);
+  EXPECT_EQ(Payloads(list).size(), 1u);
+  EXPECT_EQ(platform.telvoro.Sessions().size(), 1u);
+  EXPECT_EQ(traces.Count(trace::kSessionStarted), 1u);
+}
+
+TEST_F(SessionTest, StoppingANeverStartedSessionDoesNothing) {
+  auto session = Create();
+  session->sendMessage(Dictionary{{"a", 1}}, 1, 1, nullptr);
+  session->stop();
+  platform.dispatcher.RunUntilIdle();
+  EXPECT_FALSE(session->started());
+  EXPECT_EQ(CountMessage("sending summary event for reporter 42"), 0u);
+  EXPECT_TRUE(platform.fileSystem.CreateDirectoriesCalls().empty());
+  EXPECT_TRUE(platform.telvoro.Sessions().empty());
+  EXPECT_EQ(traces.Count(trace::kSessionStopped), 0u);
+  // The message of the never-started session went out alone; the lists made at creation stay.
+  EXPECT_EQ(platform.telvoro.SingleMessages().size(), 1u);
+  EXPECT_NE(session->aggregatedPayloadData(), nullptr);
+}
+
+TEST_F(SessionTest, StopFlushesAfterEveryQueuedMessageAndDropsTheLists) {
+  platform.telvoro.SetDiscovery(Discovery::kAnswerLater);
+  auto session = Create();
+  StartAndRun(session);
+  for (int i = 0; i < 3; ++i) session->sendMessage(Dictionary{{"seq", i}}, 1, 1, nullptr);
+  session->stop();
+  EXPECT_FALSE(session->started());
+  EXPECT_EQ(session->aggregatedPayloadData(), nullptr);
+  EXPECT_EQ(session->nestedAggregatedPayloadData(), nullptr);
+  EXPECT_EQ(traces.Count(trace::kSessionStopped), 1u);
+  auto fake = platform.telvoro.LastSession();
+  EXPECT_EQ(fake->FlushCount(), 0u);  // still behind the wait
+
+  platform.telvoro.AnswerPendingDiscoveries(std::vector<std::string>{"sqlite:/a.db"});
+  platform.dispatcher.RunUntilIdle();
+  // Three messages and the summary, then the flush.
+  EXPECT_EQ(fake->MessagesAtFlush(), (std::vector<size_t>{4}));
+  EXPECT_EQ(fake->Messages().back().category, 0xFFFF);
+  EXPECT_EQ(fake->Messages().back().type, 0xFFFF);
+  EXPECT_EQ(session->telvoroSession(), nullptr);
+}
+
+TEST_F(SessionTest, FlushErrorsAreLogged) {
+  platform.telvoro.FailFlushes(Error{"domain", 5, "disk full"});
+  auto session = Create();
+  StartAndRun(session);
+  session->stop();
+  platform.dispatcher.RunUntilIdle();
+  EXPECT_EQ(CountMessage("flush error disk full", LogLevel::kError), 1u);
+}
+
+TEST_F(SessionTest, RestartGetsANewBackEndSessionFreshListsAndCountsOn) {
+  auto session = Create();
+  StartAndRun(session);
+  session->sendMessage(Dictionary{{"a", 1}}, 1, 1, nullptr);
+  session->sendMessage(Dictionary{{"a", 2}}, 1, 1, nullptr);
+  session->stop();
+  platform.dispatcher.RunUntilIdle();
+
+  StartAndRun(session);
+  EXPECT_EQ(platform.telvoro.Sessions().size(), 2u);
+  EXPECT_EQ(platform.telvoro.Tokens().size(), 2u);
+  EXPECT_TRUE(Payloads(session->aggregatedPayloadData()).empty());
+  EXPECT_EQ(session->messageIdForCategory(1, 1), "Generic_Start_3");
+  EXPECT_EQ(session->messageTypeCounts()["Undefined_Unknown"], 1);  // the first summary
+}
+
+// --- the message path -------------------------------------------------------------------------
+
+TEST_F(SessionTest, BlanksInKeysBecomeUnderscoresEverywhere) {
+  auto session = Create();
+  StartAndRun(session);
+  const Dictionary payload{{"engine on time", 5}, {"plain", "a b"}, {" x  y ", 1}};
+  session->sendMessage(payload, 1, 1, nullptr);
+  platform.dispatcher.RunUntilIdle();
+
+  const Dictionary cleaned{{"engine_on_time", 5}, {"plain", "a b"}, {"_x__y_", 1}};
+  const auto messages = platform.telvoro.LastSession()->Messages();
+  ASSERT_EQ(messages.size(), 1u);
+  EXPECT_EQ(messages[0].payload, cleaned);
+  EXPECT_EQ(Payloads(session->aggregatedPayloadData()), std::vector<Dictionary>{cleaned});
+  const std::vector<Value> nested{Value{{"Generic_Start_1", cleaned}}};
+  EXPECT_EQ(Entries(session->nestedAggregatedPayloadData()), nested);
+  // The debug line shows the message as the client sent it.
+  EXPECT_EQ(CountMessage("TelvoroAgent <FakeTelvoroSession 0> : message "
+                         "{\"engine on time\":5,\"plain\":\"a b\",\" x  y \":1} : category 1 : "
+                         "type 1",
+                         LogLevel::kDebug),
+            1u);
+}
+
+TEST_F(SessionTest, KeysThatCollideAfterCleaningKeepTheLaterValue) {
+  auto session = Create();
+  session->sendMessage(Dictionary{{"a b", 1}, {"a_b", 2}}, 1, 1, nullptr);
+  const std::vector<Dictionary> expected{Dictionary{{"a_b", 2}}};
+  EXPECT_EQ(Payloads(session->aggregatedPayloadData()), expected);
+}
+
+TEST_F(SessionTest, MessageIdsCountPerCategoryAndType) {
+  auto session = Create();
+  StartAndRun(session);
+  for (int i = 0; i < 3; ++i) session->sendMessage(Dictionary{{"n", i}}, 0x80000001, 1, nullptr);
+  session->sendMessage(Dictionary{{"n", 3}}, 0x80000001, 2, nullptr);
+  std::vector<std::string> ids;
+  for (const auto& entry : Entries(session->nestedAggregatedPayloadData())) {
+    ids.push_back(entry.begin().key());
+  }
+  EXPECT_EQ(ids, (std::vector<std::string>{"Toolbox_Generic_Start_1", "Toolbox_Generic_Start_2",
+                                           "Toolbox_Generic_Start_3", "Toolbox_Generic_Stop_1"}));
+  EXPECT_EQ(session->messageTypeCounts(),
+            (Dictionary{{"Toolbox_Generic_Start", 3}, {"Toolbox_Generic_Stop", 1}}));
+  EXPECT_EQ(traces.Count(trace::kMessageSent), 4u);
+
+  // Named in full, sent with the low 16 bits.
+  platform.dispatcher.RunUntilIdle();
+  for (const auto& message : platform.telvoro.LastSession()->Messages()) {
+    EXPECT_EQ(message.category, 1);
+  }
+}
+
+TEST_F(SessionTest, RepliesMeanAcceptedAndComeAtOnceEvenWithoutABackEnd) {
+  platform.telvoro.SetDiscovery(Discovery::kNeverAnswer);
+  auto session = Create();
+  int replies = 0;
+  auto reply = [&](const OptionalError& error) {
+    EXPECT_FALSE(error.has_value());
+    ++replies;
+  };
+  session->sendMessage(Dictionary{{"a", 1}}, 1, 1, reply);  // not started
+  EXPECT_EQ(replies, 1);
+  StartAndRun(session);
+  session->sendMessage(Dictionary{{"a", 1}}, 1, 1, true, reply);  // waiting for back-ends
+  EXPECT_EQ(replies, 2);
+  platform.dispatcher.AdvanceBy(seconds(9));
+  session->sendMessage(Dictionary{{"a", 1}}, 1, 1, reply);  // back-end gone
+  EXPECT_EQ(replies, 3);
+  platform.dispatcher.RunUntilIdle();
+  EXPECT_EQ(replies, 3);
+}
+
+TEST_F(SessionTest, ARefusedMessageIsDroppedWithoutALine) {
+  auto session = Create();
+  StartAndRun(session);
+  platform.telvoro.FailSends(Error{"domain", 3, "refused"});
+  log.Clear();
+  session->sendMessage(Dictionary{{"a", 1}}, 1, 1, nullptr);
+  platform.dispatcher.RunUntilIdle();
+  EXPECT_EQ(platform.telvoro.LastSession()->RefusedCount(), 1u);
+  EXPECT_TRUE(SessionMessages(LogLevel::kError).empty());
+}
+
+TEST_F(SessionTest, AfterStopMessagesGoAloneAndReachNoSummary) {
+  auto session = Create(42, 2);
+  session->setConfiguration(Dictionary{{"HostApplicationDisplayID", "app"}});
+  StartAndRun(session);
+  session->sendMessage(Dictionary{{"kept", 1}}, 1, 1, nullptr);
+  session->stop();
+  session->sendMessage(Dictionary{{"late key", 2}}, 3, 4, nullptr);
+  platform.dispatcher.RunUntilIdle();
+
+  const auto singles = platform.telvoro.SingleMessages();
+  ASSERT_EQ(singles.size(), 1u);
+  EXPECT_EQ(singles[0].payload, (Dictionary{{"late_key", 2}}));
+  EXPECT_EQ(singles[0].category, 3);
+  EXPECT_EQ(singles[0].type, 4);
+  EXPECT_EQ(singles[0].userInfo,
+            (Dictionary{{"ClientName", "com.quorvex.tavrin"}, {"ServiceName", "telephony"}}));
+  EXPECT_EQ(CountMessage("session not started, will send as a single message", LogLevel::kDebug),
+            1u);
+  EXPECT_EQ(session->messageTypeCounts()["Playback_Error"], 1);
+
+  // Not in the summary of a later run either.
+  StartAndRun(session);
+  session->sendMessage(Dictionary{{"next", 3}}, 1, 1, nullptr);
+  const auto summary = session->createSummaryEventForSession();
+  ASSERT_TRUE(summary.has_value());
+  EXPECT_FALSE(summary->contains("late_key"));
+  EXPECT_TRUE(summary->contains("next"));
+}
+
+TEST_F(SessionTest, StartDropsWhatWasAggregatedBeforeIt) {
+  auto session = Create();
+  session->sendMessage(Dictionary{{"early", 1}}, 1, 1, nullptr);
+  EXPECT_EQ(Payloads(session->aggregatedPayloadData()).size(), 1u);
+  StartAndRun(session);
+  EXPECT_TRUE(Payloads(session->aggregatedPayloadData()).empty());
+  EXPECT_TRUE(Entries(session->nestedAggregatedPayloadData()).empty());
+}
+
+TEST_F(SessionTest, TheRoadIsChosenAtSendTimeEvenIfStopComesFirst) {
+  platform.telvoro.SetDiscovery(Discovery::kAnswerLater);
+  auto session = Create();
+  StartAndRun(session);
+  session->sendMessage(Dictionary{{"seq", 0}}, 1, 1, nullptr);
+  session->stop();
+  platform.telvoro.AnswerPendingDiscoveries(std::vector<std::string>{"x"});
+  platform.dispatcher.RunUntilIdle();
+  EXPECT_EQ(Sequence(platform.telvoro.LastSession()), (std::vector<int64_t>{0}));
+  EXPECT_TRUE(platform.telvoro.SingleMessages().empty());
+}
+
+TEST_F(SessionTest, ANonDictionaryPayloadIsReportedAndSentEmpty) {
+  auto session = Create();
+  StartAndRun(session);
+  session->sendMessage(Value::array({1, 2}), 1, 1, nullptr);
+  session->sendMessage(Value(), 1, 1, nullptr);
+  platform.dispatcher.RunUntilIdle();
+  EXPECT_EQ(SessionMessages(LogLevel::kError).size(), 1u);
+  const auto messages = platform.telvoro.LastSession()->Messages();
+  ASSERT_EQ(messages.size(), 2u);
+  EXPECT_EQ(messages[0].payload, Dictionary::object());
+  EXPECT_EQ(messages[1].payload, Dictionary::object());
+}
+
+// --- single messages --------------------------------------------------------------------------
+
+TEST_F(SessionTest, AlarmsSingleMessagesWaitTheDrawnDelay) {
+  platform.random.Script({59});
+  int replies = 0;
+  RuvoReportingSession::sendSingleMessage(Dictionary{{"a", 1}}, 1, 1, 4, Dictionary::object(),
+                                          [&](const OptionalError& error) {
+                                            EXPECT_FALSE(error.has_value());
+                                            ++replies;
+                                          });
+  EXPECT_EQ(platform.random.Bounds(), std::vector<uint64_t>{60});
+  EXPECT_EQ(CountMessage("sending single message after delta 59 for service 4", LogLevel::kDebug),
+            1u);
+  platform.dispatcher.AdvanceBy(milliseconds(58900));
+  EXPECT_TRUE(platform.telvoro.SingleMessages().empty());
+  EXPECT_EQ(replies, 0);
+  platform.dispatcher.AdvanceBy(milliseconds(100));
+  EXPECT_EQ(platform.telvoro.SingleMessages().size(), 1u);
+  EXPECT_EQ(replies, 1);
+  EXPECT_EQ(traces.Count(trace::kMessageSent), 1u);
+
+  platform.random.Script({0});
+  RuvoReportingSession::sendSingleMessage(Dictionary{{"a", 2}}, 1, 1, 4, Dictionary::object(),
+                                          nullptr);
+  platform.dispatcher.RunUntilIdle();
+  EXPECT_EQ(platform.telvoro.SingleMessages().size(), 2u);
+}
+
+TEST_F(SessionTest, OtherSingleMessagesGoAtOnceWithoutTheClientsUserInfo) {
+  RuvoReportingSession::sendSingleMessage(
+      Dictionary{{"engine on time", 7}}, 0x20000003, 2, 2,
+      Dictionary{{"secret", "x"}, {"ServiceName", "mine"}, {"HostApplicationDisplayID", "a"}},
+      nullptr);
+  EXPECT_TRUE(platform.random.Bounds().empty());
+  EXPECT_TRUE(platform.telvoro.SingleMessages().empty());  // never on the caller's stack
+  platform.dispatcher.RunUntilIdle();
+  const auto singles = platform.telvoro.SingleMessages();
+  ASSERT_EQ(singles.size(), 1u);
+  EXPECT_EQ(singles[0].sessionInfo,
+            (Dictionary{{"ClientType", 19}, {"ClientVersion", 2.0}, {"SessionID", -1}}));
+  EXPECT_TRUE(singles[0].sessionInfo["ClientVersion"].is_number_float());
+  EXPECT_EQ(singles[0].userInfo,
+            (Dictionary{{"ClientName", "com.quorvex.tavrin"}, {"ServiceName", "telephony"}}));
+  EXPECT_EQ(singles[0].category, 3);
+  EXPECT_EQ(singles[0].type, 2);
+  EXPECT_EQ(singles[0].payload, (Dictionary{{"engine_on_time", 7}}));
+  EXPECT_EQ(CountMessage("sending single message", LogLevel::kDebug), 1u);
+  EXPECT_EQ(CountMessage("message {\"engine on time\":7} : category 536870915 : type 2",
+                         LogLevel::kDebug),
+            1u);
+}
+
+TEST_F(SessionTest, SingleMessageFailuresReachTheReply) {
+  platform.telvoro.FailSends(Error{"com.example", 9, "back-end down"});
+  std::optional<OptionalError> answer;
+  RuvoReportingSession::sendSingleMessage(Dictionary{{"a", 1}}, 0xFFFFFFFF, 1, 13,
+                                          Dictionary::object(),
+                                          [&](const OptionalError& error) { answer = error; });
+  platform.dispatcher.RunUntilIdle();
+  ASSERT_TRUE(answer.has_value());
+  ASSERT_TRUE(answer->has_value());
+  EXPECT_EQ((*answer)->code, 9);
+  EXPECT_EQ((*answer)->description, "back-end down");
+  EXPECT_EQ(CountMessage("sendOneMessageWithSessionInfo back-end down", LogLevel::kError), 1u);
+  EXPECT_EQ(platform.telvoro.RefusedSingleMessages(), 1u);
+}
+
+TEST_F(SessionTest, SingleMessagesOfUnnamedServiceTypesCarryNoServiceName) {
+  RuvoReportingSession::sendSingleMessage(Dictionary{{"a", 1}}, 1, 1, 13, Dictionary::object(),
+                                          nullptr);
+  platform.dispatcher.RunUntilIdle();
+  ASSERT_EQ(platform.telvoro.SingleMessages().size(), 1u);
+  EXPECT_EQ(platform.telvoro.SingleMessages()[0].userInfo,
+            (Dictionary{{"ClientName", "com.quorvex.tavrin"}}));
+}
+
+// --- stored-only properties -------------------------------------------------------------------
+
+TEST_F(SessionTest, DriverSnapshotAndCompletionBlockAreOnlyStored) {
+  auto session = Create();
+  EXPECT_TRUE(session->driverSnapShot().is_null());
+  EXPECT_FALSE(session->transactionCompleteBlock());
+  session->setDriverSnapShot(Dictionary{{"ch", 1}});
+  int calls = 0;
+  session->setTransactionCompleteBlock([&](bool done) { calls += done ? 1 : 0; });
+  StartAndRun(session);
+  session->stop();
+  platform.dispatcher.RunUntilIdle();
+  EXPECT_EQ(session->driverSnapShot(), (Dictionary{{"ch", 1}}));
+  EXPECT_EQ(calls, 0);
+  session->transactionCompleteBlock()(true);
+  EXPECT_EQ(calls, 1);
+  session->setDriverSnapShot(Dictionary());
+  EXPECT_TRUE(session->driverSnapShot().is_null());
+}
+
+}  // namespace
+}  // namespace tavrin::testing
