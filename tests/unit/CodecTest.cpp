@@ -1,0 +1,642 @@
+#include "protocol/Codec.h"
+
+#include <gtest/gtest.h>
+
+#include <cstdint>
+#include <limits>
+#include <string>
+#include <vector>
+
+#include "protocol/MessagePack.h"
+#include "tests/support/MessagePackBytes.h"
+
+namespace tavrin::protocol {
+namespace {
+
+using Bytes = std::vector<uint8_t>;
+using tavrin::testing::IntFormat;
+using tavrin::testing::IntFormatName;
+using tavrin::testing::Pack;
+
+constexpr int64_t kInt64Min = std::numeric_limits<int64_t>::min();
+constexpr int64_t kInt64Max = std::numeric_limits<int64_t>::max();
+constexpr uint64_t kUint64Max = std::numeric_limits<uint64_t>::max();
+
+// The accepted request, or a test failure naming the reason it was refused.
+Request Accepted(std::span<const uint8_t> body) {
+  auto decoded = DecodeRequest(body);
+  if (auto* error = std::get_if<RequestError>(&decoded)) {
+    ADD_FAILURE() << "refused: " << error->reason;
+    return Request{};
+  }
+  return std::get<Request>(std::move(decoded));
+}
+
+// The refusal, or a test failure when the request was accepted.
+RequestError Refused(std::span<const uint8_t> body) {
+  auto decoded = DecodeRequest(body);
+  if (std::holds_alternative<Request>(decoded)) {
+    ADD_FAILURE() << "accepted";
+    return RequestError{};
+  }
+  return std::get<RequestError>(std::move(decoded));
+}
+
+// A request with call 77 and `op`, `args` elements following (their bytes in `argBytes`).
+Bytes RequestBytes(uint64_t args, Pack op, const Bytes& argBytes) {
+  return Pack().array(2 + args).uint(77).append(op).append(argBytes);
+}
+
+Bytes Nested(int levels) {
+  Pack pack;
+  for (int i = 0; i < levels; ++i) pack.array(1);
+  return pack.nil();
+}
+
+// ---------------------------------------------------------------------------------------------
+// Accepted requests
+
+std::vector<Request> EveryRequest() {
+  Dictionary message = Dictionary::object();
+  message["volume"] = 0.5;
+  message["route"] = "speaker";
+  message["counts"] = Value::array({1, -2, kUint64Max});
+  message["nested"] = {{"on", true}, {"none", nullptr}};
+  Dictionary configuration = Dictionary::object();
+  configuration["device_name"] = "dock";
+  return {
+      {0, CreateReportingSession{kInt64Min}},
+      {1, SetServiceType{0xffff, kInt64Max}},
+      {kUint64Max, GetServiceNameForReporterID{0}},
+      {std::nullopt, SetConfiguration{configuration, -1}},
+      {5, SetConfiguration{Dictionary::object(), 9}},
+      {6, StartReportingSessionForID{42}},
+      {7, SendMessage{message, 0xffffffff, 0xffff, std::nullopt}},
+      {8, SendMessage{message, 0x80000001, 1, std::vector<int64_t>{}}},
+      {9, SendMessage{Dictionary::object(), 0, 0, std::vector<int64_t>{kInt64Min, 0, kInt64Max}}},
+      {std::nullopt, StopReportingSessionForID{3}},
+      {11, DestroyReportingSession{-3}},
+      {12, ReporterIDValid{kInt64Max}},
+      {13, GetAllReporters{}},
+      {std::nullopt, KillService{}},
+  };
+}
+
+TEST(CodecTest, EveryRequestRoundTrips) {
+  for (const Request& request : EveryRequest()) {
+    const Bytes body = EncodeRequest(request);
+    const Request decoded = Accepted(body);
+    EXPECT_EQ(decoded, request) << "op " << static_cast<int>(request.op());
+    EXPECT_EQ(decoded.op(), request.op());
+    EXPECT_EQ(EncodeRequest(decoded), body);
+  }
+}
+
+TEST(CodecTest, RequestWireFormIsCallOpThenArgumentsInOrder) {
+  EXPECT_EQ(EncodeRequest({7, CreateReportingSession{5}}),
+            Pack().array(3).uint(7).uint(1).uint(5).bytes());
+  EXPECT_EQ(EncodeRequest({std::nullopt, SetServiceType{3, -2}}),
+            Pack().array(4).nil().uint(2).uint(3).integer(IntFormat::kNegativeFixint, -2).bytes());
+  EXPECT_EQ(EncodeRequest({1, SendMessage{Dictionary::object(), 65536, 2, std::nullopt}}),
+            Pack().array(6).uint(1).uint(6).map(0).uint(65536).uint(2).nil().bytes());
+  EXPECT_EQ(EncodeRequest({2, GetAllReporters{}}), Pack().array(2).uint(2).uint(10).bytes());
+}
+
+TEST(CodecTest, NilCallMeansNoReplyWanted) {
+  const Request request = Accepted(Pack().array(3).nil().uint(9).uint(4));
+  EXPECT_FALSE(request.call.has_value());
+  EXPECT_EQ(request.arguments, Arguments(ReporterIDValid{4}));
+}
+
+TEST(CodecTest, ForeignEncodingsOfSmallNumbersAreAccepted) {
+  // A client may write the op and small numbers in signed or wide formats.
+  const Request request = Accepted(Pack()
+                                       .array(4)
+                                       .integer(IntFormat::kInt64, 12)
+                                       .integer(IntFormat::kInt8, 2)
+                                       .integer(IntFormat::kUint64, 7)
+                                       .integer(IntFormat::kInt16, 8));
+  EXPECT_EQ(request.call, 12u);
+  EXPECT_EQ(request.arguments, Arguments(SetServiceType{7, 8}));
+}
+
+TEST(CodecTest, DictionaryArgumentsKeepTheirOrderAndValueKinds) {
+  const Request request = Accepted(Pack()
+                                       .array(4)
+                                       .uint(1)
+                                       .uint(4)
+                                       .map(4)
+                                       .str("z")
+                                       .float32(1.5f)
+                                       .str("a")
+                                       .integer(IntFormat::kInt32, static_cast<uint64_t>(-7))
+                                       .str("m")
+                                       .array(2)
+                                       .str("x")
+                                       .nil()
+                                       .str("b")
+                                       .boolean(true)
+                                       .uint(3));
+  const auto& args = std::get<SetConfiguration>(request.arguments);
+  EXPECT_EQ(args.configuration.dump(), R"({"z":1.5,"a":-7,"m":["x",null],"b":true})");
+  EXPECT_EQ(args.reporterID, 3);
+}
+
+// ---------------------------------------------------------------------------------------------
+// Integers at every format's edges, in every argument position that takes an integer
+
+struct IntegerCase {
+  IntFormat format;
+  uint64_t bits;  // two's complement of the value
+  bool fitsInt64;
+  bool fitsUint16;
+  bool fitsUint32;
+};
+
+std::vector<IntegerCase> IntegerCases() {
+  const auto neg = [](int64_t v) { return static_cast<uint64_t>(v); };
+  return {
+      {IntFormat::kPositiveFixint, 0, true, true, true},
+      {IntFormat::kPositiveFixint, 127, true, true, true},
+      {IntFormat::kNegativeFixint, neg(-1), true, false, false},
+      {IntFormat::kNegativeFixint, neg(-32), true, false, false},
+      {IntFormat::kUint8, 0, true, true, true},
+      {IntFormat::kUint8, 255, true, true, true},
+      {IntFormat::kUint16, 0, true, true, true},
+      {IntFormat::kUint16, 65535, true, true, true},
+      {IntFormat::kUint32, 65536, true, false, true},
+      {IntFormat::kUint32, 4294967295, true, false, true},
+      {IntFormat::kUint64, 0, true, true, true},
+      {IntFormat::kUint64, 65535, true, true, true},
+      {IntFormat::kUint64, 4294967296, true, false, false},
+      {IntFormat::kUint64, static_cast<uint64_t>(kInt64Max), true, false, false},
+      {IntFormat::kUint64, static_cast<uint64_t>(kInt64Max) + 1, false, false, false},
+      {IntFormat::kUint64, kUint64Max, false, false, false},
+      {IntFormat::kInt8, neg(-128), true, false, false},
+      {IntFormat::kInt8, 0, true, true, true},
+      {IntFormat::kInt8, 127, true, true, true},
+      {IntFormat::kInt16, neg(-32768), true, false, false},
+      {IntFormat::kInt16, 32767, true, true, true},
+      {IntFormat::kInt32, neg(std::numeric_limits<int32_t>::min()), true, false, false},
+      {IntFormat::kInt32, 65535, true, true, true},
+      {IntFormat::kInt32, 65536, true, false, true},
+      {IntFormat::kInt32, 2147483647, true, false, true},
+      {IntFormat::kInt64, neg(kInt64Min), true, false, false},
+      {IntFormat::kInt64, neg(-1), true, false, false},
+      {IntFormat::kInt64, 0, true, true, true},
+      {IntFormat::kInt64, 4294967295, true, false, true},
+      {IntFormat::kInt64, 4294967296, true, false, false},
+      {IntFormat::kInt64, static_cast<uint64_t>(kInt64Max), true, false, false},
+  };
+}
+
+// Expects `body` accepted when `fits`, else refused with code 4 and call 77.
+void ExpectFitsOrOutOfRange(const Bytes& body, bool fits, const std::string& where) {
+  auto decoded = DecodeRequest(body);
+  if (fits) {
+    EXPECT_TRUE(std::holds_alternative<Request>(decoded)) << where;
+    return;
+  }
+  ASSERT_TRUE(std::holds_alternative<RequestError>(decoded)) << where;
+  const auto& error = std::get<RequestError>(decoded);
+  EXPECT_EQ(error.kind, RequestError::Kind::kReject) << where;
+  EXPECT_EQ(error.code, RejectCode::kIntegerOutOfRange) << where << ": " << error.reason;
+  EXPECT_EQ(error.call, 77u) << where;
+}
+
+TEST(CodecTest, IntegersAtEveryFormatsEdgesFitTheirArgumentTypeByValue) {
+  for (const IntegerCase& c : IntegerCases()) {
+    const std::string where =
+        std::string(IntFormatName(c.format)) + " bits " + std::to_string(c.bits);
+    const Bytes n = Pack().integer(c.format, c.bits);
+
+    // reporterID (signed 64-bit), and the value that arrives.
+    const Bytes create = RequestBytes(1, Pack().uint(1), n);
+    ExpectFitsOrOutOfRange(create, c.fitsInt64, where + " as reporterID");
+    if (c.fitsInt64) {
+      EXPECT_EQ(std::get<CreateReportingSession>(Accepted(create).arguments).reporterID,
+                static_cast<int64_t>(c.bits))
+          << where;
+    }
+    // serviceType (unsigned 16-bit)
+    const Bytes setType = RequestBytes(2, Pack().uint(2), Pack().append(n).uint(1));
+    ExpectFitsOrOutOfRange(setType, c.fitsUint16, where + " as serviceType");
+    if (c.fitsUint16) {
+      EXPECT_EQ(std::get<SetServiceType>(Accepted(setType).arguments).serviceType,
+                static_cast<uint16_t>(c.bits))
+          << where;
+    }
+    // category (unsigned 32-bit), type (unsigned 16-bit), an element of reporterIDs
+    const Bytes category = RequestBytes(4, Pack().uint(6), Pack().map(0).append(n).uint(0).nil());
+    ExpectFitsOrOutOfRange(category, c.fitsUint32, where + " as category");
+    if (c.fitsUint32) {
+      EXPECT_EQ(std::get<SendMessage>(Accepted(category).arguments).category,
+                static_cast<uint32_t>(c.bits))
+          << where;
+    }
+    const Bytes type = RequestBytes(4, Pack().uint(6), Pack().map(0).uint(0).append(n).nil());
+    ExpectFitsOrOutOfRange(type, c.fitsUint16, where + " as type");
+    const Bytes ids =
+        RequestBytes(4, Pack().uint(6), Pack().map(0).uint(0).uint(0).array(2).uint(1).append(n));
+    ExpectFitsOrOutOfRange(ids, c.fitsInt64, where + " in reporterIDs");
+    if (c.fitsInt64) {
+      EXPECT_EQ(std::get<SendMessage>(Accepted(ids).arguments).reporterIDs,
+                (std::vector<int64_t>{1, static_cast<int64_t>(c.bits)}))
+          << where;
+    }
+
+    // As the call: any integer >= 0 is echoed, a negative one makes the frame undecodable.
+    const bool negative = c.format == IntFormat::kNegativeFixint ||
+                          (c.format >= IntFormat::kInt8 && static_cast<int64_t>(c.bits) < 0);
+    auto asCall = DecodeRequest(Pack().array(2).append(n).uint(10));
+    if (negative) {
+      ASSERT_TRUE(std::holds_alternative<RequestError>(asCall)) << where;
+      EXPECT_EQ(std::get<RequestError>(asCall).kind, RequestError::Kind::kCloseConnection);
+    } else {
+      ASSERT_TRUE(std::holds_alternative<Request>(asCall)) << where;
+      EXPECT_EQ(std::get<Request>(asCall).call, c.bits) << where;
+    }
+  }
+}
+
+// ---------------------------------------------------------------------------------------------
+// Rejections: status 2 with the call echoed
+
+struct RejectCase {
+  std::string name;
+  Bytes body;
+  RejectCode code;
+};
+
+std::vector<RejectCase> RejectCases() {
+  const Bytes deep12k = Pack().map(1).str("k").append(Nested(12 * 1024));
+  return {
+      // 1: op not an integer from 1 to 11
+      {"op 0", RequestBytes(0, Pack().uint(0), {}), RejectCode::kUnknownOp},
+      {"op 12", RequestBytes(0, Pack().uint(12), {}), RejectCode::kUnknownOp},
+      {"op 256", RequestBytes(1, Pack().uint(256), Pack().uint(1)), RejectCode::kUnknownOp},
+      {"op 2^64-1", RequestBytes(0, Pack().uint(kUint64Max), {}), RejectCode::kUnknownOp},
+      {"op -1", RequestBytes(0, Pack().integer(IntFormat::kNegativeFixint, -1), {}),
+       RejectCode::kUnknownOp},
+      {"op 1.0", RequestBytes(1, Pack().float64(1.0), Pack().uint(1)), RejectCode::kUnknownOp},
+      {"op \"1\"", RequestBytes(1, Pack().str("1"), Pack().uint(1)), RejectCode::kUnknownOp},
+      {"op nil", RequestBytes(0, Pack().nil(), {}), RejectCode::kUnknownOp},
+      {"op true", RequestBytes(1, Pack().boolean(true), Pack().uint(1)), RejectCode::kUnknownOp},
+      {"op map", RequestBytes(0, Pack().map(0), {}), RejectCode::kUnknownOp},
+      // 2: argument count
+      {"create without ID", RequestBytes(0, Pack().uint(1), {}), RejectCode::kWrongArgumentCount},
+      {"create with 2", RequestBytes(2, Pack().uint(1), Pack().uint(1).uint(2)),
+       RejectCode::kWrongArgumentCount},
+      {"setServiceType with 1", RequestBytes(1, Pack().uint(2), Pack().uint(1)),
+       RejectCode::kWrongArgumentCount},
+      {"sendMessage with 3", RequestBytes(3, Pack().uint(6), Pack().map(0).uint(1).uint(1)),
+       RejectCode::kWrongArgumentCount},
+      {"sendMessage with 5",
+       RequestBytes(5, Pack().uint(6), Pack().map(0).uint(1).uint(1).nil().nil()),
+       RejectCode::kWrongArgumentCount},
+      {"getAllReporters with 1", RequestBytes(1, Pack().uint(10), Pack().nil()),
+       RejectCode::kWrongArgumentCount},
+      {"killService with 1", RequestBytes(1, Pack().uint(11), Pack().uint(0)),
+       RejectCode::kWrongArgumentCount},
+      // 3: argument of the wrong type
+      {"reporterID string", RequestBytes(1, Pack().uint(1), Pack().str("5")),
+       RejectCode::kWrongArgumentType},
+      {"reporterID float", RequestBytes(1, Pack().uint(5), Pack().float64(5.0)),
+       RejectCode::kWrongArgumentType},
+      {"reporterID float32", RequestBytes(1, Pack().uint(7), Pack().float32(5.0f)),
+       RejectCode::kWrongArgumentType},
+      {"reporterID boolean", RequestBytes(1, Pack().uint(8), Pack().boolean(true)),
+       RejectCode::kWrongArgumentType},
+      {"reporterID nil", RequestBytes(1, Pack().uint(9), Pack().nil()),
+       RejectCode::kWrongArgumentType},
+      {"reporterID array", RequestBytes(1, Pack().uint(3), Pack().array(1).uint(1)),
+       RejectCode::kWrongArgumentType},
+      {"serviceType float", RequestBytes(2, Pack().uint(2), Pack().float64(1.5).uint(1)),
+       RejectCode::kWrongArgumentType},
+      {"configuration array", RequestBytes(2, Pack().uint(4), Pack().array(0).uint(1)),
+       RejectCode::kWrongArgumentType},
+      {"configuration nil", RequestBytes(2, Pack().uint(4), Pack().nil().uint(1)),
+       RejectCode::kWrongArgumentType},
+      {"message string", RequestBytes(4, Pack().uint(6), Pack().str("m").uint(1).uint(1).nil()),
+       RejectCode::kWrongArgumentType},
+      {"category boolean",
+       RequestBytes(4, Pack().uint(6), Pack().map(0).boolean(false).uint(1).nil()),
+       RejectCode::kWrongArgumentType},
+      {"reporterIDs string", RequestBytes(4, Pack().uint(6), Pack().map(0).uint(1).uint(1).str("")),
+       RejectCode::kWrongArgumentType},
+      {"reporterIDs map", RequestBytes(4, Pack().uint(6), Pack().map(0).uint(1).uint(1).map(0)),
+       RejectCode::kWrongArgumentType},
+      {"reporterIDs element float",
+       RequestBytes(4, Pack().uint(6), Pack().map(0).uint(1).uint(1).array(2).uint(1).float64(2)),
+       RejectCode::kWrongArgumentType},
+      {"reporterIDs element nil",
+       RequestBytes(4, Pack().uint(6), Pack().map(0).uint(1).uint(1).array(1).nil()),
+       RejectCode::kWrongArgumentType},
+      {"integer map key",
+       RequestBytes(4, Pack().uint(6), Pack().map(1).uint(1).str("v").uint(1).uint(1).nil()),
+       RejectCode::kWrongArgumentType},
+      {"nested nil map key",
+       RequestBytes(2, Pack().uint(4), Pack().map(1).str("a").map(1).nil().uint(1).uint(1)),
+       RejectCode::kWrongArgumentType},
+      // 4: out of range
+      {"reporterID 2^63", RequestBytes(1, Pack().uint(1), Pack().uint(uint64_t{1} << 63)),
+       RejectCode::kIntegerOutOfRange},
+      {"serviceType 65536", RequestBytes(2, Pack().uint(2), Pack().uint(65536).uint(1)),
+       RejectCode::kIntegerOutOfRange},
+      {"serviceType -1",
+       RequestBytes(2, Pack().uint(2), Pack().integer(IntFormat::kNegativeFixint, -1).uint(1)),
+       RejectCode::kIntegerOutOfRange},
+      {"category 2^32",
+       RequestBytes(4, Pack().uint(6), Pack().map(0).uint(uint64_t{1} << 32).uint(1).nil()),
+       RejectCode::kIntegerOutOfRange},
+      {"type 65536", RequestBytes(4, Pack().uint(6), Pack().map(0).uint(1).uint(65536).nil()),
+       RejectCode::kIntegerOutOfRange},
+      // 5: nesting
+      {"12 KB of nesting in a message",
+       RequestBytes(4, Pack().uint(6), Pack().append(deep12k).uint(1).uint(1).nil()),
+       RejectCode::kTooDeep},
+      {"65 levels", RequestBytes(1, Pack().uint(1), Nested(64)), RejectCode::kTooDeep},
+      // 6: bin and ext
+      {"bin8 in a message",
+       RequestBytes(4, Pack().uint(6),
+                    Pack().map(1).str("b").raw({0xc4, 1, 0}).uint(1).uint(1).nil()),
+       RejectCode::kUnsupportedType},
+      {"fixext1 as reporterID", RequestBytes(1, Pack().uint(1), Pack().raw({0xd4, 1, 0})),
+       RejectCode::kUnsupportedType},
+      {"ext32 as op", RequestBytes(0, Pack().big(0xc9, 1, 4).raw({1, 2}), {}),
+       RejectCode::kUnsupportedType},
+  };
+}
+
+TEST(CodecTest, EveryRejectionIsAnsweredWithItsCodeAndTheCall) {
+  for (const RejectCase& c : RejectCases()) {
+    const RequestError error = Refused(c.body);
+    EXPECT_EQ(error.kind, RequestError::Kind::kReject) << c.name << ": " << error.reason;
+    EXPECT_EQ(error.code, c.code) << c.name << ": " << error.reason;
+    EXPECT_EQ(error.call, 77u) << c.name;
+    EXPECT_FALSE(error.reason.empty()) << c.name;
+
+    // The reply a client receives for it.
+    const auto replyBody = EncodeRejectReply(error);
+    ASSERT_TRUE(replyBody) << c.name;
+    auto reply = DecodeReply(*replyBody);
+    ASSERT_TRUE(std::holds_alternative<Reply>(reply)) << c.name;
+    const Reply& r = std::get<Reply>(reply);
+    EXPECT_EQ(r.call, 77u);
+    EXPECT_EQ(r.status, Status::kRejected);
+    EXPECT_EQ(r.value["domain"], "com.quorvex.tavrin.protocol");
+    EXPECT_EQ(r.value["code"], static_cast<int64_t>(c.code));
+    EXPECT_EQ(r.value["reason"], error.reason);
+  }
+}
+
+TEST(CodecTest, RejectionOfANilCallSendsNothing) {
+  const RequestError error = Refused(Pack().array(2).nil().uint(99));
+  EXPECT_EQ(error.kind, RequestError::Kind::kReject);
+  EXPECT_EQ(error.code, RejectCode::kUnknownOp);
+  EXPECT_FALSE(error.call.has_value());
+  EXPECT_FALSE(EncodeRejectReply(error).has_value());
+}
+
+TEST(CodecTest, ReasonsNameTheOperationArgumentAndValue) {
+  EXPECT_EQ(Refused(RequestBytes(0, Pack().uint(42), {})).reason, "unknown operation 42");
+  EXPECT_EQ(Refused(RequestBytes(2, Pack().uint(2), Pack().uint(70000).uint(1))).reason,
+            "argument 1 (serviceType) of setServiceType:reportingSession:reply:: 70000 does not "
+            "fit an unsigned 16-bit integer");
+  EXPECT_EQ(Refused(RequestBytes(1, Pack().uint(1), Pack().str("x"))).reason,
+            "argument 1 (reporterID) of createReportingSession:reply: is a string, not an integer");
+  EXPECT_EQ(Refused(RequestBytes(1, Pack().uint(10), Pack().nil())).reason,
+            "getAllReporters: takes 0 argument(s), got 1");
+}
+
+// ---------------------------------------------------------------------------------------------
+// Nesting
+
+// [call, 6, message, 0, 0, nil] whose message holds arrays down to `depth` in all.
+Bytes SendWithDepth(int depth) {
+  // The request array is level 1 and the message map level 2.
+  Pack message;
+  message.map(1).str("deep");
+  for (int i = 0; i < depth - 2; ++i) message.array(1);
+  message.uint(1);
+  return RequestBytes(4, Pack().uint(6), Pack().append(message).uint(0).uint(0).nil());
+}
+
+TEST(CodecTest, NestingOfExactlyTheLimitIsAccepted) {
+  const Request request = Accepted(SendWithDepth(kMaxNestingDepth));
+  const Value* v = &std::get<SendMessage>(request.arguments).message["deep"];
+  int levels = 2;
+  while (v->is_array()) {
+    v = &(*v)[0];
+    ++levels;
+  }
+  EXPECT_EQ(levels, kMaxNestingDepth);
+  // And it encodes back to the same bytes.
+  EXPECT_EQ(EncodeRequest(request), SendWithDepth(kMaxNestingDepth));
+}
+
+TEST(CodecTest, OneLevelBeyondTheLimitIsRejectedWithCode5) {
+  const RequestError error = Refused(SendWithDepth(kMaxNestingDepth + 1));
+  EXPECT_EQ(error.kind, RequestError::Kind::kReject);
+  EXPECT_EQ(error.code, RejectCode::kTooDeep);
+}
+
+// ---------------------------------------------------------------------------------------------
+// Undecodable frames close the connection
+
+TEST(CodecTest, UndecodableFramesCloseTheConnection) {
+  const Bytes valid = Pack().array(3).uint(1).uint(1).uint(5);
+  Bytes trailing = valid;
+  trailing.push_back(0xc0);
+  Bytes deepCut = SendWithDepth(70);
+  deepCut.pop_back();
+  const std::vector<std::pair<std::string, Bytes>> cases = {
+      {"empty", {}},
+      {"truncated", Bytes(valid.begin(), valid.end() - 1)},
+      {"trailing byte", trailing},
+      {"two requests in one frame", Pack().append(valid).append(valid)},
+      {"invalid byte", Pack().array(2).uint(1).raw({0xc1})},
+      {"a map", Pack().map(1).str("call").uint(1)},
+      {"a scalar", Pack().uint(1)},
+      {"an empty array", Pack().array(0)},
+      {"call alone", Pack().array(1).uint(1)},
+      {"negative call", Pack().array(2).integer(IntFormat::kInt8, -5).uint(10)},
+      {"string call", Pack().array(2).str("1").uint(10)},
+      {"float call", Pack().array(2).float64(1).uint(10)},
+      {"boolean call", Pack().array(2).boolean(false).uint(10)},
+      {"bin call", Pack().array(2).raw({0xc4, 0}).uint(10)},
+      {"str32 of 4 GB", Pack().array(3).uint(1).uint(1).big(0xdb, 0xffffffff, 4).raw({'a'})},
+      {"array32 of 4G", Pack().array(3).uint(1).uint(6).big(0xdd, 0xffffffff, 4)},
+      // A form fault wins over what the scan found before it.
+      {"too deep and truncated", deepCut},
+      {"bin and truncated", Pack().array(3).uint(1).raw({0xc4, 5, 1})},
+      // Without a call there is no one to answer, whatever else is wrong.
+      {"too deep under a string call", Pack().array(2).str("x").append(Nested(100))},
+  };
+  for (const auto& [name, body] : cases) {
+    const RequestError error = Refused(body);
+    EXPECT_EQ(error.kind, RequestError::Kind::kCloseConnection) << name << ": " << error.reason;
+    EXPECT_FALSE(error.reason.empty()) << name;
+    EXPECT_FALSE(EncodeRejectReply(error).has_value()) << name;
+  }
+}
+
+TEST(CodecTest, EveryTruncationOfEveryRequestClosesTheConnection) {
+  for (const Request& request : EveryRequest()) {
+    const Bytes body = EncodeRequest(request);
+    for (size_t size = 0; size < body.size(); ++size) {
+      const RequestError error = Refused({body.data(), size});
+      EXPECT_EQ(error.kind, RequestError::Kind::kCloseConnection)
+          << "op " << static_cast<int>(request.op()) << " cut at " << size;
+    }
+  }
+}
+
+// ---------------------------------------------------------------------------------------------
+// Precedence
+
+TEST(CodecTest, ChecksRunInTheirDocumentedOrder) {
+  // Depth before bin/ext before a non-string key before the op.
+  EXPECT_EQ(
+      Refused(RequestBytes(2, Pack().uint(99), Pack().raw({0xc4, 0}).append(Nested(70)))).code,
+      RejectCode::kTooDeep);
+  EXPECT_EQ(
+      Refused(RequestBytes(2, Pack().uint(99), Pack().map(1).uint(1).nil().raw({0xc4, 0}))).code,
+      RejectCode::kUnsupportedType);
+  EXPECT_EQ(Refused(RequestBytes(1, Pack().uint(99), Pack().map(1).uint(1).nil())).code,
+            RejectCode::kWrongArgumentType);
+  // The op before the argument count.
+  EXPECT_EQ(Refused(RequestBytes(5, Pack().uint(99), Pack().nil().nil().nil().nil().nil())).code,
+            RejectCode::kUnknownOp);
+  // The argument count before the argument types.
+  EXPECT_EQ(Refused(RequestBytes(2, Pack().uint(1), Pack().str("a").str("b"))).code,
+            RejectCode::kWrongArgumentCount);
+  // Arguments in order: the first one's fault is reported.
+  EXPECT_EQ(Refused(RequestBytes(2, Pack().uint(2), Pack().str("a").uint(kUint64Max))).code,
+            RejectCode::kWrongArgumentType);
+  EXPECT_EQ(Refused(RequestBytes(2, Pack().uint(2), Pack().uint(70000).str("b"))).code,
+            RejectCode::kIntegerOutOfRange);
+}
+
+// ---------------------------------------------------------------------------------------------
+// Replies
+
+Reply DecodedReply(const Bytes& body) {
+  auto decoded = DecodeReply(body);
+  if (auto* reason = std::get_if<std::string>(&decoded)) {
+    ADD_FAILURE() << "reply refused: " << *reason;
+    return Reply{};
+  }
+  return std::get<Reply>(std::move(decoded));
+}
+
+TEST(CodecTest, ReplyWireFormIsCallStatusValue) {
+  EXPECT_EQ(EncodeBoolReply(3, true), Pack().array(3).uint(3).uint(0).boolean(true).bytes());
+  EXPECT_EQ(EncodeServiceTypeReply(kUint64Max, 0xffff),
+            Pack().array(3).uint(kUint64Max).uint(0).uint(0xffff).bytes());
+  EXPECT_EQ(EncodeNilReply(0), Pack().array(3).uint(0).uint(0).nil().bytes());
+  EXPECT_EQ(EncodeOperationErrorReply(4, kReportingErrorDomain, kReportingDisabledCode),
+            Pack()
+                .array(3)
+                .uint(4)
+                .uint(1)
+                .map(2)
+                .str("domain")
+                .str("com.quorvex.audio.reporting")
+                .str("code")
+                .uint(1)
+                .bytes());
+}
+
+TEST(CodecTest, EveryReplyRoundTripsThroughTheClientSide) {
+  const Reply yes = DecodedReply(EncodeBoolReply(1, true));
+  EXPECT_EQ(yes.call, 1u);
+  EXPECT_EQ(yes.status, Status::kOk);
+  EXPECT_EQ(BoolReplyValue(yes.value), true);
+  EXPECT_EQ(BoolReplyValue(DecodedReply(EncodeBoolReply(2, false)).value), false);
+  EXPECT_FALSE(ReplyError(yes));
+
+  EXPECT_EQ(ServiceTypeReplyValue(DecodedReply(EncodeServiceTypeReply(3, 0xffff)).value), 0xffff);
+  EXPECT_EQ(ServiceTypeReplyValue(DecodedReply(EncodeServiceTypeReply(3, 0)).value), 0);
+
+  Dictionary validity = Dictionary::object();
+  validity["reporterID"] = int64_t{-9};
+  validity["serviceType"] = uint16_t{4};
+  const auto decodedValidity =
+      ValidityReplyValue(DecodedReply(EncodeDictionaryReply(4, validity)).value);
+  ASSERT_TRUE(decodedValidity);
+  EXPECT_EQ(decodedValidity->dump(), R"({"reporterID":-9,"serviceType":4})");
+
+  const std::vector<int64_t> ids = {kInt64Min, -1, 0, kInt64Max};
+  EXPECT_EQ(ReportersReplyValue(DecodedReply(EncodeReportersReply(5, ids)).value), ids);
+  EXPECT_EQ(ReportersReplyValue(DecodedReply(EncodeReportersReply(5, {})).value),
+            std::vector<int64_t>{});
+
+  const Reply nil = DecodedReply(EncodeNilReply(6));
+  EXPECT_TRUE(IsNilReplyValue(nil.value));
+  EXPECT_FALSE(ReplyError(nil));
+
+  const Reply disabled =
+      DecodedReply(EncodeOperationErrorReply(7, kReportingErrorDomain, kReportingDisabledCode));
+  EXPECT_EQ(disabled.status, Status::kOperationError);
+  const OptionalError error = ReplyError(disabled);
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->domain, "com.quorvex.audio.reporting");
+  EXPECT_EQ(error->code, 1);
+
+  const Reply rejected = DecodedReply(EncodeRejectReply(8, RejectCode::kTooDeep, "too deep"));
+  EXPECT_EQ(rejected.status, Status::kRejected);
+  const OptionalError protocolError = ReplyError(rejected);
+  ASSERT_TRUE(protocolError);
+  EXPECT_EQ(protocolError->domain, kProtocolErrorDomain);
+  EXPECT_EQ(protocolError->code, 5);
+  EXPECT_EQ(protocolError->description, "too deep");
+}
+
+TEST(CodecTest, ReplyValueAccessorsRefuseTheWrongShape) {
+  EXPECT_FALSE(BoolReplyValue(1));
+  EXPECT_FALSE(BoolReplyValue(nullptr));
+  EXPECT_FALSE(ServiceTypeReplyValue(65536));
+  EXPECT_FALSE(ServiceTypeReplyValue(-1));
+  EXPECT_FALSE(ServiceTypeReplyValue(true));
+  EXPECT_FALSE(ServiceTypeReplyValue(3.0));
+  EXPECT_FALSE(ReportersReplyValue(Value::array({1, "2"})));
+  EXPECT_FALSE(ReportersReplyValue(Value::array({1, kUint64Max})));
+  EXPECT_FALSE(ReportersReplyValue(nullptr));
+  EXPECT_FALSE(ValidityReplyValue(Value{{"reporterID", 1}}));
+  EXPECT_FALSE(ValidityReplyValue(Value{{"reporterID", 1}, {"serviceType", 70000}}));
+  EXPECT_FALSE(ValidityReplyValue(Value::array()));
+  EXPECT_FALSE(IsNilReplyValue(false));
+}
+
+TEST(CodecTest, MalformedRepliesAreRefused) {
+  const std::vector<std::pair<std::string, Bytes>> cases = {
+      {"empty", {}},
+      {"truncated", Pack().array(3).uint(1).uint(0)},
+      {"trailing", Pack().array(3).uint(1).uint(0).nil().nil()},
+      {"not an array", Pack().map(0)},
+      {"2 elements", Pack().array(2).uint(1).uint(0)},
+      {"4 elements", Pack().array(4).uint(1).uint(0).nil().nil()},
+      {"nil call", Pack().array(3).nil().uint(0).nil()},
+      {"negative call", Pack().array(3).integer(IntFormat::kNegativeFixint, -1).uint(0).nil()},
+      {"status 3", Pack().array(3).uint(1).uint(3).nil()},
+      {"status string", Pack().array(3).uint(1).str("0").nil()},
+      {"status 1 without map", Pack().array(3).uint(1).uint(1).nil()},
+      {"status 1 without code", Pack().array(3).uint(1).uint(1).map(1).str("domain").str("d")},
+      {"status 1 string code",
+       Pack().array(3).uint(1).uint(1).map(2).str("domain").str("d").str("code").str("1")},
+      {"status 1 integer domain",
+       Pack().array(3).uint(1).uint(1).map(2).str("domain").uint(1).str("code").uint(1)},
+      {"status 2 without reason",
+       Pack().array(3).uint(1).uint(2).map(2).str("domain").str("d").str("code").uint(1)},
+      {"bin value", Pack().array(3).uint(1).uint(0).raw({0xc4, 0})},
+      {"too deep", Pack().array(3).uint(1).uint(0).append(Nested(70))},
+      {"integer key", Pack().array(3).uint(1).uint(0).map(1).uint(1).nil()},
+  };
+  for (const auto& [name, body] : cases) {
+    EXPECT_TRUE(std::holds_alternative<std::string>(DecodeReply(body))) << name;
+  }
+}
+
+}  // namespace
+}  // namespace tavrin::protocol
