@@ -1,0 +1,52 @@
+// Sessions on a build that is not internal: no summary file, no orientation tracking. The
+// internal-build answer is fixed once per process, hence an executable of its own.
+
+#include <memory>
+
+#include <gtest/gtest.h>
+
+#include "Statistics/Service/RuvoReportingSession.h"
+#include "tests/support/SessionTestSupport.h"
+
+namespace tavrin::testing {
+namespace {
+
+class ExternalBuildTest : public SessionTestBase {
+ protected:
+  ExternalBuildTest() : SessionTestBase(/*internalBuild=*/false) {}
+};
+
+TEST_F(ExternalBuildTest, NoFileIsWrittenHoweverMuchWasAggregated) {
+  auto session = Create(42, 2);
+  session->start();
+  platform.dispatcher.RunUntilIdle();
+  for (int i = 0; i < 50; ++i) session->sendMessage(Dictionary{{"n", i}}, 1, 1, nullptr);
+  session->stop();
+  session->start();
+  session->sendMessage(Dictionary{{"n", 0}}, 1, 1, nullptr);
+  session->stop();
+  platform.dispatcher.RunUntilIdle();
+  EXPECT_TRUE(platform.fileSystem.CreateDirectoriesCalls().empty());
+  EXPECT_TRUE(platform.fileSystem.WriteCalls().empty());
+  // The summary event itself is still sent.
+  EXPECT_EQ(CountMessage("sending summary event for reporter 42"), 2u);
+  // The device was asked at most once, whatever number of stops asked.
+  EXPECT_LE(platform.deviceInfo.QueryCount(kDeviceInfoInternalBuild), 1u);
+}
+
+TEST_F(ExternalBuildTest, OrientationIsNeverTracked) {
+  for (uint16_t type : {uint16_t{2}, uint16_t{7}}) {
+    auto session = Create(7, type);
+    EXPECT_FALSE(session->shouldReportOrientation());
+    session->start();
+    EXPECT_FALSE(session->orientationCallbackID().has_value());
+    EXPECT_FALSE(session->startDate().has_value());
+    session->stop();
+  }
+  EXPECT_TRUE(platform.orientation.History().empty());
+  // Decided by the build alone: the device class is never asked.
+  EXPECT_EQ(platform.deviceInfo.QueryCount(kDeviceInfoDeviceClassNumber), 0u);
+}
+
+}  // namespace
+}  // namespace tavrin::testing

@@ -1,0 +1,170 @@
+// Orientation tracking of telephony and long-form audio sessions on internal builds.
+
+#include <chrono>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include <gtest/gtest.h>
+
+#include "Statistics/Service/RuvoReportingSession.h"
+#include "tests/support/SessionTestSupport.h"
+
+namespace tavrin::testing {
+namespace {
+
+using std::chrono::microseconds;
+using std::chrono::milliseconds;
+using Kind = FakeOrientationRegistry::Kind;
+
+constexpr const char* kCallbackID = "RuvoReportingService 42";
+
+class OrientationTest : public SessionTestBase {
+ protected:
+  std::shared_ptr<RuvoReportingSession> Started(uint16_t serviceType) {
+    auto session = Create(42, serviceType);
+    session->start();
+    platform.dispatcher.RunUntilIdle();
+    return session;
+  }
+};
+
+TEST_F(OrientationTest, TelephonyAndLongFormAudioRegisterDeviceThenUI) {
+  for (uint16_t type : {uint16_t{2}, uint16_t{7}}) {
+    const size_t before = platform.orientation.History().size();
+    auto session = Started(type);
+    EXPECT_TRUE(session->shouldReportOrientation());
+    EXPECT_EQ(session->orientationCallbackID(), kCallbackID);
+    EXPECT_EQ(session->startDate(), platform.clock.Now());
+    session->stop();
+    EXPECT_FALSE(session->orientationCallbackID().has_value());
+    EXPECT_EQ(platform.orientation.FireDevice("portrait"), 0u);
+
+    const auto history = platform.orientation.History();
+    ASSERT_EQ(history.size(), before + 4);
+    const Kind kinds[] = {Kind::kDevice, Kind::kUI, Kind::kDevice, Kind::kUI};
+    const bool registered[] = {true, true, false, false};
+    for (size_t i = 0; i < 4; ++i) {
+      EXPECT_EQ(history[before + i].kind, kinds[i]) << i;
+      EXPECT_EQ(history[before + i].registered, registered[i]) << i;
+      EXPECT_EQ(history[before + i].id, kCallbackID) << i;
+    }
+  }
+}
+
+TEST_F(OrientationTest, OtherServiceTypesAndDeviceClassSixNeverTrack) {
+  for (uint16_t type : {uint16_t{0}, uint16_t{3}, uint16_t{8}, uint16_t{0xFFFF}}) {
+    auto session = Started(type);
+    EXPECT_FALSE(session->orientationCallbackID().has_value()) << type;
+    session->stop();
+  }
+  platform.deviceInfo.SetInt32(kDeviceInfoDeviceClassNumber, 6);
+  auto session = Started(2);
+  EXPECT_FALSE(session->shouldReportOrientation());
+  EXPECT_FALSE(session->orientationCallbackID().has_value());
+  EXPECT_TRUE(platform.orientation.History().empty());
+
+  platform.deviceInfo.SetInt32(kDeviceInfoDeviceClassNumber, 5);
+  EXPECT_TRUE(session->shouldReportOrientation());
+}
+
+TEST_F(OrientationTest, TimesAreRoundedToWholeMilliseconds) {
+  platform.orientation.SetText("3", "landscape-left");
+  auto session = Started(2);
+  session->setConfiguration(Dictionary{{"HostApplicationDisplayID", "com.example.call"}});
+  platform.clock.Advance(microseconds(12600));
+  EXPECT_EQ(platform.orientation.FireUI("3"), 1u);
+  platform.clock.Advance(microseconds(2000400 - 12600));
+  EXPECT_EQ(platform.orientation.FireDevice("portrait"), 1u);
+  platform.clock.Advance(microseconds(500));  // 2.0009 s: rounded, not cut off
+  platform.orientation.FireDevice("face-up");
+
+  const auto records = Payloads(session->aggregatedPayloadData());
+  ASSERT_EQ(records.size(), 3u);
+  EXPECT_EQ(records[0],
+            (Dictionary{{"ui_orientation", "landscape-left"}, {"ui_orientation_time", 0.013}}));
+  EXPECT_EQ(records[1],
+            (Dictionary{{"device_orientation", "portrait"}, {"device_orientation_time", 2.0}}));
+  EXPECT_EQ(records[2]["device_orientation_time"].get<double>(), 2.001);
+  // Records are not messages: not counted, not in the nested list.
+  EXPECT_EQ(session->messageTypeCounts(), Dictionary::object());
+  EXPECT_TRUE(Entries(session->nestedAggregatedPayloadData()).empty());
+
+  const auto debug = SessionMessages(LogLevel::kDebug);
+  const std::vector<std::string> expected{
+      "Orientation handler callback mode=ui orientation=\"landscape-left\" "
+      "app=\"com.example.call\", time=0.013, id=\"RuvoReportingService 42\"",
+      "Orientation handler callback mode=device orientation=\"portrait\" "
+      "app=\"com.example.call\", time=2, id=\"RuvoReportingService 42\""};
+  EXPECT_EQ(CountMessage(expected[0], LogLevel::kDebug), 1u);
+  EXPECT_EQ(CountMessage(expected[1], LogLevel::kDebug), 1u);
+}
+
+TEST_F(OrientationTest, RecordsInterleaveWithMessagesAndReachTheSummary) {
+  auto session = Started(7);
+  session->sendMessage(Dictionary{{"a", 1}}, 1, 1, nullptr);
+  platform.clock.Advance(milliseconds(250));
+  platform.orientation.FireDevice("portrait");
+  session->sendMessage(Dictionary{{"a", 2}}, 1, 1, nullptr);
+  platform.orientation.FireUI("portrait");
+  const auto summary = session->createSummaryEventForSession();
+  ASSERT_TRUE(summary.has_value());
+  EXPECT_EQ(*summary, (Dictionary{{"Ruvo_Session_Summary_Event", "7"},
+                                  {"a", "1,2"},
+                                  {"device_orientation", "portrait"},
+                                  {"device_orientation_time", "0.25"},
+                                  {"ui_orientation", "portrait"},
+                                  {"ui_orientation_time", "0.25"}}));
+  EXPECT_EQ(CountMessage("Orientation handler callback mode=ui orientation=\"portrait\" "
+                         "app=\"(null)\", time=0.25, id=\"RuvoReportingService 42\""),
+            1u);
+}
+
+TEST_F(OrientationTest, ATypeChangedBeforeStopLeavesTheCallbacksRegistered) {
+  auto session = Started(2);
+  session->setServiceType(3);
+  session->stop();
+  EXPECT_TRUE(platform.orientation.IsRegistered(Kind::kDevice, kCallbackID));
+  EXPECT_TRUE(platform.orientation.IsRegistered(Kind::kUI, kCallbackID));
+  EXPECT_EQ(session->orientationCallbackID(), kCallbackID);
+
+  // The callbacks hold the session; what they report after stop is kept nowhere.
+  std::weak_ptr<RuvoReportingSession> weak = session;
+  session.reset();
+  EXPECT_FALSE(weak.expired());
+  EXPECT_EQ(platform.orientation.FireDevice("portrait"), 1u);
+  EXPECT_EQ(weak.lock()->aggregatedPayloadData(), nullptr);
+  EXPECT_EQ(CountMessage("deallocing this session 42"), 0u);
+}
+
+TEST_F(OrientationTest, ASessionReleasedWithoutStopStaysRegistered) {
+  auto session = Started(2);
+  std::weak_ptr<RuvoReportingSession> weak = session;
+  session.reset();
+  EXPECT_FALSE(weak.expired());
+  EXPECT_EQ(platform.orientation.RegisteredCount(Kind::kDevice), 1u);
+  platform.orientation.FireUI("portrait");
+  EXPECT_EQ(Payloads(weak.lock()->aggregatedPayloadData()).size(), 1u);
+}
+
+TEST_F(OrientationTest, StopOfANeverStartedSessionUnregistersNothing) {
+  auto session = Create(42, 2);
+  session->stop();
+  EXPECT_TRUE(platform.orientation.History().empty());
+}
+
+TEST_F(OrientationTest, RestartRegistersAgainWithANewStartDate) {
+  auto session = Started(2);
+  session->stop();
+  platform.clock.Advance(std::chrono::seconds(30));
+  session->start();
+  EXPECT_EQ(session->startDate(), platform.clock.Now());
+  EXPECT_TRUE(platform.orientation.IsRegistered(Kind::kDevice, kCallbackID));
+  platform.clock.Advance(milliseconds(1));
+  platform.orientation.FireDevice("portrait");
+  EXPECT_EQ(Payloads(session->aggregatedPayloadData())[0]["device_orientation_time"], 0.001);
+  session->stop();
+}
+
+}  // namespace
+}  // namespace tavrin::testing

@@ -1,0 +1,223 @@
+// The summary event sent at stop and the summary file written on internal builds.
+
+#include <chrono>
+#include <cstdlib>
+#include <ctime>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include <gtest/gtest.h>
+
+#include "Statistics/Service/RuvoReportingSession.h"
+#include "tests/support/SessionTestSupport.h"
+
+namespace tavrin::testing {
+namespace {
+
+constexpr const char* kDirectory = "/fake/log/DiagnosticLogs/Audio/Reporting";
+
+class SummaryTest : public SessionTestBase {
+ protected:
+  ~SummaryTest() override {
+    setenv("TZ", "UTC", 1);
+    tzset();
+  }
+
+  std::shared_ptr<RuvoReportingSession> Started(uint16_t serviceType,
+                                                const Dictionary& configuration = Dictionary()) {
+    auto session = Create(42, serviceType);
+    session->setConfiguration(configuration);
+    session->start();
+    platform.dispatcher.RunUntilIdle();
+    return session;
+  }
+
+  std::string OnlyFilePath() {
+    const auto files = platform.fileSystem.Files();
+    EXPECT_EQ(files.size(), 1u);
+    return files.empty() ? std::string() : files.begin()->first;
+  }
+};
+
+// --- the summary event ------------------------------------------------------------------------
+
+TEST_F(SummaryTest, ValuesOfEachKeyAreJoinedInPayloadOrder) {
+  auto session = Started(3);
+  session->sendMessage(Dictionary{{"a", 1}, {"b", "x"}}, 1, 1, nullptr);
+  session->sendMessage(Dictionary{{"a", 2}}, 1, 1, nullptr);
+  const auto summary = session->createSummaryEventForSession();
+  ASSERT_TRUE(summary.has_value());
+  const Dictionary expected{{"Ruvo_Session_Summary_Event", "3"}, {"a", "1,2"}, {"b", "x"}};
+  EXPECT_EQ(*summary, expected);
+  // In that order, too.
+  EXPECT_EQ(summary->dump(), expected.dump());
+  // Asking does not change the session.
+  EXPECT_EQ(session->createSummaryEventForSession(), summary);
+  EXPECT_EQ(Payloads(session->aggregatedPayloadData()).size(), 2u);
+}
+
+TEST_F(SummaryTest, TextFormsOfNumbersBooleansAndNestedValues) {
+  auto session = Started(0xFFFF);
+  session->sendMessage(Dictionary{{"v", 4.5}}, 1, 1, nullptr);
+  session->sendMessage(Dictionary{{"v", -3}}, 1, 1, nullptr);
+  session->sendMessage(Dictionary{{"v", true}}, 1, 1, nullptr);
+  session->sendMessage(Dictionary{{"v", 2.0}}, 1, 1, nullptr);
+  session->sendMessage(Dictionary{{"v", Dictionary{{"k", 1}}}}, 1, 1, nullptr);
+  session->sendMessage(Dictionary{{"v", Value::array({1, "a"})}}, 1, 1, nullptr);
+  session->sendMessage(Dictionary{{"Ruvo_Session_Summary_Event", "own"}}, 1, 1, nullptr);
+  const auto summary = session->createSummaryEventForSession();
+  ASSERT_TRUE(summary.has_value());
+  EXPECT_EQ((*summary)["v"], "4.5,-3,1,2,{\"k\":1},[1,\"a\"]");
+  // The service type comes first; a payload's own value of the key follows it.
+  EXPECT_EQ((*summary)["Ruvo_Session_Summary_Event"], "65535,own");
+}
+
+TEST_F(SummaryTest, NothingAggregatedMeansNoSummaryAndNoFile) {
+  auto session = Started(3);
+  EXPECT_FALSE(session->createSummaryEventForSession().has_value());
+  session->stop();
+  platform.dispatcher.RunUntilIdle();
+  EXPECT_EQ(CountMessage("sending summary event for reporter 42"), 0u);
+  EXPECT_TRUE(platform.telvoro.LastSession()->Messages().empty());
+  EXPECT_TRUE(platform.fileSystem.Files().empty());
+  EXPECT_TRUE(platform.fileSystem.WriteCalls().empty());
+}
+
+TEST_F(SummaryTest, StopSendsTheSummaryThroughTheSessionsOwnPath) {
+  auto session = Started(3);
+  session->sendMessage(Dictionary{{"a", 1}}, 1, 1, nullptr);
+  session->stop();
+  platform.dispatcher.RunUntilIdle();
+  EXPECT_EQ(CountMessage("sending summary event for reporter 42", LogLevel::kDefault), 1u);
+  const auto messages = platform.telvoro.LastSession()->Messages();
+  ASSERT_EQ(messages.size(), 2u);
+  EXPECT_EQ(messages[1].category, 0xFFFF);
+  EXPECT_EQ(messages[1].type, 0xFFFF);
+  EXPECT_EQ(messages[1].payload, (Dictionary{{"Ruvo_Session_Summary_Event", "3"}, {"a", "1"}}));
+  // Counted like any message.
+  EXPECT_EQ(session->messageTypeCounts()["Undefined_Unknown"], 1);
+}
+
+// --- the summary file -------------------------------------------------------------------------
+
+TEST_F(SummaryTest, TheFileHoldsTheUserInfoFirstThenEveryMessageById) {
+  auto session = Started(3, Dictionary{{"HostApplicationDisplayID", "com.example.player"}});
+  session->sendMessage(Dictionary{{"a", 1}, {"b", "x"}}, 0x80000001, 1, nullptr);
+  session->sendMessage(Dictionary{{"a", 2}}, 0x80000001, 1, nullptr);
+  session->stop();
+
+  const std::string path = OnlyFilePath();
+  EXPECT_EQ(path, std::string(kDirectory) +
+                      "/20261116-052745+0000-tavrin-com.example.player-haptics.json");
+  const auto creates = platform.fileSystem.CreateDirectoriesCalls();
+  ASSERT_EQ(creates.size(), 1u);
+  EXPECT_EQ(creates[0].first, kDirectory);
+  EXPECT_EQ(creates[0].second, 0777u);
+
+  const std::string contents = *platform.fileSystem.ReadFile(path);
+  const Value expected = Value::array({
+      Dictionary{{"HostApplicationDisplayID", "com.example.player"}},
+      Dictionary{{"Toolbox_Generic_Start_1", Dictionary{{"a", 1}, {"b", "x"}}}},
+      Dictionary{{"Toolbox_Generic_Start_2", Dictionary{{"a", 2}}}},
+      Dictionary{{"Undefined_Unknown_1",
+                  Dictionary{{"Ruvo_Session_Summary_Event", "3"}, {"a", "1,2"}, {"b", "x"}}}},
+  });
+  EXPECT_EQ(Value::parse(contents), expected);
+  // Pretty-printed.
+  EXPECT_NE(contents.find("\n  {"), std::string::npos);
+  EXPECT_TRUE(SessionMessages(LogLevel::kError).empty());
+}
+
+TEST_F(SummaryTest, TheFileNameUsesLocalTimeTheAppNameAndTheServiceName) {
+  setenv("TZ", "XYZ-5:30", 1);  // five and a half hours east of UTC
+  tzset();
+  auto session = Started(200);  // a service type without a name
+  session->sendMessage(Dictionary{{"a", 1}}, 1, 1, nullptr);
+  session->stop();
+  EXPECT_EQ(OnlyFilePath(),
+            std::string(kDirectory) + "/20261116-105745+0530-tavrin-unknown-(null).json");
+}
+
+TEST_F(SummaryTest, AnAppNameCannotLeaveTheDirectory) {
+  auto session = Started(2, Dictionary{{"HostApplicationDisplayID", "../../etc/x"}});
+  session->sendMessage(Dictionary{{"a", 1}}, 1, 1, nullptr);
+  session->stop();
+  EXPECT_EQ(OnlyFilePath(),
+            std::string(kDirectory) + "/20261116-052745+0000-tavrin-.._.._etc_x-telephony.json");
+}
+
+TEST_F(SummaryTest, TwoStopsInOneSecondReplaceTheEarlierFile) {
+  auto session = Started(3);
+  session->sendMessage(Dictionary{{"run", 1}}, 1, 1, nullptr);
+  session->stop();
+  session->start();
+  session->sendMessage(Dictionary{{"run", 2}}, 1, 1, nullptr);
+  session->stop();
+  EXPECT_EQ(platform.fileSystem.WriteCalls().size(), 2u);
+  const Value contents = Value::parse(*platform.fileSystem.ReadFile(OnlyFilePath()));
+  EXPECT_EQ(contents[1]["Generic_Start_2"]["run"], 2);
+}
+
+TEST_F(SummaryTest, WritingPutsTheUserInfoFirstEveryTime) {
+  auto session = Started(3, Dictionary{{"k", "v"}});
+  session->sendMessage(Dictionary{{"a", 1}}, 1, 1, nullptr);
+  session->writeSummaryJson();
+  session->writeSummaryJson();
+  const auto entries = Entries(session->nestedAggregatedPayloadData());
+  ASSERT_EQ(entries.size(), 3u);
+  EXPECT_EQ(entries[0], (Dictionary{{"k", "v"}}));
+  EXPECT_EQ(entries[1], (Dictionary{{"k", "v"}}));
+}
+
+TEST_F(SummaryTest, ADirectoryErrorIsLoggedTwiceAndTheWriteStillHappens) {
+  platform.fileSystem.AddDirectory(kDirectory);
+  platform.fileSystem.FailCreateDirectories(Error{"posix", 13, "Permission denied"});
+  auto session = Started(3);
+  session->sendMessage(Dictionary{{"a", 1}}, 1, 1, nullptr);
+  session->stop();
+  EXPECT_EQ(SessionMessages(LogLevel::kError),
+            (std::vector<std::string>{std::string("can't create logging directory at ") +
+                                          kDirectory + ": Permission denied",
+                                      "jsonOutput writeToURL: Permission denied"}));
+  EXPECT_EQ(platform.fileSystem.Files().size(), 1u);
+}
+
+TEST_F(SummaryTest, AWriteErrorIsLoggedOnce) {
+  platform.fileSystem.FailWrites(Error{"posix", 28, "No space left on device"});
+  auto session = Started(3);
+  session->sendMessage(Dictionary{{"a", 1}}, 1, 1, nullptr);
+  session->stop();
+  EXPECT_EQ(SessionMessages(LogLevel::kError),
+            std::vector<std::string>{"jsonOutput writeToURL: No space left on device"});
+  EXPECT_TRUE(platform.fileSystem.Files().empty());
+}
+
+TEST_F(SummaryTest, AMissingDirectoryFailsBothSteps) {
+  platform.fileSystem.FailCreateDirectories(Error{"posix", 30, "Read-only file system"});
+  auto session = Started(3);
+  session->sendMessage(Dictionary{{"a", 1}}, 1, 1, nullptr);
+  session->stop();
+  const auto errors = SessionMessages(LogLevel::kError);
+  ASSERT_EQ(errors.size(), 2u);
+  EXPECT_EQ(errors[0], std::string("can't create logging directory at ") + kDirectory +
+                           ": Read-only file system");
+  // The write's own error replaces the directory's in the shared slot.
+  EXPECT_EQ(errors[1].rfind("jsonOutput writeToURL: No such file or directory", 0), 0u);
+}
+
+TEST_F(SummaryTest, AnUnserialisableEntryIsReportedAndNothingIsWritten) {
+  auto session = Started(3);
+  session->sendMessage(Dictionary{{"bad", std::string("\xff\xfe")}}, 1, 1, nullptr);
+  session->stop();
+  const auto errors = SessionMessages(LogLevel::kError);
+  ASSERT_EQ(errors.size(), 2u);
+  EXPECT_EQ(errors[0].rfind("dataWithJSONObject: ", 0), 0u);
+  EXPECT_EQ(errors[1], "jsonOutput writeToURL: " + errors[0].substr(20));
+  EXPECT_TRUE(platform.fileSystem.WriteCalls().empty());
+  // The directory is made all the same.
+  EXPECT_EQ(platform.fileSystem.CreateDirectoriesCalls().size(), 1u);
+}
+
+}  // namespace
+}  // namespace tavrin::testing
