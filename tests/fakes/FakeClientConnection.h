@@ -1,0 +1,57 @@
+#pragma once
+
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <string>
+
+#include "platform/ServiceListener.h"
+
+namespace tavrin::testing {
+
+// A client connection driven by the test: it keeps what the delegate set on it and lets the test
+// end the connection the way the transport would.
+class FakeClientConnection final : public ClientConnection {
+ public:
+  explicit FakeClientConnection(int32_t pid) : pid_(pid) {}
+
+  int32_t ProcessIdentifier() const override { return pid_; }
+  void SetExportedInterface(std::string_view name) override { interface_ = std::string(name); }
+  void SetExportedObject(std::shared_ptr<RuvoReportingServiceProtocol> object) override {
+    object_ = std::move(object);
+  }
+  std::shared_ptr<RuvoReportingServiceProtocol> ExportedObject() const override { return object_; }
+  void SetInterruptionHandler(std::function<void()> handler) override {
+    interruption_ = std::move(handler);
+  }
+  void SetInvalidationHandler(std::function<void()> handler) override {
+    invalidation_ = std::move(handler);
+  }
+  void Resume() override { resumed_ = true; }
+  std::string Description() const override {
+    return "<FakeClientConnection pid=" + std::to_string(pid_) + ">";
+  }
+
+  // Ends the connection: abnormally runs the interruption handler first; either way runs the
+  // invalidation handler once and lets go of the exported object, as a closed connection does.
+  void End(bool abnormal) {
+    if (abnormal && interruption_) interruption_();
+    if (invalidation_) invalidation_();
+    interruption_ = nullptr;
+    invalidation_ = nullptr;
+    object_.reset();
+  }
+
+  const std::string& exportedInterface() const { return interface_; }
+  bool resumed() const { return resumed_; }
+
+ private:
+  int32_t pid_;
+  std::string interface_;
+  std::shared_ptr<RuvoReportingServiceProtocol> object_;
+  std::function<void()> interruption_;
+  std::function<void()> invalidation_;
+  bool resumed_ = false;
+};
+
+}  // namespace tavrin::testing

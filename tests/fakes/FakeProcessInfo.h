@@ -1,0 +1,36 @@
+#pragma once
+
+#include <map>
+#include <mutex>
+#include <optional>
+#include <string>
+
+#include "platform/ProcessInfo.h"
+
+namespace tavrin::testing {
+
+// Process names from a table the test fills.
+class FakeProcessInfo final : public ProcessInfo {
+ public:
+  int32_t ownPid = 4242;
+  std::string ownName = "tavrind";
+
+  void SetCommandName(int32_t pid, std::string name) {
+    std::lock_guard lock(mutex_);
+    names_[pid] = std::move(name);
+  }
+  int32_t OwnProcessIdentifier() const override { return ownPid; }
+  std::string OwnProcessName() const override { return ownName; }
+  std::optional<std::string> CommandName(int32_t pid) const override {
+    std::lock_guard lock(mutex_);
+    auto found = names_.find(pid);
+    if (found == names_.end()) return std::nullopt;
+    return found->second;
+  }
+
+ private:
+  mutable std::mutex mutex_;
+  std::map<int32_t, std::string> names_;
+};
+
+}  // namespace tavrin::testing

@@ -1,0 +1,417 @@
+#include "Statistics/Service/RuvoReportingServiceDelegate.h"
+
+#include <gtest/gtest.h>
+
+#include <chrono>
+#include <optional>
+#include <vector>
+
+#include "platform/TracePoints.h"
+#include "tests/fakes/FakeClientConnection.h"
+#include "tests/fakes/FakeDefaults.h"
+#include "tests/fakes/FakeLogSystem.h"
+#include "tests/fakes/FakePlatform.h"
+#include "tests/fakes/FakeProcessInfo.h"
+#include "tests/fakes/RecordingTraceRecorder.h"
+
+namespace tavrin {
+namespace {
+
+using testing::FakeClientConnection;
+using testing::FakeTelvoroService;
+
+// Listener that is never asked to do anything: the delegate only receives it.
+class NullListener final : public ServiceListener {
+ public:
+  void SetDelegate(ServiceListenerDelegate*) override {}
+  void Resume() override {}
+};
+
+// One accepted client: its connection and the replies it has received, in order.
+struct Client {
+  std::shared_ptr<FakeClientConnection> connection;
+  std::vector<std::string> replies;
+
+  RuvoReportingServiceProtocol& service() { return *connection->ExportedObject(); }
+  RuvoReportingServiceProtocol::BoolReply Bool(std::string what) {
+    return [this, what](bool value) { replies.push_back(what + "=" + (value ? "YES" : "NO")); };
+  }
+};
+
+class ServiceDelegateTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    platform.services.processInfo = &processInfo;
+    platform.services.notifications = &notifications;
+    platform.services.defaults = &defaults;
+    platform.telvoro.SetDiscovery(FakeTelvoroService::Discovery::kAnswerAtOnce);
+    platform.telvoro.SetBackends({"sqlite:/tmp/tavrin.db"});
+    delegate = RuvoReportingServiceDelegate::init(platform.services);
+  }
+
+  std::unique_ptr<Client> Connect(int32_t pid) {
+    auto client = std::make_unique<Client>();
+    client->connection = std::make_shared<FakeClientConnection>(pid);
+    EXPECT_TRUE(delegate->shouldAcceptNewConnection(listener, client->connection));
+    platform.dispatcher.RunUntilIdle();
+    return client;
+  }
+
+  void Run() { platform.dispatcher.RunUntilIdle(); }
+
+  void PostDefaults() {
+    notifications.Post(kDefaultsNotificationName);
+    Run();
+  }
+
+  testing::FakeLogSystem log;
+  testing::RecordingTraceRecorder traces;
+  testing::FakePlatform platform;
+  testing::FakeProcessInfo processInfo;
+  testing::FakeNotificationCenter notifications;
+  testing::FakeDefaultsDomain defaults;
+  NullListener listener;
+  std::shared_ptr<RuvoReportingServiceDelegate> delegate;
+};
+
+TEST_F(ServiceDelegateTest, SettingsAreAbsentAndReportingEnabledUntilTheFirstNotification) {
+  EXPECT_FALSE(delegate->getDefaults().has_value());
+  EXPECT_TRUE(delegate->isReportingEnabled());
+  EXPECT_EQ(log.Count("notify setup result 0"), 1u);
+  EXPECT_EQ(defaults.reads(), 0);
+
+  defaults.Set("device_name", "kitchen");
+  PostDefaults();
+  ASSERT_TRUE(delegate->getDefaults().has_value());
+  EXPECT_EQ(*delegate->getDefaults(),
+            (Dictionary{{"device_name", "kitchen"}, {"disable_reporting", 0}}));
+
+  defaults.Remove("device_name");
+  PostDefaults();
+  EXPECT_EQ(*delegate->getDefaults(), (Dictionary{{"disable_reporting", 0}}));
+}
+
+TEST_F(ServiceDelegateTest, NotificationWithAForeignTokenIsIgnored) {
+  defaults.Set("disable_reporting", true);
+  notifications.PostWithToken(kDefaultsNotificationName, 999);
+  Run();
+  EXPECT_TRUE(delegate->isReportingEnabled());
+  EXPECT_EQ(defaults.reads(), 0);
+}
+
+TEST_F(ServiceDelegateTest, FailedRegistrationIsLoggedAndTheServiceRunsWithoutSettings) {
+  testing::FakeNotificationCenter failing;
+  failing.failWith = 7;
+  platform.services.notifications = &failing;
+  auto second = RuvoReportingServiceDelegate::init(platform.services);
+  EXPECT_EQ(log.Count("notify setup result 7"), 1u);
+  EXPECT_TRUE(second->isReportingEnabled());
+  EXPECT_FALSE(second->getDefaults().has_value());
+  second.reset();
+  platform.services.notifications = &notifications;  // the fixture's delegate still uses it
+}
+
+TEST_F(ServiceDelegateTest, StartReplyIsHeldUntilStopAndArrivesBeforeTheStopReply) {
+  auto client = Connect(100);
+  client->service().createReportingSession(7, client->Bool("create"));
+  client->service().startReportingSessionForID(7, client->Bool("start"));
+  Run();
+  EXPECT_EQ(client->replies, (std::vector<std::string>{"create=YES"}));
+
+  client->service().stopReportingSessionForID(7, client->Bool("stop"));
+  Run();
+  EXPECT_EQ(client->replies, (std::vector<std::string>{"create=YES", "start=YES", "stop=YES"}));
+  EXPECT_EQ(traces.Count(trace::kClientCreate), 1u);
+  EXPECT_EQ(traces.Count(trace::kClientStart), 1u);
+  EXPECT_EQ(traces.Count(trace::kClientStop), 1u);
+}
+
+TEST_F(ServiceDelegateTest, TwoClientsSharingAnIdReachTheFirstClientsSessionButCannotStopIt) {
+  auto a = Connect(100);
+  auto b = Connect(200);
+  a->service().createReportingSession(7, a->Bool("create"));
+  a->service().startReportingSessionForID(7, a->Bool("start"));
+  Run();
+  b->service().startReportingSessionForID(7, b->Bool("start"));
+  b->service().stopReportingSessionForID(7, b->Bool("stop"));
+  Run();
+  EXPECT_EQ(b->replies, (std::vector<std::string>{"start=YES", "stop=YES"}));
+  // A's start reply is still held: B stopped nothing.
+  EXPECT_EQ(a->replies, (std::vector<std::string>{"create=YES"}));
+  RuvoReportingSessionPtr session = delegate->findReportingSessionForID(7);
+  ASSERT_TRUE(session);
+  EXPECT_TRUE(session->started());
+  EXPECT_EQ(log.Count("found reporting session 7 for client 100"), 2u);
+}
+
+TEST_F(ServiceDelegateTest, LookupAnswersTheClientAcceptedFirst) {
+  auto a = Connect(100);
+  auto b = Connect(200);
+  b->service().createReportingSession(9, b->Bool("create"));
+  a->service().createReportingSession(9, a->Bool("create"));
+  Run();
+  log.Clear();
+  RuvoReportingSessionPtr found = delegate->findReportingSessionForID(9);
+  ASSERT_TRUE(found);
+  EXPECT_EQ(found->processIdentifiers(), (std::vector<int32_t>{100}));
+  EXPECT_EQ(log.Count("failed to find reporting session 9"), 0u);
+  EXPECT_FALSE(delegate->findReportingSessionForID(10));
+  EXPECT_EQ(log.Count("failed to find reporting session 10", LogLevel::kError), 1u);
+}
+
+TEST_F(ServiceDelegateTest, DisabledReportingRefusesMessagesAndHidesOtherClientsSessions) {
+  auto a = Connect(100);
+  auto b = Connect(200);
+  a->service().createReportingSession(7, a->Bool("create"));
+  a->service().setServiceType(2, 7, a->Bool("type"));
+  Run();
+
+  defaults.Set("disable_reporting", true);
+  PostDefaults();
+  EXPECT_FALSE(delegate->isReportingEnabled());
+  log.Clear();
+
+  std::vector<OptionalError> errors;
+  b->service().sendMessage(Dictionary{{"x", 1}}, 1, 0, std::vector<int64_t>{7},
+                           [&](const OptionalError& error) { errors.push_back(error); });
+  std::optional<Dictionary> valid;
+  b->service().reporterID(7, [&](const Dictionary& answer) { valid = answer; });
+  Run();
+  ASSERT_EQ(errors.size(), 1u);
+  ASSERT_TRUE(errors[0].has_value());
+  EXPECT_EQ(errors[0]->domain, "com.quorvex.audio.reporting");
+  EXPECT_EQ(errors[0]->code, 1);
+  ASSERT_TRUE(valid);
+  EXPECT_EQ(*valid, (Dictionary{{"reporterID", 0}, {"serviceType", 0xFFFF}}));
+  // The disabled search answers none without a word.
+  EXPECT_EQ(log.Count("failed to find reporting session"), 0u);
+
+  defaults.Remove("disable_reporting");
+  PostDefaults();
+  EXPECT_TRUE(delegate->isReportingEnabled());
+  EXPECT_EQ(*delegate->getDefaults(), (Dictionary{{"disable_reporting", 0}}));
+  b->service().reporterID(7, [&](const Dictionary& answer) { valid = answer; });
+  Run();
+  EXPECT_EQ(*valid, (Dictionary{{"reporterID", 7}, {"serviceType", 2}}));
+}
+
+TEST_F(ServiceDelegateTest, BroadcastWithoutRunningSessionsGoesStandaloneAndEmptyListsSendNothing) {
+  auto client = Connect(100);
+  client->service().createReportingSession(7, client->Bool("create"));  // created, not started
+  Run();
+  int nilReplies = 0;
+  auto countNil = [&](const OptionalError& error) { nilReplies += error ? 0 : 1; };
+
+  client->service().sendMessage(Dictionary{{"a", 1}}, 3, 1, std::vector<int64_t>{}, countNil);
+  client->service().sendMessage(Dictionary{{"a", 2}}, 3, 1, std::vector<int64_t>{0, 5}, countNil);
+  Run();
+  EXPECT_EQ(nilReplies, 2);
+  EXPECT_TRUE(platform.telvoro.SingleMessages().empty());
+  EXPECT_TRUE(platform.analytics.Events().empty());
+
+  client->service().sendMessage(Dictionary{{"a", 3}}, 3, 1, std::nullopt, countNil);
+  Run();
+  EXPECT_EQ(nilReplies, 3);
+  EXPECT_EQ(log.Count("no active reporting sessions found, sending as standalone"), 1u);
+  auto singles = platform.telvoro.SingleMessages();
+  ASSERT_EQ(singles.size(), 1u);
+  EXPECT_EQ(singles[0].userInfo[kTelvoroUserInfoServiceName], "standalone");
+  EXPECT_EQ(singles[0].payload, (Dictionary{{"a", 3}}));
+}
+
+TEST_F(ServiceDelegateTest, BroadcastReachesEveryRunningSessionOfEveryClient) {
+  auto a = Connect(100);
+  auto b = Connect(200);
+  a->service().createReportingSession(1, a->Bool("create"));
+  a->service().startReportingSessionForID(1, a->Bool("start"));
+  b->service().createReportingSession(2, b->Bool("create"));
+  b->service().startReportingSessionForID(2, b->Bool("start"));
+  b->service().createReportingSession(3, b->Bool("create"));  // not started: left out
+  Run();
+  a->service().sendMessage(Dictionary{{"EngineOnTime", 4.5}}, 1, 0, std::nullopt, nullptr);
+  Run();
+  EXPECT_EQ(log.Count("active reporting sessions 2 : "), 1u);
+  size_t delivered = 0;
+  for (const auto& session : platform.telvoro.Sessions()) delivered += session->Messages().size();
+  EXPECT_EQ(delivered, 2u);
+  EXPECT_EQ(platform.analytics.Events().size(), 2u);
+  EXPECT_EQ(platform.powerLog.Events().size(), 2u);
+}
+
+TEST_F(ServiceDelegateTest, ServiceTypeOfReporterZeroIsAnsweredTwice) {
+  auto client = Connect(100);
+  std::vector<uint16_t> answers;
+  client->service().getServiceNameForReporterID(0, [&](uint16_t type) { answers.push_back(type); });
+  client->service().getServiceNameForReporterID(44,
+                                                [&](uint16_t type) { answers.push_back(type); });
+  Run();
+  EXPECT_EQ(answers, (std::vector<uint16_t>{0xFFFF, 0xFFFF, 0xFFFF}));
+}
+
+TEST_F(ServiceDelegateTest, CreatingAnIdTwiceReplacesTheSessionWithoutStoppingIt) {
+  auto client = Connect(100);
+  client->service().createReportingSession(7, client->Bool("create"));
+  client->service().startReportingSessionForID(7, client->Bool("start"));
+  Run();
+  client->service().createReportingSession(7, client->Bool("create"));
+  Run();
+  EXPECT_EQ(traces.Count(trace::kSessionStopped), 0u);
+  EXPECT_EQ(traces.Count(trace::kSessionCreated), 2u);
+  RuvoReportingSessionPtr current = delegate->findReportingSessionForID(7);
+  ASSERT_TRUE(current);
+  EXPECT_FALSE(current->started());
+  // The held start reply went with the replaced session: it is never answered.
+  EXPECT_EQ(client->replies, (std::vector<std::string>{"create=YES", "create=YES"}));
+}
+
+TEST_F(ServiceDelegateTest, StopSendsThePositiveDriverDeltaIntoTheSessionFirst) {
+  const int channel = platform.driverStats.AddChannel("Speaker", std::nullopt, "xruns", 10);
+  auto second = RuvoReportingServiceDelegate::init(platform.services);  // subscribes anew
+  delegate = second;
+  auto client = Connect(100);
+  client->service().createReportingSession(7, client->Bool("create"));
+  client->service().startReportingSessionForID(7, client->Bool("start"));
+  Run();
+  platform.driverStats.SetValue(channel, 13);
+  client->service().stopReportingSessionForID(7, client->Bool("stop"));
+  Run();
+  ASSERT_EQ(platform.telvoro.Sessions().size(), 1u);
+  auto messages = platform.telvoro.Sessions()[0]->Messages();
+  ASSERT_GE(messages.size(), 1u);
+  EXPECT_EQ(messages[0].category, 9);
+  EXPECT_EQ(messages[0].type, 0);
+  EXPECT_EQ(messages[0].payload, (Dictionary{{"Speaker_xruns", 3}}));
+  EXPECT_EQ(log.Count("fetching driver logs {\"Speaker_xruns\":3}"), 1u);
+}
+
+TEST_F(ServiceDelegateTest, UnchangedCountersLogNothingInteresting) {
+  auto client = Connect(100);
+  client->service().createReportingSession(7, client->Bool("create"));
+  client->service().startReportingSessionForID(7, client->Bool("start"));
+  client->service().stopReportingSessionForID(7, client->Bool("stop"));
+  Run();
+  EXPECT_EQ(log.Count("nothing interesting to fetch from the drivers"), 1u);
+}
+
+TEST_F(ServiceDelegateTest, DisconnectStopsRunningSessionsAndRemovesTheClientOnce) {
+  processInfo.SetCommandName(100, "mediaplayer");
+  auto client = Connect(100);
+  client->service().createReportingSession(7, client->Bool("create"));
+  client->service().startReportingSessionForID(7, client->Bool("start"));
+  Run();
+  platform.clock.Advance(std::chrono::seconds(42));
+
+  client->connection->End(/*abnormal=*/true);
+  Run();
+  EXPECT_EQ(log.Count("InterruptionHandler: connection exited"), 1u);
+  EXPECT_EQ(log.Count("removing 100 from the server client list"), 1u);
+  EXPECT_TRUE(delegate->getAllClients().empty());
+  EXPECT_EQ(traces.Count(trace::kSessionStopped), 1u);
+  // No held reply on this road.
+  EXPECT_EQ(client->replies, (std::vector<std::string>{"create=YES"}));
+  EXPECT_EQ(log.Count("InvalidationHandler: connection exited process=mediaplayer uptime_sec=42"),
+            1u);
+  auto events = platform.analytics.Events();
+  ASSERT_EQ(events.size(), 1u);
+  EXPECT_EQ(events[0].name, "com.quorvex.tavrin.ruvoreportingclientuptime");
+  ASSERT_TRUE(events[0].payload);
+  EXPECT_EQ((*events[0].payload)["processName"], "mediaplayer");
+  EXPECT_DOUBLE_EQ((*events[0].payload)["seconds"].get<double>(), 42.0);
+  // With the connection and the client list gone, the instance and its sessions are released.
+  EXPECT_EQ(log.Count("dealloc 100 from the server client list"), 1u);
+  EXPECT_EQ(traces.Count(trace::kSessionReleased), 1u);
+}
+
+TEST_F(ServiceDelegateTest, ClientsWithoutANameSendNoUptimeEvent) {
+  auto zero = Connect(0);
+  EXPECT_FALSE(delegate->getAllClients().back()->clientProcessName().has_value());
+  zero->connection->End(/*abnormal=*/false);
+  Run();
+  EXPECT_EQ(log.Count("clientProcessName is nil. clientpid=0"), 1u);
+  EXPECT_EQ(log.Count("InterruptionHandler"), 0u);
+  EXPECT_TRUE(platform.analytics.Events().empty());
+
+  auto own = Connect(processInfo.ownPid);
+  EXPECT_EQ(delegate->getAllClients().back()->clientProcessName(),
+            std::optional<std::string>("tavrind"));
+}
+
+TEST_F(ServiceDelegateTest, ConnectionEndingBeforeItsClientWasListedHasNoStartDate) {
+  auto client = std::make_unique<Client>();
+  client->connection = std::make_shared<FakeClientConnection>(100);
+  processInfo.SetCommandName(100, "early");
+  ASSERT_TRUE(delegate->shouldAcceptNewConnection(listener, client->connection));
+  client->connection->End(/*abnormal=*/false);  // before the queue added the client
+  Run();
+  EXPECT_EQ(log.Count("clientStartDate is nil. clientpid=100 clientprocessname=(null)"), 1u);
+  EXPECT_EQ(log.Count("uptime_sec=-1"), 1u);
+  EXPECT_TRUE(delegate->getAllClients().empty());
+}
+
+TEST_F(ServiceDelegateTest, DefaultsReachEverySessionOfEveryClient) {
+  auto a = Connect(100);
+  a->service().createReportingSession(7, a->Bool("create"));
+  Run();
+  defaults.Set("device_name", "hall");
+  PostDefaults();
+  RuvoReportingSessionPtr session = delegate->findReportingSessionForID(7);
+  ASSERT_TRUE(session);
+  EXPECT_EQ(session->userInfo()["device_name"], "hall");
+  EXPECT_EQ(session->userInfo()["disable_reporting"], 0);
+}
+
+TEST_F(ServiceDelegateTest, DestroyStopsARunningSessionAndRemovesIt) {
+  auto client = Connect(100);
+  client->service().createReportingSession(7, client->Bool("create"));
+  client->service().startReportingSessionForID(7, client->Bool("start"));
+  client->service().destroyReportingSession(7, client->Bool("destroy"));
+  client->service().destroyReportingSession(0, client->Bool("destroy0"));
+  std::vector<int64_t> reporters{-1};
+  client->service().getAllReporters([&](const std::vector<int64_t>& ids) { reporters = ids; });
+  Run();
+  EXPECT_EQ(traces.Count(trace::kSessionStopped), 1u);
+  EXPECT_TRUE(reporters.empty());
+  EXPECT_EQ(log.Count("destroying 7"), 1u);
+  EXPECT_EQ(log.Count("destroying 0"), 0u);
+  EXPECT_EQ(client->replies,
+            (std::vector<std::string>{"create=YES", "destroy=YES", "destroy0=YES"}));
+}
+
+TEST_F(ServiceDelegateTest, GetAllReportersListsClientsInOrder) {
+  auto a = Connect(100);
+  auto b = Connect(200);
+  b->service().createReportingSession(5, b->Bool("c"));
+  a->service().createReportingSession(3, a->Bool("c"));
+  a->service().createReportingSession(1, a->Bool("c"));
+  std::vector<int64_t> reporters;
+  b->service().getAllReporters([&](const std::vector<int64_t>& ids) { reporters = ids; });
+  Run();
+  EXPECT_EQ(reporters, (std::vector<int64_t>{1, 3, 5}));
+}
+
+TEST_F(ServiceDelegateTest, KillServiceEndsTheProcessWithStatusTwoAndNoReply) {
+  std::optional<int> status;
+  RuvoReportingServerInstance::SetProcessExit([&](int code) { status = code; });
+  auto client = Connect(100);
+  bool replied = false;
+  client->service().killService([&](bool) { replied = true; });
+  RuvoReportingServerInstance::SetProcessExit(nullptr);
+  EXPECT_EQ(status, 2);
+  EXPECT_FALSE(replied);
+  EXPECT_EQ(log.Count("DESTROYING SERVICE"), 1u);
+}
+
+TEST_F(ServiceDelegateTest, EntryLinesAreDebugOnlyWhenTheScopeIsVerbose) {
+  log.SetVerbose(false);
+  auto client = Connect(100);
+  client->service().createReportingSession(7, client->Bool("create"));
+  Run();
+  EXPECT_EQ(log.Count("creating session for reporter 7"), 0u);
+  log.SetVerbose(true);
+  client->service().createReportingSession(8, client->Bool("create"));
+  Run();
+  EXPECT_EQ(log.Count("creating session for reporter 8", LogLevel::kDebug), 1u);
+}
+
+}  // namespace
+}  // namespace tavrin
