@@ -1,27 +1,195 @@
+// Entry point of tavrind: builds the Linux platform services, creates the one listener delegate
+// and runs the listener until SIGTERM or SIGINT, which flush the store and exit 0.
+
 #include <csignal>
 #include <cstdio>
+#include <filesystem>
+#include <memory>
+#include <string>
+#include <vector>
 
 #include <CLI/CLI.hpp>
 
+#include "Statistics/Service/RuvoReportingServiceDelegate.h"
+#include "platform/Platform.h"
 #include "platform/SystemLog.h"
+#include "platform/linux/AsioDispatcher.h"
+#include "platform/linux/CountersTreeDriverStats.h"
+#include "platform/linux/LinuxNotificationCenter.h"
+#include "platform/linux/LinuxProcessInfo.h"
+#include "platform/linux/OrientationRegistries.h"
+#include "platform/linux/PosixFileSystem.h"
+#include "platform/linux/ReportingBackends.h"
+#include "platform/linux/SpdlogLogSystem.h"
+#include "platform/linux/TomlDefaultsDomain.h"
+#include "platform/linux/TomlDeviceInfo.h"
+#include "platform/linux/UnixServiceListener.h"
 
-// Entry point of tavrind. The front end (listener and client instances) is not built yet: for now
-// the process parses its flags, says what is missing and waits for SIGINT or SIGTERM.
-int main(int argc, char** argv) {
-  CLI::App app{"tavrind: the audio reporting service"};
+namespace {
+
+// Exit statuses besides 0 (clean stop) and 2 (killService).
+constexpr int kUsageError = 64;     // a flag or value that cannot be used
+constexpr int kStartupFailure = 1;  // the socket cannot be set up
+
+struct Options {
   std::string root;
-  app.add_option("--root", root, "put every path under DIR")->envname("TAVRIN_ROOT");
-  CLI11_PARSE(app, argc, argv);
+  std::string socket = "/run/tavrin/reporting.sock";
+  std::string socketMode = "0666";
+  std::string defaults = "/etc/tavrin/com.quorvex.tavrin.toml";
+  std::string deviceInfo = "/etc/tavrin/device.toml";
+  std::string stateDir = "/var/lib/tavrin";
+  std::string diagnosticDir = "/var/log/tavrin/DiagnosticLogs";
+  std::string driverStatsRoot = "/run/tavrin/driverstats";
+  std::string orientation = "none";
+  std::vector<std::string> backends;
+  std::string logTarget = "stderr";
+};
 
-  sigset_t signals;
-  sigemptyset(&signals);
-  sigaddset(&signals, SIGINT);
-  sigaddset(&signals, SIGTERM);
-  pthread_sigmask(SIG_BLOCK, &signals, nullptr);
-  TLOG_DEFAULT(nullptr, "tavrind started (root {}); the client front end is not available yet",
-               root.empty() ? "/" : root);
-  int received = 0;
-  sigwait(&signals, &received);
-  TLOG_DEFAULT(nullptr, "tavrind stopping on signal {}", received);
+// With --root, every path that was not given explicitly moves under the root.
+void ApplyRoot(Options& options, const CLI::App& app) {
+  if (options.root.empty()) return;
+  const std::filesystem::path root = std::filesystem::absolute(options.root);
+  auto place = [&](const char* flag, std::string& value, const std::filesystem::path& relative) {
+    if (app.count(flag) == 0) value = (root / relative).string();
+  };
+  place("--socket", options.socket, "run/reporting.sock");
+  place("--defaults", options.defaults, "etc/com.quorvex.tavrin.toml");
+  place("--device-info", options.deviceInfo, "etc/device.toml");
+  place("--state-dir", options.stateDir, "lib");
+  place("--diagnostic-dir", options.diagnosticDir, "log/DiagnosticLogs");
+  place("--driver-stats-root", options.driverStatsRoot, "driverstats");
+  std::error_code ignored;
+  for (const auto& directory :
+       {root / "run", root / "etc", root / "lib", root / "log", root / "driverstats"}) {
+    std::filesystem::create_directories(directory, ignored);
+  }
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  CLI::App app{"tavrind: the reporting service of the audio stack"};
+  Options options;
+  app.add_option("--root", options.root, "put every path under DIR (the embedded default)")
+      ->envname("TAVRIN_ROOT");
+  app.add_option("--socket", options.socket, "listening socket (ignored under socket activation)")
+      ->envname("TAVRIN_SOCKET");
+  app.add_option("--socket-mode", options.socketMode, "permissions of the socket file");
+  app.add_option("--defaults", options.defaults, "the defaults domain (a TOML file)")
+      ->envname("TAVRIN_DEFAULTS");
+  app.add_option("--device-info", options.deviceInfo, "device facts (a TOML file)");
+  app.add_option("--state-dir", options.stateDir, "directory of the store tavrin.db");
+  app.add_option("--diagnostic-dir", options.diagnosticDir,
+                 "summary files go to DIR/Audio/Reporting");
+  app.add_option("--driver-stats-root", options.driverStatsRoot, "the counters tree");
+  app.add_option("--orientation", options.orientation, "none, iio or feed:PATH");
+  app.add_option("--backend", options.backends,
+                 "sqlite, kafka:BOOTSTRAP[,topic-prefix=P] or none (repeatable)");
+  app.add_option("--log-target", options.logTarget, "stderr or journal")
+      ->check(CLI::IsMember({"stderr", "journal"}));
+  CLI11_PARSE(app, argc, argv);
+  ApplyRoot(options, app);
+
+  unsigned socketMode = 0;
+  try {
+    socketMode = static_cast<unsigned>(std::stoul(options.socketMode, nullptr, 8));
+  } catch (const std::exception&) {
+    std::fprintf(stderr, "tavrind: --socket-mode %s is not an octal mode\n",
+                 options.socketMode.c_str());
+    return kUsageError;
+  }
+
+  using namespace tavrin;
+  TomlDefaultsDomain defaults(options.defaults);
+  SpdlogLogSystem logSystem(
+      defaults, options.logTarget == "journal" ? LogTargetKind::kJournal : LogTargetKind::kStderr);
+  InstallLogSystem(&logSystem);
+
+  std::string error;
+  auto specs = ParseBackendSpecs(options.backends, &error);
+  if (!specs) {
+    TLOG_ERROR(nullptr, "{}", error);
+    return kUsageError;
+  }
+  std::unique_ptr<OrientationRegistry> orientation =
+      MakeOrientationRegistry(options.orientation, nullptr, &error);
+  if (!orientation) {
+    TLOG_ERROR(nullptr, "--orientation: {}", error);
+    return kUsageError;
+  }
+
+  UnixServiceListener listener(UnixListenerOptions{options.socket, socketMode});
+  try {
+    listener.Open();
+  } catch (const std::system_error& failure) {
+    TLOG_ERROR(nullptr, "cannot listen: {}", failure.what());
+    return kStartupFailure;
+  }
+
+  AsioDispatcher dispatcher;
+  LinuxNotificationCenter notifications(listener.Io());
+  if (OptionalError watchError = notifications.WatchDefaults(options.defaults)) {
+    TLOG_ERROR(nullptr, "defaults {} are not watched for changes: {}", options.defaults,
+               watchError->LocalizedDescription());
+  }
+  TomlDeviceInfo deviceInfo(options.deviceInfo);
+  LinuxProcessInfo processInfo;
+  PosixFileSystem fileSystem;
+  CountersTreeDriverStats driverStats(options.driverStatsRoot);
+
+  BackendEnvironment environment;
+  environment.stateDirectory = options.stateDir;
+  BackendReportingService reporting(CreateBackends(*specs, environment), SystemClock(),
+                                    SystemRandom());
+  reporting.ApplyDefaults(defaults.Read());
+
+  PlatformServices services;
+  services.dispatcher = &dispatcher;
+  services.random = &SystemRandom();
+  services.telvoro = &reporting;
+  services.analytics = &reporting;
+  services.powerLog = &reporting;
+  services.driverStats = &driverStats;
+  services.orientation = orientation.get();
+  services.deviceInfo = &deviceInfo;
+  services.processInfo = &processInfo;
+  services.fileSystem = &fileSystem;
+  services.notifications = &notifications;
+  services.defaults = &defaults;
+  services.diagnosticDirectory = options.diagnosticDir;
+  InstallPlatform(&services);
+
+  // Log verbosity and the analytics policy follow the defaults as the settings do.
+  int refreshToken = -1;
+  notifications.RegisterNotificationHandler(kDefaultsNotificationName, &refreshToken,
+                                            dispatcher.BackgroundQueue(), [&](int) {
+                                              logSystem.Refresh();
+                                              reporting.ApplyDefaults(defaults.Read());
+                                            });
+
+  auto delegate = RuvoReportingServiceDelegate::init(services);
+  listener.SetDelegate(delegate.get());
+
+  asio::signal_set stopSignals(listener.Io(), SIGTERM, SIGINT);
+  stopSignals.async_wait([&](const asio::error_code& waitError, int signal) {
+    if (waitError) return;
+    TLOG_DEFAULT(nullptr, "stopping on signal {}", signal);
+    listener.Stop();
+  });
+
+  TLOG_DEFAULT(nullptr, "tavrind listening on {}{}; store in {}", options.socket,
+               listener.SocketActivated() ? " (socket activation)" : "", options.stateDir);
+  listener.Resume();
+
+  // Orderly stop: client clean-ups and queued deliveries run, then the store commits everything
+  // it accepted.
+  notifications.Cancel(refreshToken);
+  dispatcher.Shutdown();
+  reporting.Shutdown();
+  listener.SetDelegate(nullptr);
+  delegate.reset();
+  InstallPlatform(nullptr);
+  TLOG_DEFAULT(nullptr, "tavrind stopped");
+  InstallLogSystem(nullptr);
   return 0;
 }

@@ -1,0 +1,77 @@
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <mutex>
+#include <set>
+#include <string>
+
+#include <asio.hpp>
+
+#include "platform/ServiceListener.h"
+#include "protocol/Frame.h"
+
+namespace tavrin {
+
+struct UnixListenerOptions {
+  // Where to bind when the socket is not handed over by systemd.
+  std::string socketPath;
+  // Permission bits of the socket file (not reduced by the umask).
+  unsigned socketMode = 0666;
+  uint32_t frameLimit = protocol::kDefaultFrameLimit;
+  // Adopt a listening socket passed as descriptor 3 (LISTEN_FDS/LISTEN_PID) when there is one.
+  bool allowSocketActivation = true;
+};
+
+class UnixClientConnection;
+
+// The service's listening socket: a unix-domain stream socket speaking the framed MessagePack
+// protocol. One I/O thread — the one that calls Resume() — accepts connections, reads and decodes
+// requests, calls the exported object and writes replies; replies may be produced on any thread.
+//
+// How a connection's end maps onto its handlers: every end runs the invalidation handler once;
+// the interruption handler runs before it when the end was abnormal (the service closed the
+// connection after an undecodable frame, or the stream ended inside a frame).
+class UnixServiceListener final : public ServiceListener {
+ public:
+  explicit UnixServiceListener(UnixListenerOptions options);
+  ~UnixServiceListener() override;
+  UnixServiceListener(const UnixServiceListener&) = delete;
+  UnixServiceListener& operator=(const UnixServiceListener&) = delete;
+
+  // Adopts the socket-activation descriptor or binds options.socketPath (creating its directory,
+  // replacing a stale socket file but never another kind of file or a live service's socket).
+  // Throws std::system_error with a message that names the path.
+  void Open();
+  // True when Open() adopted a socket passed by systemd.
+  bool SocketActivated() const { return socketActivated_; }
+  const std::string& SocketPath() const { return options_.socketPath; }
+
+  void SetDelegate(ServiceListenerDelegate* delegate) override;
+  // Runs the I/O loop on the calling thread until Stop().
+  void Resume() override;
+  // Thread-safe; makes Resume() return. Connections are closed.
+  void Stop();
+
+  // The I/O loop, for other watchers that want to run on the listener's thread.
+  asio::io_context& Io() { return io_; }
+
+  // Connections open now (for tests and status lines).
+  size_t ConnectionCount() const;
+
+ private:
+  friend class UnixClientConnection;
+  void StartAccept();
+  void Forget(const std::shared_ptr<UnixClientConnection>& connection);
+
+  UnixListenerOptions options_;
+  asio::io_context io_;
+  asio::local::stream_protocol::acceptor acceptor_;
+  ServiceListenerDelegate* delegate_ = nullptr;
+  bool socketActivated_ = false;
+  bool boundPath_ = false;
+  mutable std::mutex connectionsMutex_;
+  std::set<std::shared_ptr<UnixClientConnection>> connections_;  // guarded by connectionsMutex_
+};
+
+}  // namespace tavrin
