@@ -1,0 +1,246 @@
+#pragma once
+
+// Starts the real tavrind in a temporary --root and talks to it over its socket, for end-to-end
+// tests. Header-only so that each e2e test executable can use it without another library.
+
+#include <fcntl.h>
+#include <poll.h>
+#include <signal.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <optional>
+#include <sstream>
+#include <string>
+#include <thread>
+#include <variant>
+#include <vector>
+
+#include "protocol/Codec.h"
+#include "protocol/Frame.h"
+
+namespace tavrin::testing {
+
+#ifndef TAVRIND_PATH
+#error "TAVRIND_PATH must name the tavrind binary"
+#endif
+
+// Generous: the machine may be busy compiling while tests run.
+inline constexpr auto kE2eTimeout = std::chrono::seconds(20);
+
+inline std::string MakeTempDirectory(const char* prefix) {
+  std::string pattern = (std::filesystem::temp_directory_path() / prefix).string() + "XXXXXX";
+  std::vector<char> buffer(pattern.begin(), pattern.end());
+  buffer.push_back('\0');
+  if (mkdtemp(buffer.data()) == nullptr) std::abort();
+  return buffer.data();
+}
+
+// One tavrind process in its own root. Stopped with SIGTERM on destruction.
+class TavrindProcess {
+ public:
+  explicit TavrindProcess(std::vector<std::string> extraArguments = {},
+                          std::string root = MakeTempDirectory("tavrin-e2e-"))
+      : root_(std::move(root)), arguments_(std::move(extraArguments)) {}
+
+  ~TavrindProcess() {
+    if (pid_ > 0) {
+      ::kill(pid_, SIGKILL);
+      ::waitpid(pid_, nullptr, 0);
+    }
+    std::error_code ignored;
+    std::filesystem::remove_all(root_, ignored);
+  }
+
+  // Starts the service and waits until its socket accepts connections. False on failure.
+  bool Start() {
+    logPath_ = root_ + "/tavrind.log";
+    std::vector<std::string> argv{TAVRIND_PATH, "--root", root_};
+    argv.insert(argv.end(), arguments_.begin(), arguments_.end());
+    pid_ = ::fork();
+    if (pid_ == 0) {
+      const int log = ::open(logPath_.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+      ::dup2(log, STDOUT_FILENO);
+      ::dup2(log, STDERR_FILENO);
+      std::vector<char*> raw;
+      for (auto& argument : argv) raw.push_back(argument.data());
+      raw.push_back(nullptr);
+      ::execv(raw[0], raw.data());
+      ::_exit(127);
+    }
+    const auto deadline = std::chrono::steady_clock::now() + kE2eTimeout;
+    while (std::chrono::steady_clock::now() < deadline) {
+      if (Exited()) return false;
+      if (CanConnect()) return true;
+      std::this_thread::sleep_for(std::chrono::milliseconds(20));
+    }
+    return false;
+  }
+
+  // Sends `signal` and waits for the exit status (nullopt when it did not exit in time).
+  std::optional<int> Stop(int signal = SIGTERM) {
+    if (pid_ <= 0) return exitStatus_;
+    ::kill(pid_, signal);
+    return WaitForExit();
+  }
+
+  std::optional<int> WaitForExit() {
+    const auto deadline = std::chrono::steady_clock::now() + kE2eTimeout;
+    while (std::chrono::steady_clock::now() < deadline) {
+      if (Exited()) return exitStatus_;
+      std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+    return std::nullopt;
+  }
+
+  std::string Log() const {
+    std::ifstream in(logPath_);
+    std::stringstream text;
+    text << in.rdbuf();
+    return text.str();
+  }
+  size_t LogCount(const std::string& needle) const {
+    const std::string log = Log();
+    size_t count = 0;
+    for (size_t at = log.find(needle); at != std::string::npos; at = log.find(needle, at + 1)) {
+      ++count;
+    }
+    return count;
+  }
+  // Waits until the log holds `needle` at least `count` times.
+  bool WaitForLog(const std::string& needle, size_t count = 1) const {
+    const auto deadline = std::chrono::steady_clock::now() + kE2eTimeout;
+    while (std::chrono::steady_clock::now() < deadline) {
+      if (LogCount(needle) >= count) return true;
+      std::this_thread::sleep_for(std::chrono::milliseconds(20));
+    }
+    return false;
+  }
+
+  const std::string& root() const { return root_; }
+  std::string SocketPath() const { return root_ + "/run/reporting.sock"; }
+  std::string DatabasePath() const { return root_ + "/lib/tavrin.db"; }
+  std::string DefaultsPath() const { return root_ + "/etc/com.quorvex.tavrin.toml"; }
+  pid_t pid() const { return pid_; }
+  std::optional<int> exitStatus() const { return exitStatus_; }
+
+ private:
+  bool Exited() {
+    if (pid_ <= 0) return true;
+    int status = 0;
+    if (::waitpid(pid_, &status, WNOHANG) == pid_) {
+      exitStatus_ = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+      pid_ = -1;
+      return true;
+    }
+    return false;
+  }
+
+  bool CanConnect() const {
+    const int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    const std::string path = SocketPath();
+    std::snprintf(address.sun_path, sizeof(address.sun_path), "%s", path.c_str());
+    const bool connected =
+        ::connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof(address)) == 0;
+    ::close(fd);
+    return connected;
+  }
+
+  std::string root_;
+  std::vector<std::string> arguments_;
+  std::string logPath_;
+  pid_t pid_ = -1;
+  std::optional<int> exitStatus_;
+};
+
+// A blocking client over one connection: sends raw frames or requests, reads replies with a
+// time-out.
+class TestClient {
+ public:
+  explicit TestClient(const std::string& socketPath) {
+    fd_ = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    std::snprintf(address.sun_path, sizeof(address.sun_path), "%s", socketPath.c_str());
+    connected_ = ::connect(fd_, reinterpret_cast<sockaddr*>(&address), sizeof(address)) == 0;
+  }
+  ~TestClient() { Close(); }
+  TestClient(const TestClient&) = delete;
+  TestClient& operator=(const TestClient&) = delete;
+
+  bool connected() const { return connected_; }
+  void Close() {
+    if (fd_ >= 0) ::close(fd_);
+    fd_ = -1;
+  }
+
+  bool SendBytes(const std::vector<uint8_t>& bytes) {
+    size_t sent = 0;
+    while (sent < bytes.size()) {
+      const ssize_t n = ::send(fd_, bytes.data() + sent, bytes.size() - sent, MSG_NOSIGNAL);
+      if (n <= 0) return false;
+      sent += static_cast<size_t>(n);
+    }
+    return true;
+  }
+  bool SendBody(const std::vector<uint8_t>& body) { return SendBytes(protocol::EncodeFrame(body)); }
+  bool Send(uint64_t call, protocol::Arguments arguments) {
+    return SendBody(protocol::EncodeRequest(protocol::Request{call, std::move(arguments)}));
+  }
+  bool SendNoReply(protocol::Arguments arguments) {
+    return SendBody(protocol::EncodeRequest(protocol::Request{std::nullopt, std::move(arguments)}));
+  }
+
+  // The next reply, or nothing when none came in time or the connection ended.
+  std::optional<protocol::Reply> Read(std::chrono::milliseconds timeout = kE2eTimeout) {
+    const auto deadline = std::chrono::steady_clock::now() + timeout;
+    for (;;) {
+      const auto status = reader_.Next();
+      if (status == protocol::FrameReader::Status::kFrame) {
+        auto decoded = protocol::DecodeReply(reader_.Body());
+        if (auto* reply = std::get_if<protocol::Reply>(&decoded)) return *reply;
+        return std::nullopt;
+      }
+      if (status == protocol::FrameReader::Status::kBadLength) return std::nullopt;
+      const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
+          deadline - std::chrono::steady_clock::now());
+      if (left.count() <= 0) return std::nullopt;
+      pollfd poller{fd_, POLLIN, 0};
+      if (::poll(&poller, 1, static_cast<int>(left.count())) <= 0) return std::nullopt;
+      uint8_t buffer[65536];
+      const ssize_t n = ::recv(fd_, buffer, sizeof(buffer), 0);
+      if (n <= 0) return std::nullopt;
+      reader_.Append(std::span<const uint8_t>(buffer, static_cast<size_t>(n)));
+    }
+  }
+
+  // True when the service closed the connection (end of stream within the time-out).
+  bool WaitForClose(std::chrono::milliseconds timeout = kE2eTimeout) {
+    const auto deadline = std::chrono::steady_clock::now() + timeout;
+    while (std::chrono::steady_clock::now() < deadline) {
+      pollfd poller{fd_, POLLIN, 0};
+      if (::poll(&poller, 1, 50) > 0) {
+        uint8_t buffer[4096];
+        const ssize_t n = ::recv(fd_, buffer, sizeof(buffer), 0);
+        if (n <= 0) return true;
+      }
+    }
+    return false;
+  }
+
+ private:
+  int fd_ = -1;
+  bool connected_ = false;
+  protocol::FrameReader reader_;
+};
+
+}  // namespace tavrin::testing
