@@ -105,12 +105,8 @@ class Pack {
     if (value <= 0xffffffff) return integer(IntFormat::kUint32, value);
     return integer(IntFormat::kUint64, value);
   }
-  Pack& float64(double value) {
-    return big(0xcb, std::bit_cast<uint64_t>(value), 8);
-  }
-  Pack& float32(float value) {
-    return big(0xca, std::bit_cast<uint32_t>(value), 4);
-  }
+  Pack& float64(double value) { return big(0xcb, std::bit_cast<uint64_t>(value), 8); }
+  Pack& float32(float value) { return big(0xca, std::bit_cast<uint32_t>(value), 4); }
   Pack& str(std::string_view text) {
     if (text.size() <= 31) {
       raw({static_cast<uint8_t>(0xa0 | text.size())});
@@ -134,8 +130,12 @@ class Pack {
     if (pairs <= 0xffff) return big(0xde, pairs, 2);
     return big(0xdf, pairs, 4);
   }
+  Pack& zeros(size_t count) {
+    bytes_.insert(bytes_.end(), count, 0);
+    return *this;
+  }
   // A format byte followed by `size` bytes of `value`, big-endian.
-  Pack& big(uint8_t format, uint64_t value, int size) {
+  Pack& big(uint8_t format, uint64_t value, int size) {  // size 1 to 8
     bytes_.push_back(format);
     for (int i = size - 1; i >= 0; --i) bytes_.push_back(static_cast<uint8_t>(value >> (8 * i)));
     return *this;

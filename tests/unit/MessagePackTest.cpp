@@ -180,8 +180,8 @@ TEST(MessagePackTest, BinAndExtAreNamedAndNotParsed) {
       {Pack().raw({0xd4, 5, 1}), "fixext1"},
       {Pack().raw({0xd5, 5, 1, 2}), "fixext2"},
       {Pack().raw({0xd6, 5, 1, 2, 3, 4}), "fixext4"},
-      {Pack().raw({0xd7, 5}).big(0, 0, 7), "fixext8"},
-      {Pack().raw({0xd8, 5}).big(0, 0, 15), "fixext16"},
+      {Pack().raw({0xd7, 5}).zeros(8), "fixext8"},
+      {Pack().raw({0xd8, 5}).zeros(16), "fixext16"},
   };
   for (const Case& c : cases) {
     // Inside a request, after other elements, so the scan must skip over it correctly.
