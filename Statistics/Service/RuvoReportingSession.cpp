@@ -54,6 +54,7 @@ Dictionary CleanedPayload(const Dictionary& payload, bool* changed) {
   if (!blanks) return payload;
   *changed = true;
   Dictionary cleaned = MakeDictionary();
+  cleaned.get_ref<Dictionary::object_t&>().reserve(payload.size());
   for (const auto& item : payload.items()) {
     std::string key = item.key();
     for (char& c : key) {
@@ -339,8 +340,11 @@ void RuvoReportingSession::sendMessage(const Dictionary& payload, uint32_t categ
   TLOG_DEBUG(SessionLog(), "sending message for session owned by {}", reporterID_);
   bool changed = false;
   auto cleaned = std::make_shared<const Dictionary>(CleanedPayload(payload, &changed));
-  // The message as received is kept apart only when cleaning changed it (for the log line).
-  PayloadPtr received = changed ? std::make_shared<const Dictionary>(payload) : cleaned;
+  // The message as received is only shown by a debug line at delivery; it is kept apart only
+  // when cleaning changed it and debug lines are on.
+  PayloadPtr received = changed && LogTarget(SessionLog()).ShouldLog(LogLevel::kDebug)
+                            ? std::make_shared<const Dictionary>(payload)
+                            : cleaned;
   std::string messageId = messageIdForCategory(category, type);
   appendAggregated(cleaned);
   appendNested(NestedPayloadEntry{std::move(messageId), cleaned});
@@ -568,7 +572,7 @@ void RuvoReportingSession::sendSingleMessage(const Dictionary& payload, uint32_t
   bool changed = false;
   Dictionary cleaned = CleanedPayload(payload, &changed);
   std::optional<Dictionary> received;
-  if (changed) received = payload;
+  if (changed && LogTarget(SessionLog()).ShouldLog(LogLevel::kDebug)) received = payload;
   Work send = [&platform, cleaned = std::move(cleaned), received = std::move(received), category,
                type, serviceType, reply = std::move(reply)] {
     EmitTracePoint(trace::kMessageSent);
