@@ -10,12 +10,20 @@ export ASAN_OPTIONS="detect_leaks=1:abort_on_error=1:strict_string_checks=1"
 export UBSAN_OPTIONS="print_stacktrace=1:halt_on_error=1"
 export TSAN_OPTIONS="halt_on_error=1:second_deadlock_stack=1"
 
+# Rebuilds of unchanged sources come from ccache (keyed on paths relative to the checkout, so
+# another clone of the same tree hits too); a cold cache only makes the first run slower.
+launcher=()
+if command -v ccache >/dev/null; then
+  export CCACHE_BASEDIR="$PWD" CCACHE_NOHASHDIR=1 CCACHE_MAXSIZE=5G
+  launcher=(-DCMAKE_CXX_COMPILER_LAUNCHER=ccache)
+fi
+
 run_build() {
   local name=$1
   shift
   local dir="build/$name"
   echo "== $name build"
-  cmake -S . -B "$dir" -G Ninja -DTAVRIN_WERROR=ON "$@" >/dev/null
+  cmake -S . -B "$dir" -G Ninja -DTAVRIN_WERROR=ON "${launcher[@]}" "$@" >/dev/null
   ninja -C "$dir"
   echo "== $name tests"
   ctest --test-dir "$dir" --output-on-failure --timeout 600 -j "$(nproc)"

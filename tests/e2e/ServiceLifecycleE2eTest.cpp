@@ -82,5 +82,31 @@ TEST(ServiceLifecycleE2eTest, KillServiceEndsTheProcessWithStatusTwoAndNoReply) 
   EXPECT_EQ(service.LogCount("DESTROYING SERVICE"), 1u);
 }
 
+TEST(ServiceLifecycleE2eTest, SocketActivationServesThePassedSocketAndLeavesItsOwnPathAlone) {
+  const std::string directory = testing::MakeTempDirectory("tavrin-activation-");
+  const std::string path = directory + "/activated.sock";
+  const int fd = ::socket(AF_UNIX, SOCK_STREAM, 0);
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  std::snprintf(address.sun_path, sizeof(address.sun_path), "%s", path.c_str());
+  ASSERT_EQ(::bind(fd, reinterpret_cast<sockaddr*>(&address), sizeof(address)), 0);
+  ASSERT_EQ(::listen(fd, 16), 0);
+
+  TavrindProcess service;
+  ASSERT_TRUE(service.StartActivated(fd, path)) << service.Log();
+  ::close(fd);
+  TestClient client(path);
+  ASSERT_TRUE(client.connected());
+  client.Send(5, protocol::CreateReportingSession{11});
+  auto reply = client.Read();
+  ASSERT_TRUE(reply) << service.Log();
+  EXPECT_EQ(reply->call, 5u);
+  EXPECT_EQ(protocol::BoolReplyValue(reply->value), std::optional<bool>(true));
+  EXPECT_EQ(service.LogCount("(socket activation)"), 1u);
+  EXPECT_FALSE(std::filesystem::exists(service.root() + "/run/reporting.sock"));
+  EXPECT_EQ(service.Stop(SIGINT), 0) << service.Log();
+  std::filesystem::remove_all(directory);
+}
+
 }  // namespace
 }  // namespace tavrin

@@ -59,6 +59,14 @@ class TavrindProcess {
     std::filesystem::remove_all(root_, ignored);
   }
 
+  // Starts the service the way socket activation does: `listeningFd` (bound to `socketPath` and
+  // listening) becomes descriptor 3 with LISTEN_FDS=1 and LISTEN_PID set to the child.
+  bool StartActivated(int listeningFd, std::string socketPath) {
+    activationFd_ = listeningFd;
+    socketPath_ = std::move(socketPath);
+    return Start();
+  }
+
   // Starts the service and waits until its socket accepts connections. False on failure.
   bool Start() {
     logPath_ = root_ + "/tavrind.log";
@@ -69,6 +77,11 @@ class TavrindProcess {
       const int log = ::open(logPath_.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
       ::dup2(log, STDOUT_FILENO);
       ::dup2(log, STDERR_FILENO);
+      if (activationFd_ >= 0) {
+        ::dup2(activationFd_, 3);
+        ::setenv("LISTEN_FDS", "1", 1);
+        ::setenv("LISTEN_PID", std::to_string(::getpid()).c_str(), 1);
+      }
       std::vector<char*> raw;
       for (auto& argument : argv) raw.push_back(argument.data());
       raw.push_back(nullptr);
@@ -125,7 +138,9 @@ class TavrindProcess {
   }
 
   const std::string& root() const { return root_; }
-  std::string SocketPath() const { return root_ + "/run/reporting.sock"; }
+  std::string SocketPath() const {
+    return socketPath_.empty() ? root_ + "/run/reporting.sock" : socketPath_;
+  }
   std::string DatabasePath() const { return root_ + "/lib/tavrin.db"; }
   std::string DefaultsPath() const { return root_ + "/etc/com.quorvex.tavrin.toml"; }
   pid_t pid() const { return pid_; }
@@ -158,6 +173,8 @@ class TavrindProcess {
   std::string root_;
   std::vector<std::string> arguments_;
   std::string logPath_;
+  std::string socketPath_;
+  int activationFd_ = -1;
   pid_t pid_ = -1;
   std::optional<int> exitStatus_;
 };
