@@ -106,6 +106,7 @@ using Arguments = std::variant<CreateReportingSession, SetServiceType, GetServic
                                SetConfiguration, StartReportingSessionForID, SendMessage,
                                StopReportingSessionForID, DestroyReportingSession, ReporterIDValid,
                                GetAllReporters, KillService>;
+static_assert(std::variant_size_v<Arguments> == kLastOp, "one alternative per operation");
 
 struct Request {
   std::optional<uint64_t> call;  // nullopt (nil on the wire): the client wants no reply
