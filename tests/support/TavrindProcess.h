@@ -225,6 +225,8 @@ class TestClient {
       if (status == protocol::FrameReader::Status::kFrame) {
         auto decoded = protocol::DecodeReply(reader_.Body());
         if (auto* reply = std::get_if<protocol::Reply>(&decoded)) return *reply;
+        std::fprintf(stderr, "TestClient: undecodable reply: %s\n",
+                     std::get<std::string>(decoded).c_str());
         return std::nullopt;
       }
       if (status == protocol::FrameReader::Status::kBadLength) return std::nullopt;

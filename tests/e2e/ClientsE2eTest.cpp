@@ -1,0 +1,127 @@
+#include <gtest/gtest.h>
+#include <sqlite3.h>
+#include <sys/prctl.h>
+
+#include <atomic>
+#include <csignal>
+#include <thread>
+
+#include "tests/support/TavrindProcess.h"
+
+namespace tavrin {
+namespace {
+
+using testing::TavrindProcess;
+using testing::TestClient;
+
+std::vector<std::vector<std::string>> Query(const std::string& database, const std::string& sql) {
+  std::vector<std::vector<std::string>> rows;
+  sqlite3* db = nullptr;
+  if (sqlite3_open_v2(database.c_str(), &db, SQLITE_OPEN_READONLY, nullptr) == SQLITE_OK) {
+    sqlite3_stmt* statement = nullptr;
+    if (sqlite3_prepare_v2(db, sql.c_str(), -1, &statement, nullptr) == SQLITE_OK) {
+      while (sqlite3_step(statement) == SQLITE_ROW) {
+        std::vector<std::string> row;
+        for (int i = 0; i < sqlite3_column_count(statement); ++i) {
+          const auto* text = sqlite3_column_text(statement, i);
+          row.emplace_back(text ? reinterpret_cast<const char*>(text) : "");
+        }
+        rows.push_back(std::move(row));
+      }
+    }
+    sqlite3_finalize(statement);
+  }
+  sqlite3_close(db);
+  return rows;
+}
+
+TEST(ClientsE2eTest, ClientKilledMidSessionIsCleanedUpOnceAndItsUptimeRecorded) {
+  TavrindProcess service;
+  ASSERT_TRUE(service.Start()) << service.Log();
+  int ready[2];
+  ASSERT_EQ(::pipe(ready), 0);
+  const pid_t child = ::fork();
+  if (child == 0) {
+    ::prctl(PR_SET_NAME, "killedclient");
+    TestClient client(service.SocketPath());
+    client.Send(1, protocol::CreateReportingSession{77});
+    client.Send(2, protocol::StartReportingSessionForID{77});
+    client.Send(3, protocol::SendMessage{Dictionary{{"level", 3}}, 2, 0, std::vector<int64_t>{77}});
+    client.Read();  // create
+    client.Read();  // message accepted: the start ran before it
+    const char byte = 1;
+    if (::write(ready[1], &byte, 1) != 1) ::_exit(1);
+    ::pause();
+    ::_exit(0);
+  }
+  char byte = 0;
+  ASSERT_EQ(::read(ready[0], &byte, 1), 1);
+  ::kill(child, SIGKILL);
+  ::waitpid(child, nullptr, 0);
+  ::close(ready[0]);
+  ::close(ready[1]);
+
+  const std::string removed = "removing " + std::to_string(child) + " from the server client list";
+  ASSERT_TRUE(service.WaitForLog(removed)) << service.Log();
+  ASSERT_TRUE(service.WaitForLog("InvalidationHandler: connection exited process=killedclient"))
+      << service.Log();
+  EXPECT_EQ(service.Stop(SIGTERM), 0);
+  EXPECT_EQ(service.LogCount(removed), 1u);
+  // The clean-up stopped the session: its summary went out through its own path.
+  auto summaries = Query(service.DatabasePath(),
+                         "SELECT payload FROM session_messages WHERE reporter_id = 77 AND "
+                         "category = 65535");
+  ASSERT_EQ(summaries.size(), 1u);
+  EXPECT_NE(summaries[0][0].find("\"level\":\"3\""), std::string::npos);
+  auto uptime = Query(service.DatabasePath(),
+                      "SELECT payload FROM analytics_events WHERE name = "
+                      "'com.quorvex.tavrin.ruvoreportingclientuptime'");
+  ASSERT_EQ(uptime.size(), 1u);
+  EXPECT_NE(uptime[0][0].find("\"processName\":\"killedclient\""), std::string::npos);
+}
+
+TEST(ClientsE2eTest, FiftyConcurrentClientsLoseNoMessageAndGetStartBeforeStop) {
+  constexpr int kClients = 50;
+  constexpr int kMessages = 100;
+  TavrindProcess service;
+  ASSERT_TRUE(service.Start()) << service.Log();
+  std::atomic<int> failures{0};
+  std::vector<std::thread> threads;
+  for (int c = 0; c < kClients; ++c) {
+    threads.emplace_back([&, c] {
+      const int64_t id = 1000 + c;
+      TestClient client(service.SocketPath());
+      client.Send(1, protocol::CreateReportingSession{id});
+      client.Send(2, protocol::StartReportingSessionForID{id});
+      for (int m = 0; m < kMessages; ++m) {
+        client.Send(100 + m, protocol::SendMessage{Dictionary{{"n", m}, {"client", c}}, 1, 0,
+                                                   std::vector<int64_t>{id}});
+      }
+      client.Send(3, protocol::StopReportingSessionForID{id});
+      std::vector<uint64_t> calls;
+      for (int r = 0; r < kMessages + 3; ++r) {
+        auto reply = client.Read();
+        if (!reply) break;
+        calls.push_back(reply->call);
+      }
+      const bool complete = calls.size() == size_t(kMessages + 3);
+      const bool startBeforeStop = complete && calls[calls.size() - 2] == 2 && calls.back() == 3;
+      if (!complete || !startBeforeStop) failures.fetch_add(1);
+    });
+  }
+  for (auto& thread : threads) thread.join();
+  EXPECT_EQ(failures.load(), 0);
+  EXPECT_EQ(service.Stop(SIGTERM), 0) << service.Log();
+
+  auto perReporter = Query(service.DatabasePath(),
+                           "SELECT reporter_id, COUNT(*), COUNT(DISTINCT json_extract(payload, "
+                           "'$.n')) FROM session_messages WHERE category = 1 GROUP BY reporter_id");
+  ASSERT_EQ(perReporter.size(), size_t(kClients));
+  for (const auto& row : perReporter) {
+    EXPECT_EQ(row[1], std::to_string(kMessages)) << "reporter " << row[0];
+    EXPECT_EQ(row[2], std::to_string(kMessages)) << "reporter " << row[0];
+  }
+}
+
+}  // namespace
+}  // namespace tavrin
