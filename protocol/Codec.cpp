@@ -154,12 +154,11 @@ Arguments ReadArguments(Op op, ArgumentReader& reader) {
     case Op::kStartReportingSessionForID:
       return StartReportingSessionForID{reader.ReporterID(1)};
     case Op::kSendMessage: {
-      SendMessage send;
-      send.message = reader.Map(1, "message");
-      send.category = reader.Integer<uint32_t>(2, "category", "an unsigned 32-bit integer");
-      send.type = reader.Integer<uint16_t>(3, "type", "an unsigned 16-bit integer");
-      send.reporterIDs = reader.ReporterList(4, "reporterIDs");
-      return send;
+      Dictionary message = reader.Map(1, "message");
+      const auto category = reader.Integer<uint32_t>(2, "category", "an unsigned 32-bit integer");
+      const auto type = reader.Integer<uint16_t>(3, "type", "an unsigned 16-bit integer");
+      auto reporterIDs = reader.ReporterList(4, "reporterIDs");
+      return SendMessage{std::move(message), category, type, std::move(reporterIDs)};
     }
     case Op::kStopReportingSessionForID:
       return StopReportingSessionForID{reader.ReporterID(1)};
