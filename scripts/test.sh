@@ -35,7 +35,7 @@ for build in "${builds[@]}"; do
   case "$build" in
     release) run_build release -DCMAKE_BUILD_TYPE=RelWithDebInfo ;;
     asan) run_build asan -DCMAKE_BUILD_TYPE=Debug -DTAVRIN_SANITIZE=address -DTAVRIN_BUILD_BENCH=OFF ;;
-    tsan) run_build tsan -DCMAKE_BUILD_TYPE=RelWithDebInfo -DTAVRIN_SANITIZE=thread -DTAVRIN_BUILD_BENCH=OFF ;;
+    tsan) run_build tsan -DCMAKE_BUILD_TYPE=Debug -DTAVRIN_SANITIZE=thread -DTAVRIN_BUILD_BENCH=OFF ;;
     *) echo "unknown build '$build' (release, asan, tsan)" >&2; exit 2 ;;
   esac
 done
