@@ -15,6 +15,10 @@ namespace {
 
 class FakeQueue;
 
+// An item that keeps queueing itself (or a timer re-armed at zero delay) would never let
+// RunUntilIdle return; past this many items in one call the test fails instead of hanging.
+constexpr size_t kMaxItemsPerRun = 1'000'000;
+
 // Fire dates are ordered by time, then by the order they were set.
 using FireKey = std::pair<SteadyTime, uint64_t>;
 
@@ -256,6 +260,10 @@ size_t FakeDispatcher::RunUntilIdle() {
 
   size_t ran = 0;
   for (;;) {
+    if (ran >= kMaxItemsPerRun) {
+      ADD_FAILURE() << "RunUntilIdle ran " << ran << " items without becoming idle";
+      return ran;
+    }
     Work work;
     std::function<void()> fire;
     {
