@@ -15,7 +15,7 @@ namespace tavrin {
 // Anything else (including an empty PATH) gives nullptr and a one-line reason in `*error`. A feed
 // whose FIFO cannot be set up and an absent system bus are not errors here: those registries log
 // and carry on, so the service runs without orientation rather than not at all.
-std::unique_ptr<OrientationRegistry> MakeOrientationRegistry(const std::string& spec, LogHandle log,
-                                                             std::string* error);
+std::unique_ptr<OrientationRegistry> MakeOrientationRegistry(const std::string& source,
+                                                             LogHandle log, std::string* error);
 
 }  // namespace tavrin

@@ -25,9 +25,9 @@ class MakeOrientationRegistryTest : public ::testing::Test {
   }
   void TearDown() override { fs::remove_all(dir_); }
 
-  std::unique_ptr<OrientationRegistry> Make(const std::string& spec) {
+  std::unique_ptr<OrientationRegistry> Make(const std::string& source) {
     error_.clear();
-    return MakeOrientationRegistry(spec, nullptr, &error_);
+    return MakeOrientationRegistry(source, nullptr, &error_);
   }
 
   FakeLogSystem log_;
@@ -68,9 +68,9 @@ TEST_F(MakeOrientationRegistryTest, IioStartsEvenWithoutABus) {
 }
 
 TEST_F(MakeOrientationRegistryTest, AnythingElseIsAClearError) {
-  for (const std::string spec : {"", "feed:", "feed", "IIO", "iio:", "none ", "fifo:/tmp/x"}) {
-    EXPECT_EQ(Make(spec), nullptr) << spec;
-    EXPECT_FALSE(error_.empty()) << spec;
+  for (const std::string source : {"", "feed:", "feed", "IIO", "iio:", "none ", "fifo:/tmp/x"}) {
+    EXPECT_EQ(Make(source), nullptr) << source;
+    EXPECT_FALSE(error_.empty()) << source;
   }
   Make("feed:");
   EXPECT_EQ(error_, "orientation source \"feed:\" needs a path: feed:PATH");
