@@ -40,7 +40,8 @@ ParsedFeedLine ParseFeedLine(std::string_view text);
 // The constructor creates a FIFO at PATH (mode kFifoMode less the umask), or uses the FIFO found
 // there, and opens it read-write so that it never sees end-of-file when the last writer closes:
 // writers may come and go, and a writer's non-blocking open always succeeds. If only read access
-// is allowed it opens read-only and reopens after each end-of-file. When PATH exists and is not a
+// is allowed it opens read-only and reopens after each end-of-file (a writer that opens, writes
+// and closes in the instant between the two may then be lost). When PATH exists and is not a
 // FIFO, or cannot be created or opened, it writes one error line and delivers nothing
 // (listening() is false); it never removes or changes what it found at PATH, and it leaves the
 // FIFO in place when destroyed.
