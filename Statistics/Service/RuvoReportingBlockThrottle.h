@@ -90,7 +90,8 @@ class RuvoReportingBlockThrottle {
   void addMessageBlock(Block block, int64_t reporterID, const Dictionary& message,
                        uint32_t category, uint16_t type);
 
-  // Blocks until nothing is pending or the completion bound (5 s by default) has passed.
+  // Blocks until nothing is pending or the completion bound (5 s by default) has passed. Never
+  // call it from a callback: the deliveries it waits for run on that same thread.
   void waitForCompletion();
 
   // The key under which duplicates of `message` collapse: the message's fields sorted by name
