@@ -4,30 +4,12 @@
 
 namespace tavrin::testing {
 
-SteadyTime FakeCondition::ManualClock::Now() const {
-  std::lock_guard lock(mutex_);
-  return now_;
-}
+FakeCondition::FakeCondition(FakeClock* clock) : clock_(clock ? *clock : ownClock_) {}
 
-WallTime FakeCondition::ManualClock::WallNow() const {
-  std::lock_guard lock(mutex_);
-  return wallStart_ + std::chrono::duration_cast<WallTime::duration>(elapsed_);
+void FakeCondition::AdvanceTo(SteadyTime time) {
+  const SteadyTime now = clock_.Now();
+  if (time > now) clock_.Advance(time - now);
 }
-
-void FakeCondition::ManualClock::Advance(Duration by) {
-  std::lock_guard lock(mutex_);
-  now_ += by;
-  elapsed_ += by;
-}
-
-void FakeCondition::ManualClock::AdvanceTo(SteadyTime time) {
-  std::lock_guard lock(mutex_);
-  if (time <= now_) return;
-  elapsed_ += time - now_;
-  now_ = time;
-}
-
-FakeCondition::FakeCondition() = default;
 
 void FakeCondition::SetFlag(bool* flag) {
   std::lock_guard lock(mutex_);
@@ -67,7 +49,7 @@ void FakeCondition::ScriptSignalWithoutFlag(Duration after) {
 
 void FakeCondition::ScriptTimeOut() {
   Script([this](SteadyTime deadline) {
-    clock_.AdvanceTo(deadline);
+    AdvanceTo(deadline);
     return false;
   });
 }
@@ -117,7 +99,7 @@ bool FakeCondition::WaitUntil(SteadyTime deadline) {
     if (step) {
       signalled = step(deadline);
     } else {
-      clock_.AdvanceTo(deadline);
+      AdvanceTo(deadline);
     }
   } catch (...) {
     relock();

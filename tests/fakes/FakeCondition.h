@@ -9,11 +9,13 @@
 
 #include "platform/Clock.h"
 #include "platform/Condition.h"
+#include "tests/fakes/FakeClock.h"
 
 namespace tavrin::testing {
 
 // A condition whose waits never block: each WaitUntil plays the next scripted step on the calling
-// thread. Its clock is its own and moves only when a step moves it, so deadlines are exact.
+// thread. Its clock (its own, or one shared with other fakes) moves only when a step or the test
+// moves it, so deadlines are exact.
 // It also checks the lock discipline a real, non-recursive lock would enforce (locking twice,
 // unlocking or waiting without the lock) and records every breach in Violations().
 // Meant for one test thread; the bookkeeping is locked so a stray second thread is reported by
@@ -24,7 +26,8 @@ class FakeCondition final : public Condition {
   // value WaitUntil returns (true = signalled). The callback may use the condition's clock.
   using Step = std::function<bool(SteadyTime deadline)>;
 
-  FakeCondition();
+  // `clock` (not owned) is the clock deadlines refer to; without one the condition has its own.
+  explicit FakeCondition(FakeClock* clock = nullptr);
 
   // The flag that SignalWithFlag steps set. Not owned.
   void SetFlag(bool* flag);
@@ -58,23 +61,13 @@ class FakeCondition final : public Condition {
   std::vector<std::string> Violations() const;
 
  private:
-  class ManualClock final : public Clock {
-   public:
-    SteadyTime Now() const override;
-    WallTime WallNow() const override;
-    void Advance(Duration by);
-    void AdvanceTo(SteadyTime time);
-
-   private:
-    mutable std::mutex mutex_;
-    SteadyTime now_ = SteadyTime(std::chrono::hours(1));  // far from zero, like a real uptime
-    WallTime wallStart_ = WallTime(std::chrono::seconds(1700000000));
-    Duration elapsed_{};
-  };
-
   void Violation(std::string what);
 
-  ManualClock clock_;
+  // Moves the clock to `time` when that is later than now.
+  void AdvanceTo(SteadyTime time);
+
+  FakeClock ownClock_;
+  FakeClock& clock_;
   mutable std::mutex mutex_;
   std::deque<Step> steps_;
   std::vector<SteadyTime> deadlines_;

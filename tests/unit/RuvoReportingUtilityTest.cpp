@@ -218,14 +218,6 @@ std::optional<std::string> WaitLineMessage(const std::string& text) {
   return ::testing::AssertionSuccess();
 }
 
-TEST(WaitLineMessageTest, AcceptsOnlyThePrefixShape) {
-  EXPECT_EQ(WaitLineMessage("RuvoReportingUtility.cpp:123:RuvoReportingUtilityWait: hi"), "hi");
-  EXPECT_EQ(WaitLineMessage("RuvoReportingUtility.cpp::RuvoReportingUtilityWait: hi"),
-            std::nullopt);
-  EXPECT_EQ(WaitLineMessage("RuvoReportingUtility.cpp:12:Wait: hi"), std::nullopt);
-  EXPECT_EQ(WaitLineMessage("Other.cpp:12:RuvoReportingUtilityWait: hi"), std::nullopt);
-}
-
 class WaitTest : public ::testing::Test {
  protected:
   WaitTest() { condition_.SetFlag(&flag_); }
