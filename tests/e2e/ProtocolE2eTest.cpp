@@ -111,9 +111,14 @@ TEST(ProtocolE2eTest, BroadcastReachesRunningSessionsOrGoesStandaloneAndEmptyLis
   client.Send(6, protocol::SendMessage{Dictionary{{"everyone", 1}}, 3, 0, std::nullopt});
   client.Send(7, protocol::StopReportingSessionForID{9});
   for (uint64_t call : {1, 2, 3, 4, 6, 5, 7}) EXPECT_EQ(MustRead(client, service).call, call);
+  const std::string db = service.DatabasePath();
+  // Replies mean accepted: wait for delivery (the session's back-end wait may still be running).
+  EXPECT_TRUE(testing::WaitUntil([&] {
+    return !Column(db, "SELECT 1 FROM session_messages WHERE reporter_id = 9 AND category = 3")
+                .empty();
+  }));
   EXPECT_EQ(service.Stop(SIGTERM), 0);
 
-  const std::string db = service.DatabasePath();
   auto singles = Column(db,
                         "SELECT json_extract(user_info, '$.ServiceName') || ' ' || payload "
                         "FROM single_messages");
@@ -142,11 +147,17 @@ TEST(ProtocolE2eTest, DriverStatisticsAtStopAndTheSummaryFileOfAnInternalBuild) 
   client.Send(3,
               protocol::SetConfiguration{Dictionary{{"HostApplicationDisplayID", "player"}}, 21});
   client.Send(4, protocol::StartReportingSessionForID{21});
-  for (uint64_t call : {1, 2, 3}) EXPECT_EQ(MustRead(client, service).call, call);
+  // Requests run in order: once this one is answered, the start has taken its snapshot.
+  client.Send(40, protocol::GetAllReporters{});
+  for (uint64_t call : {1, 2, 3, 40}) EXPECT_EQ(MustRead(client, service).call, call);
   WriteFile(root + "/driverstats/Speaker/xruns", "9\n");  // +4; actuations unchanged
   client.Send(5, protocol::SendMessage{Dictionary{{"a", 1}}, 1, 0, std::vector<int64_t>{21}});
   client.Send(6, protocol::StopReportingSessionForID{21});
   for (uint64_t call : {5, 4, 6}) EXPECT_EQ(MustRead(client, service).call, call);
+  EXPECT_TRUE(testing::WaitUntil([&] {
+    return !Column(service.DatabasePath(), "SELECT 1 FROM session_messages WHERE category = 9")
+                .empty();
+  })) << service.Log();
   EXPECT_EQ(service.Stop(SIGTERM), 0);
 
   EXPECT_EQ(Column(service.DatabasePath(),

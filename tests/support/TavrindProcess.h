@@ -43,6 +43,17 @@ inline std::string MakeTempDirectory(const char* prefix) {
   return buffer.data();
 }
 
+// Polls `done` until it holds or the e2e time-out passes.
+template <typename Predicate>
+bool WaitUntil(Predicate done) {
+  const auto deadline = std::chrono::steady_clock::now() + kE2eTimeout;
+  while (std::chrono::steady_clock::now() < deadline) {
+    if (done()) return true;
+    std::this_thread::sleep_for(std::chrono::milliseconds(20));
+  }
+  return false;
+}
+
 // One tavrind process in its own root. Stopped with SIGTERM on destruction.
 class TavrindProcess {
  public:
