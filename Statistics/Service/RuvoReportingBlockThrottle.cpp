@@ -123,7 +123,8 @@ std::string RuvoReportingBlockThrottle::buildMessageKey(const Dictionary& messag
         if (field.is_string()) excluded.insert(field.get<std::string>());
       }
     }
-    // A volume change carries its own time, so equal changes at different times still collapse.
+    // Volume reports (a level with its operation time) collapse whatever their values, so a
+    // ramp delivers only its last level.
     if (message.contains(kVolumeField) && message.contains(kVolumeOperationTimeField)) {
       excluded.insert(kVolumeField);
       excluded.insert(kVolumeOperationTimeField);
