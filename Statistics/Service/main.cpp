@@ -106,8 +106,8 @@ int main(int argc, char** argv) {
   InstallLogSystem(&logSystem);
 
   std::string error;
-  auto specs = ParseBackendSpecs(options.backends, &error);
-  if (!specs) {
+  auto choices = ParseBackendSpecs(options.backends, &error);
+  if (!choices) {
     TLOG_ERROR(nullptr, "{}", error);
     return kUsageError;
   }
@@ -139,7 +139,7 @@ int main(int argc, char** argv) {
 
   BackendEnvironment environment;
   environment.stateDirectory = options.stateDir;
-  BackendReportingService reporting(CreateBackends(*specs, environment), SystemClock(),
+  BackendReportingService reporting(CreateBackends(*choices, environment), SystemClock(),
                                     SystemRandom());
   reporting.ApplyDefaults(defaults.Read());
 

@@ -49,13 +49,13 @@ std::optional<BackendSpec> ParseBackendSpec(std::string_view text, std::string* 
   if (text == "none") return BackendSpec{BackendSpec::Kind::kNone, {}, {}};
   if (!text.starts_with(kKafkaScheme)) return bad("unknown back-end");
 
-  BackendSpec spec{BackendSpec::Kind::kKafka, {}, {}};
+  BackendSpec choice{BackendSpec::Kind::kKafka, {}, {}};
   bool prefixSeen = false;
   for (std::string_view part : SplitCommas(text.substr(kKafkaScheme.size()))) {
     if (part.starts_with(kTopicPrefixOption)) {
       if (prefixSeen) return bad("topic-prefix given twice");
       prefixSeen = true;
-      spec.topicPrefix = part.substr(kTopicPrefixOption.size());
+      choice.topicPrefix = part.substr(kTopicPrefixOption.size());
       continue;
     }
     if (part.find('=') != std::string_view::npos) {
@@ -65,47 +65,48 @@ std::optional<BackendSpec> ParseBackendSpec(std::string_view text, std::string* 
     if (part.find_first_of(" \t") != std::string_view::npos) {
       return bad(fmt::format("broker address \"{}\" holds a blank", part));
     }
-    if (!spec.bootstrap.empty()) spec.bootstrap += ',';
-    spec.bootstrap += part;
+    if (!choice.bootstrap.empty()) choice.bootstrap += ',';
+    choice.bootstrap += part;
   }
-  if (spec.bootstrap.empty()) return bad("no broker address");
-  return spec;
+  if (choice.bootstrap.empty()) return bad("no broker address");
+  return choice;
 }
 
 std::optional<std::vector<BackendSpec>> ParseBackendSpecs(const std::vector<std::string>& texts,
                                                           std::string* error) {
   if (texts.empty()) return std::vector<BackendSpec>{BackendSpec{}};
-  std::vector<BackendSpec> specs;
+  std::vector<BackendSpec> choices;
   bool none = false;
   for (const std::string& text : texts) {
-    std::optional<BackendSpec> spec = ParseBackendSpec(text, error);
-    if (!spec) return std::nullopt;
-    if (spec->kind == BackendSpec::Kind::kNone) {
+    std::optional<BackendSpec> choice = ParseBackendSpec(text, error);
+    if (!choice) return std::nullopt;
+    if (choice->kind == BackendSpec::Kind::kNone) {
       none = true;
       continue;
     }
-    const bool duplicate = std::any_of(specs.begin(), specs.end(), [&](const BackendSpec& seen) {
-      return seen.kind == spec->kind &&
-             (seen.kind == BackendSpec::Kind::kSqlite || seen.bootstrap == spec->bootstrap);
-    });
+    const bool duplicate =
+        std::any_of(choices.begin(), choices.end(), [&](const BackendSpec& seen) {
+          return seen.kind == choice->kind &&
+                 (seen.kind == BackendSpec::Kind::kSqlite || seen.bootstrap == choice->bootstrap);
+        });
     if (duplicate) {
       *error = fmt::format("--backend \"{}\" is given twice", text);
       return std::nullopt;
     }
-    specs.push_back(std::move(*spec));
+    choices.push_back(std::move(*choice));
   }
-  if (none && !specs.empty()) {
+  if (none && !choices.empty()) {
     *error = "--backend none cannot be combined with another back-end";
     return std::nullopt;
   }
-  return specs;
+  return choices;
 }
 
-std::vector<ReportingBackendPtr> CreateBackends(const std::vector<BackendSpec>& specs,
+std::vector<ReportingBackendPtr> CreateBackends(const std::vector<BackendSpec>& choices,
                                                 const BackendEnvironment& environment) {
   std::vector<ReportingBackendPtr> backends;
-  for (const BackendSpec& spec : specs) {
-    switch (spec.kind) {
+  for (const BackendSpec& choice : choices) {
+    switch (choice.kind) {
       case BackendSpec::Kind::kSqlite: {
         SqliteStoreOptions options;
         options.stateDirectory = environment.stateDirectory;
@@ -116,8 +117,8 @@ std::vector<ReportingBackendPtr> CreateBackends(const std::vector<BackendSpec>& 
       }
       case BackendSpec::Kind::kKafka: {
         KafkaBackendOptions options;
-        options.bootstrap = spec.bootstrap;
-        options.topicPrefix = spec.topicPrefix;
+        options.bootstrap = choice.bootstrap;
+        options.topicPrefix = choice.topicPrefix;
         options.clock = environment.clock;
         options.log = environment.log;
         backends.push_back(std::make_unique<KafkaProducerBackend>(std::move(options)));

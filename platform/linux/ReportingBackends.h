@@ -51,9 +51,9 @@ struct BackendEnvironment {
   LogHandle log;
 };
 
-// Creates the back-ends of `specs`. A back-end that cannot start is still created, not up (it
+// Creates the back-ends of `choices`. A back-end that cannot start is still created, not up (it
 // logs why), so that discovery leaves it out and its drops are counted.
-std::vector<ReportingBackendPtr> CreateBackends(const std::vector<BackendSpec>& specs,
+std::vector<ReportingBackendPtr> CreateBackends(const std::vector<BackendSpec>& choices,
                                                 const BackendEnvironment& environment);
 
 struct BackendStatus {

@@ -16,6 +16,7 @@
 #include "tests/fakes/FakeLogSystem.h"
 #include "tests/fakes/FakeRandom.h"
 #include "tests/unit/linux/BackendTestSupport.h"
+#include "tests/unit/linux/LibrdkafkaTsanSupport.h"
 
 namespace tavrin {
 namespace {
@@ -32,25 +33,25 @@ using Rows = std::vector<std::vector<std::string>>;
 
 TEST(ParseBackendSpec, AcceptsTheThreeKinds) {
   std::string error;
-  auto spec = ParseBackendSpec("sqlite", &error);
-  ASSERT_TRUE(spec);
-  EXPECT_EQ(spec->kind, BackendSpec::Kind::kSqlite);
-  spec = ParseBackendSpec("none", &error);
-  ASSERT_TRUE(spec);
-  EXPECT_EQ(spec->kind, BackendSpec::Kind::kNone);
-  spec = ParseBackendSpec("kafka:broker:9092", &error);
-  ASSERT_TRUE(spec);
-  EXPECT_EQ(spec->kind, BackendSpec::Kind::kKafka);
-  EXPECT_EQ(spec->bootstrap, "broker:9092");
-  EXPECT_EQ(spec->topicPrefix, "");
-  spec = ParseBackendSpec("kafka:a:9092,b:9093,topic-prefix=fleet.", &error);
-  ASSERT_TRUE(spec);
-  EXPECT_EQ(spec->bootstrap, "a:9092,b:9093");
-  EXPECT_EQ(spec->topicPrefix, "fleet.");
-  spec = ParseBackendSpec("kafka:topic-prefix=p,a:1", &error);  // options in any place
-  ASSERT_TRUE(spec);
-  EXPECT_EQ(spec->bootstrap, "a:1");
-  EXPECT_EQ(spec->topicPrefix, "p");
+  auto choice = ParseBackendSpec("sqlite", &error);
+  ASSERT_TRUE(choice);
+  EXPECT_EQ(choice->kind, BackendSpec::Kind::kSqlite);
+  choice = ParseBackendSpec("none", &error);
+  ASSERT_TRUE(choice);
+  EXPECT_EQ(choice->kind, BackendSpec::Kind::kNone);
+  choice = ParseBackendSpec("kafka:broker:9092", &error);
+  ASSERT_TRUE(choice);
+  EXPECT_EQ(choice->kind, BackendSpec::Kind::kKafka);
+  EXPECT_EQ(choice->bootstrap, "broker:9092");
+  EXPECT_EQ(choice->topicPrefix, "");
+  choice = ParseBackendSpec("kafka:a:9092,b:9093,topic-prefix=fleet.", &error);
+  ASSERT_TRUE(choice);
+  EXPECT_EQ(choice->bootstrap, "a:9092,b:9093");
+  EXPECT_EQ(choice->topicPrefix, "fleet.");
+  choice = ParseBackendSpec("kafka:topic-prefix=p,a:1", &error);  // options in any place
+  ASSERT_TRUE(choice);
+  EXPECT_EQ(choice->bootstrap, "a:1");
+  EXPECT_EQ(choice->topicPrefix, "p");
 }
 
 TEST(ParseBackendSpec, RefusesBadValuesWithAReasonNamingThem) {
@@ -76,18 +77,18 @@ TEST(ParseBackendSpec, RefusesBadValuesWithAReasonNamingThem) {
 
 TEST(ParseBackendSpecs, DefaultIsSqliteAndCombinationsAreChecked) {
   std::string error;
-  auto specs = ParseBackendSpecs({}, &error);
-  ASSERT_TRUE(specs);
-  ASSERT_EQ(specs->size(), 1u);
-  EXPECT_EQ((*specs)[0].kind, BackendSpec::Kind::kSqlite);
+  auto choices = ParseBackendSpecs({}, &error);
+  ASSERT_TRUE(choices);
+  ASSERT_EQ(choices->size(), 1u);
+  EXPECT_EQ((*choices)[0].kind, BackendSpec::Kind::kSqlite);
 
-  specs = ParseBackendSpecs({"none"}, &error);
-  ASSERT_TRUE(specs);
-  EXPECT_TRUE(specs->empty());
+  choices = ParseBackendSpecs({"none"}, &error);
+  ASSERT_TRUE(choices);
+  EXPECT_TRUE(choices->empty());
 
-  specs = ParseBackendSpecs({"sqlite", "kafka:a:1", "kafka:b:1,topic-prefix=x"}, &error);
-  ASSERT_TRUE(specs);
-  EXPECT_EQ(specs->size(), 3u);
+  choices = ParseBackendSpecs({"sqlite", "kafka:a:1", "kafka:b:1,topic-prefix=x"}, &error);
+  ASSERT_TRUE(choices);
+  EXPECT_EQ(choices->size(), 3u);
 
   EXPECT_FALSE(ParseBackendSpecs({"none", "sqlite"}, &error));
   EXPECT_NE(error.find("cannot be combined"), std::string::npos) << error;
@@ -417,12 +418,12 @@ TEST_F(ReportingBackendsTest, FlushAnswersAfterTheStoreCommittedAndKafkaAcknowle
     environment.stateDirectory = dir_.path().string();
     environment.clock = &clock_;
     std::string parseError;
-    const auto specs = ParseBackendSpecs(
+    const auto choices = ParseBackendSpecs(
         {"sqlite",
          std::string("kafka:") + rd_kafka_mock_cluster_bootstraps(cluster) + ",topic-prefix=both."},
         &parseError);
-    ASSERT_TRUE(specs) << parseError;
-    auto service = MakeService(CreateBackends(*specs, environment));
+    ASSERT_TRUE(choices) << parseError;
+    auto service = MakeService(CreateBackends(*choices, environment));
     auto session = service->CreateTelvoroSession(SessionInfo(9), {}, {});
     const BackendList list = Discover(*session);
     ASSERT_TRUE(list);
