@@ -14,6 +14,7 @@
 #include "tests/fakes/FakeClock.h"
 #include "tests/fakes/FakeLogSystem.h"
 #include "tests/unit/linux/BackendTestSupport.h"
+#include "tests/unit/linux/LibrdkafkaTsanSupport.h"
 
 namespace tavrin {
 namespace {
