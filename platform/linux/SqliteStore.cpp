@@ -262,8 +262,9 @@ bool SqliteStore::MoveCorruptFilesAside(std::string* movedTo) {
   const char* suffixes[] = {"", "-wal", "-shm"};
   std::string base;
   for (int attempt = 0; attempt < kMaxCorruptNameAttempts && base.empty(); ++attempt) {
-    std::string candidate = path_ + ".corrupt-" + stamp;
-    if (attempt > 0) candidate += "." + std::to_string(attempt);
+    const std::string candidate = attempt == 0
+                                      ? fmt::format("{}.corrupt-{}", path_, stamp)
+                                      : fmt::format("{}.corrupt-{}.{}", path_, stamp, attempt);
     bool taken = false;
     for (const char* suffix : suffixes) taken = taken || Exists(candidate + suffix);
     if (!taken) base = candidate;
