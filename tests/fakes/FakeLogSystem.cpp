@@ -1,33 +1,54 @@
 #include "tests/fakes/FakeLogSystem.h"
 
+#include <atomic>
+
 namespace tavrin::testing {
+
+namespace {
+// The fake that records right now. Code under test keeps some scopes for the life of the process
+// (registered once, in a function-local static), so a scope must not point at the fixture that
+// happened to register it: it writes to whichever fake is installed when the line is written.
+std::atomic<FakeLogSystem*> recording{nullptr};
+}  // namespace
 
 class FakeLogSystem::Scope final : public LogScope {
  public:
-  Scope(FakeLogSystem& owner, std::string name) : owner_(owner), name_(std::move(name)) {}
+  explicit Scope(std::string name) : name_(std::move(name)) {}
   bool ShouldLog(LogLevel level) const override {
-    return level != LogLevel::kDebug || owner_.Verbose();
+    FakeLogSystem* owner = recording.load(std::memory_order_acquire);
+    return owner ? level != LogLevel::kDebug || owner->Verbose()
+                 : DefaultSystemLog().ShouldLog(level);
   }
-  void Write(LogLevel level, std::string_view line) override { owner_.Append(name_, level, line); }
+  void Write(LogLevel level, std::string_view line) override {
+    if (FakeLogSystem* owner = recording.load(std::memory_order_acquire)) {
+      owner->Append(name_, level, line);
+    } else {
+      DefaultSystemLog().Write(level, line);
+    }
+  }
 
  private:
-  FakeLogSystem& owner_;
   std::string name_;
 };
 
 FakeLogSystem::FakeLogSystem()
-    : defaultScope_(std::make_shared<Scope>(*this, "default")), previous_(InstallLogSystem(this)) {}
+    : defaultScope_(std::make_shared<Scope>("default")),
+      previous_(InstallLogSystem(this)),
+      previousRecording_(recording.exchange(this, std::memory_order_acq_rel)) {}
 
-FakeLogSystem::~FakeLogSystem() { InstallLogSystem(previous_); }
+FakeLogSystem::~FakeLogSystem() {
+  recording.store(previousRecording_, std::memory_order_release);
+  InstallLogSystem(previous_);
+}
 
 LogHandle FakeLogSystem::RegisterLogScope(bool enabled, uint32_t code, std::string_view scopeName,
-                                          std::string_view subsystem,
-                                          std::string_view verbosityKey, int level) {
+                                          std::string_view subsystem, std::string_view verbosityKey,
+                                          int level) {
   std::lock_guard lock(mutex_);
   registrations_[std::string(scopeName)] =
       Registration{enabled, code, std::string(subsystem), std::string(verbosityKey), level};
   if (failRegistrations_) return nullptr;
-  return std::make_shared<Scope>(*this, std::string(scopeName));
+  return std::make_shared<Scope>(std::string(scopeName));
 }
 
 LogScope& FakeLogSystem::DefaultLog() { return *defaultScope_; }

@@ -16,7 +16,8 @@ struct LoggedLine {
   std::string text;
 };
 
-// Records every line in memory. Installs itself as the process's log facility for its lifetime.
+// Records every line in memory. Installs itself as the process's log facility for its lifetime;
+// scopes it handed out write to the fake installed at the time of writing.
 // Scopes are verbose (debug lines pass) unless SetVerbose says otherwise.
 class FakeLogSystem final : public LogSystem {
  public:
@@ -62,6 +63,7 @@ class FakeLogSystem final : public LogSystem {
   bool verbose_ = true;
   std::shared_ptr<Scope> defaultScope_;
   LogSystem* previous_ = nullptr;
+  FakeLogSystem* previousRecording_ = nullptr;
 };
 
 }  // namespace tavrin::testing
