@@ -1,6 +1,7 @@
 // Entry point of tavrind: builds the Linux platform services, creates the one listener delegate
 // and runs the listener until SIGTERM or SIGINT, which flush the store and exit 0.
 
+#include <chrono>
 #include <csignal>
 #include <cstdio>
 #include <filesystem>
@@ -30,6 +31,10 @@ namespace {
 // Exit statuses besides 0 (clean stop) and 2 (killService).
 constexpr int kUsageError = 64;     // a flag or value that cannot be used
 constexpr int kStartupFailure = 1;  // the socket cannot be set up
+
+// How long a stop waits for queued work: longer than a session's wait for its back-ends (9 s), so
+// that messages queued behind a waiting session are still delivered.
+constexpr std::chrono::seconds kShutdownDrainLimit{10};
 
 struct Options {
   std::string root;
@@ -181,9 +186,13 @@ int main(int argc, char** argv) {
                listener.SocketActivated() ? " (socket activation)" : "", options.stateDir);
   listener.Resume();
 
-  // Orderly stop: client clean-ups and queued deliveries run, then the store commits everything
-  // it accepted.
+  // Orderly stop: client clean-ups and queued deliveries run, including messages held behind a
+  // session that still waits for its back-ends, then the store commits everything it accepted.
   notifications.Cancel(refreshToken);
+  if (!dispatcher.WaitUntilDrained(kShutdownDrainLimit)) {
+    TLOG_ERROR(nullptr, "stopping with {} work items still queued after {} s",
+               dispatcher.QueuedItems(), kShutdownDrainLimit.count());
+  }
   dispatcher.Shutdown();
   reporting.Shutdown();
   listener.SetDelegate(nullptr);

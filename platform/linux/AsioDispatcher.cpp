@@ -11,6 +11,7 @@
 
 #include <algorithm>
 #include <atomic>
+#include <condition_variable>
 #include <cstdio>
 #include <cstdlib>
 #include <deque>
@@ -83,6 +84,21 @@ class AsioDispatcher::Core {
   // Runs one work item; an exception is logged and counted, never passed on to the pool.
   void RunItem(const std::string& label, Work& work);
 
+  // Items handed to a queue and not yet run or discarded, suspended queues' items included.
+  void ItemsQueued(uint64_t count = 1) { queued_.fetch_add(count, std::memory_order_relaxed); }
+  void ItemsGone(uint64_t count = 1) {
+    if (count == 0) return;
+    if (queued_.fetch_sub(count, std::memory_order_acq_rel) == count) {
+      std::lock_guard lock(drainMutex_);
+      drained_.notify_all();
+    }
+  }
+  uint64_t Queued() const { return queued_.load(std::memory_order_acquire); }
+  bool WaitUntilDrained(Duration limit) {
+    std::unique_lock lock(drainMutex_);
+    return drained_.wait_for(lock, limit, [this] { return Queued() == 0; });
+  }
+
   void RegisterTimer(const std::shared_ptr<TimerState>& state);
   void UnregisterTimer(const TimerState* state);
 
@@ -109,6 +125,9 @@ class AsioDispatcher::Core {
   std::atomic<bool> discarding_{false};
   std::atomic<uint64_t> dropped_{0};
   std::atomic<uint64_t> failed_{0};
+  std::atomic<uint64_t> queued_{0};
+  std::mutex drainMutex_;
+  std::condition_variable drained_;
 };
 
 namespace {
@@ -120,6 +139,8 @@ class AsioSerialQueue final : public SerialQueue,
                   QualityOfService qos)
       : core_(std::move(core)), label_(std::move(label)), qos_(qos) {}
 
+  ~AsioSerialQueue() override { core_->ItemsGone(items_.size()); }
+
   void Async(Work work) override {
     if (!work) return;
     if (!core_->Accepting()) {
@@ -129,6 +150,7 @@ class AsioSerialQueue final : public SerialQueue,
     bool schedule = false;
     {
       std::lock_guard lock(mutex_);
+      core_->ItemsQueued();
       items_.push_back(std::move(work));
       if (!scheduled_ && suspensions_ == 0) schedule = scheduled_ = true;
     }
@@ -194,6 +216,7 @@ class AsioSerialQueue final : public SerialQueue,
       core_->RunItem(label_, work);
       work = nullptr;  // the item's captures are released while it still counts as current
       tCurrentQueue = previous;
+      core_->ItemsGone();
     }
     {
       std::lock_guard lock(mutex_);
@@ -227,7 +250,13 @@ class AsioBackgroundQueue final : public WorkQueue {
       core_.CountDropped();
       return;
     }
-    core_.Post([this, work = std::move(work)]() mutable { core_.RunItem(label_, work); });
+    core_.ItemsQueued();
+    const bool posted = core_.Post([this, work = std::move(work)]() mutable {
+      core_.RunItem(label_, work);
+      work = nullptr;
+      core_.ItemsGone();
+    });
+    if (!posted) core_.ItemsGone();
   }
 
   void AsyncAfter(Duration delay, Work work) override {
@@ -450,6 +479,10 @@ std::unique_ptr<Timer> AsioDispatcher::CreateTimer(WorkQueue& queue, Work work) 
 Clock& AsioDispatcher::GetClock() { return SystemClock(); }
 
 void AsioDispatcher::Shutdown() { core_->Shutdown(); }
+
+bool AsioDispatcher::WaitUntilDrained(Duration limit) { return core_->WaitUntilDrained(limit); }
+
+uint64_t AsioDispatcher::QueuedItems() const { return core_->Queued(); }
 
 size_t AsioDispatcher::PoolThreadCount() const { return core_->ThreadCount(); }
 

@@ -50,6 +50,12 @@ class AsioDispatcher final : public Dispatcher {
 
   // Idempotent and thread-safe; must not be called from a pool thread (it joins them).
   void Shutdown();
+  // Waits until every item handed to a queue has run, including items held by suspended queues
+  // (they run once their queue resumes), or until `limit` has passed. True when drained. Timers
+  // and AsyncAfter items count only once they are due. Must not be called from a pool thread.
+  bool WaitUntilDrained(Duration limit);
+  // Items handed to queues that have neither run nor been discarded yet.
+  uint64_t QueuedItems() const;
 
   size_t PoolThreadCount() const;
   // Work items, delayed items and timer armings refused or cancelled by Shutdown().

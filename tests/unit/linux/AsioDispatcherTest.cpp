@@ -529,6 +529,38 @@ TEST(AsioDispatcherTest, ExceptionFromAnItemIsLoggedCountedAndTheQueueCarriesOn)
   EXPECT_TRUE(log.Contains("throws ended with an exception: boom"));
 }
 
+TEST(AsioDispatcherTest, DrainWaitsForItemsHeldBySuspendedQueuesButNotForFutureTimers) {
+  AsioDispatcher dispatcher(2);
+  EXPECT_TRUE(dispatcher.WaitUntilDrained(Duration::zero()));
+  auto held = dispatcher.CreateSerialQueue("held", QualityOfService::kDefault);
+  Counter ran;
+  held->Suspend();
+  for (int i = 0; i < 3; ++i) held->Async([&] { ran.Add(); });
+  dispatcher.BackgroundQueue().Async([&] { ran.Add(); });
+  auto timer = dispatcher.CreateTimer(*held, [&] { ran.Add(); });
+  timer->ScheduleAfter(std::chrono::hours(1));
+
+  ASSERT_TRUE(ran.WaitFor(1));
+  EXPECT_FALSE(dispatcher.WaitUntilDrained(kQuietPeriod));
+  EXPECT_EQ(dispatcher.QueuedItems(), 3u);  // the held items; the timer is not due
+  std::thread resumer([&] {
+    std::this_thread::sleep_for(kQuietPeriod);
+    held->Resume();
+  });
+  EXPECT_TRUE(dispatcher.WaitUntilDrained(kGenerous));
+  resumer.join();
+  EXPECT_EQ(ran.Count(), 4);
+  EXPECT_EQ(dispatcher.QueuedItems(), 0u);
+
+  // Items freed with a queue that never resumed no longer count.
+  auto abandoned = dispatcher.CreateSerialQueue("abandoned", QualityOfService::kDefault);
+  abandoned->Suspend();
+  abandoned->Async([&] { ran.Add(); });
+  EXPECT_EQ(dispatcher.QueuedItems(), 1u);
+  abandoned.reset();
+  EXPECT_TRUE(dispatcher.WaitUntilDrained(Duration::zero()));
+}
+
 TEST(AsioDispatcherTest, ShutdownWithPendingTimersReturnsPromptlyAndDropsLateWork) {
   auto dispatcher = std::make_unique<AsioDispatcher>(2);
   auto queue = dispatcher->CreateSerialQueue("pending", QualityOfService::kDefault);
