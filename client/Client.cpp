@@ -412,13 +412,14 @@ class Connection {
           dropped = DroppedStarts(op, reporter, reply.call);
       }
     }
-    Invoke(handler, std::move(reply));
+    // The starts were let go before the answer that reveals it, so they hear first.
     for (auto& start : dropped) {
       Invoke(start, MakeError(Errc::kNoReply,
                               "the session went away before it was stopped (destroyed, or "
                               "replaced by a new session under the same reporter ID), so the "
                               "service will never answer its start"));
     }
+    Invoke(handler, std::move(reply));
   }
 
   // Held starts the service has let go of: a destroy or a re-create, on this connection, of a

@@ -1,39 +1,19 @@
 #include <gtest/gtest.h>
-#include <sqlite3.h>
 #include <sys/prctl.h>
 
 #include <atomic>
 #include <csignal>
 #include <thread>
 
+#include "tests/support/StoreFiles.h"
 #include "tests/support/TavrindProcess.h"
 
 namespace tavrin {
 namespace {
 
+using testing::QueryStore;
 using testing::TavrindProcess;
 using testing::TestClient;
-
-std::vector<std::vector<std::string>> Query(const std::string& database, const std::string& sql) {
-  std::vector<std::vector<std::string>> rows;
-  sqlite3* db = nullptr;
-  if (sqlite3_open_v2(database.c_str(), &db, SQLITE_OPEN_READONLY, nullptr) == SQLITE_OK) {
-    sqlite3_stmt* statement = nullptr;
-    if (sqlite3_prepare_v2(db, sql.c_str(), -1, &statement, nullptr) == SQLITE_OK) {
-      while (sqlite3_step(statement) == SQLITE_ROW) {
-        std::vector<std::string> row;
-        for (int i = 0; i < sqlite3_column_count(statement); ++i) {
-          const auto* text = sqlite3_column_text(statement, i);
-          row.emplace_back(text ? reinterpret_cast<const char*>(text) : "");
-        }
-        rows.push_back(std::move(row));
-      }
-    }
-    sqlite3_finalize(statement);
-  }
-  sqlite3_close(db);
-  return rows;
-}
 
 TEST(ClientsE2eTest, ClientKilledMidSessionIsCleanedUpOnceAndItsUptimeRecorded) {
   TavrindProcess service;
@@ -68,15 +48,15 @@ TEST(ClientsE2eTest, ClientKilledMidSessionIsCleanedUpOnceAndItsUptimeRecorded) 
   EXPECT_EQ(service.Stop(SIGTERM), 0);
   EXPECT_EQ(service.LogCount(removed), 1u);
   // The clean-up stopped the session: its summary went out through its own path.
-  auto summaries = Query(service.DatabasePath(),
-                         "SELECT payload FROM session_messages WHERE reporter_id = 77 AND "
-                         "category = 65535");
+  auto summaries = QueryStore(service.DatabasePath(),
+                              "SELECT payload FROM session_messages WHERE reporter_id = 77 AND "
+                              "category = 65535");
   ASSERT_EQ(summaries.size(), 1u);
   EXPECT_NE(summaries[0][0].find("\"level\":\"3\""), std::string::npos);
-  auto uptime = Query(service.DatabasePath(),
-                      "SELECT payload FROM analytics_events WHERE name = "
-                      "'com.quorvex.tavrin.ruvoreportingclientuptime' AND payload LIKE "
-                      "'%killedclient%'");
+  auto uptime = QueryStore(service.DatabasePath(),
+                           "SELECT payload FROM analytics_events WHERE name = "
+                           "'com.quorvex.tavrin.ruvoreportingclientuptime' AND payload LIKE "
+                           "'%killedclient%'");
   // Only the killed client's event: the harness's own start-up probe is a client too.
   ASSERT_EQ(uptime.size(), 1u);
   EXPECT_NE(uptime[0][0].find("\"processName\":\"killedclient\""), std::string::npos);
@@ -115,9 +95,10 @@ TEST(ClientsE2eTest, FiftyConcurrentClientsLoseNoMessageAndGetStartBeforeStop) {
   EXPECT_EQ(failures.load(), 0);
   EXPECT_EQ(service.Stop(SIGTERM), 0) << service.Log();
 
-  auto perReporter = Query(service.DatabasePath(),
-                           "SELECT reporter_id, COUNT(*), COUNT(DISTINCT json_extract(payload, "
-                           "'$.n')) FROM session_messages WHERE category = 1 GROUP BY reporter_id");
+  auto perReporter =
+      QueryStore(service.DatabasePath(),
+                 "SELECT reporter_id, COUNT(*), COUNT(DISTINCT json_extract(payload, "
+                 "'$.n')) FROM session_messages WHERE category = 1 GROUP BY reporter_id");
   ASSERT_EQ(perReporter.size(), size_t(kClients));
   for (const auto& row : perReporter) {
     EXPECT_EQ(row[1], std::to_string(kMessages)) << "reporter " << row[0];

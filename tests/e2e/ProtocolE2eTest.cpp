@@ -1,42 +1,20 @@
 #include <gtest/gtest.h>
-#include <sqlite3.h>
 
 #include <csignal>
 #include <filesystem>
 #include <fstream>
 
+#include "tests/support/StoreFiles.h"
 #include "tests/support/TavrindProcess.h"
 
 namespace tavrin {
 namespace {
 
 using protocol::Status;
+using testing::QueryStoreColumn;
 using testing::TavrindProcess;
 using testing::TestClient;
-
-std::vector<std::string> Column(const std::string& database, const std::string& sql) {
-  std::vector<std::string> values;
-  sqlite3* db = nullptr;
-  if (sqlite3_open_v2(database.c_str(), &db, SQLITE_OPEN_READONLY, nullptr) == SQLITE_OK) {
-    sqlite3_stmt* statement = nullptr;
-    if (sqlite3_prepare_v2(db, sql.c_str(), -1, &statement, nullptr) == SQLITE_OK) {
-      while (sqlite3_step(statement) == SQLITE_ROW) {
-        const auto* text = sqlite3_column_text(statement, 0);
-        values.emplace_back(text ? reinterpret_cast<const char*>(text) : "");
-      }
-    }
-    sqlite3_finalize(statement);
-  }
-  sqlite3_close(db);
-  return values;
-}
-
-void WriteFile(const std::string& path, const std::string& text) {
-  std::filesystem::create_directories(std::filesystem::path(path).parent_path());
-  const std::string temporary = path + ".new";
-  std::ofstream(temporary) << text;
-  std::filesystem::rename(temporary, path);  // as an editor saves
-}
+using testing::WriteFileAtomically;
 
 protocol::Reply MustRead(TestClient& client, const TavrindProcess& service) {
   auto reply = client.Read();
@@ -80,7 +58,7 @@ TEST(ProtocolE2eTest, DisabledReportingRefusesMessagesUntilTheSettingIsRemoved) 
   a.Send(1, protocol::CreateReportingSession{7});
   MustRead(a, service);
 
-  WriteFile(service.DefaultsPath(), "disable_reporting = true\n");
+  WriteFileAtomically(service.DefaultsPath(), "disable_reporting = true\n");
   ASSERT_TRUE(service.WaitForLog("re-reading tavrin defaults")) << service.Log();
   b.Send(1, protocol::SendMessage{Dictionary{{"x", 1}}, 1, 0, std::vector<int64_t>{7}});
   auto refused = MustRead(b, service);
@@ -90,7 +68,7 @@ TEST(ProtocolE2eTest, DisabledReportingRefusesMessagesUntilTheSettingIsRemoved) 
   b.Send(2, protocol::ReporterIDValid{7});
   EXPECT_EQ(MustRead(b, service).value, (Value{{"reporterID", 0}, {"serviceType", 0xFFFF}}));
 
-  WriteFile(service.DefaultsPath(), "device_name = \"hall\"\n");
+  WriteFileAtomically(service.DefaultsPath(), "device_name = \"hall\"\n");
   ASSERT_TRUE(service.WaitForLog("re-reading tavrin defaults", 2)) << service.Log();
   b.Send(3, protocol::SendMessage{Dictionary{{"x", 2}}, 1, 0, std::vector<int64_t>{7}});
   auto accepted = MustRead(b, service);
@@ -114,31 +92,33 @@ TEST(ProtocolE2eTest, BroadcastReachesRunningSessionsOrGoesStandaloneAndEmptyLis
   const std::string db = service.DatabasePath();
   // Replies mean accepted: wait for delivery (the session's back-end wait may still be running).
   EXPECT_TRUE(testing::WaitUntil([&] {
-    return !Column(db, "SELECT 1 FROM session_messages WHERE reporter_id = 9 AND category = 3")
+    return !QueryStoreColumn(
+                db, "SELECT 1 FROM session_messages WHERE reporter_id = 9 AND category = 3")
                 .empty();
   }));
   EXPECT_EQ(service.Stop(SIGTERM), 0);
 
-  auto singles = Column(db,
-                        "SELECT json_extract(user_info, '$.ServiceName') || ' ' || payload "
-                        "FROM single_messages");
+  auto singles =
+      QueryStoreColumn(db,
+                       "SELECT json_extract(user_info, '$.ServiceName') || ' ' || payload "
+                       "FROM single_messages");
   ASSERT_EQ(singles.size(), 1u);
   EXPECT_EQ(singles[0], "standalone {\"alone\":1}");
-  EXPECT_EQ(Column(db,
-                   "SELECT payload FROM session_messages WHERE reporter_id = 9 AND "
-                   "category = 3"),
+  EXPECT_EQ(QueryStoreColumn(db,
+                             "SELECT payload FROM session_messages WHERE reporter_id = 9 AND "
+                             "category = 3"),
             (std::vector<std::string>{"{\"everyone\":1}"}));
-  EXPECT_TRUE(Column(db,
-                     "SELECT 1 FROM session_messages WHERE payload LIKE '%nobody%' UNION "
-                     "SELECT 1 FROM single_messages WHERE payload LIKE '%nobody%'")
+  EXPECT_TRUE(QueryStoreColumn(db,
+                               "SELECT 1 FROM session_messages WHERE payload LIKE '%nobody%' UNION "
+                               "SELECT 1 FROM single_messages WHERE payload LIKE '%nobody%'")
                   .empty());
 }
 
 TEST(ProtocolE2eTest, DriverStatisticsAtStopAndTheSummaryFileOfAnInternalBuild) {
   const std::string root = testing::MakeTempDirectory("tavrin-e2e-");
-  WriteFile(root + "/driverstats/Speaker/xruns", "5\n");
-  WriteFile(root + "/driverstats/Haptics/Stats/actuations", "100\n");
-  WriteFile(root + "/etc/device.toml", "InternalBuild = true\n");
+  WriteFileAtomically(root + "/driverstats/Speaker/xruns", "5\n");
+  WriteFileAtomically(root + "/driverstats/Haptics/Stats/actuations", "100\n");
+  WriteFileAtomically(root + "/etc/device.toml", "InternalBuild = true\n");
   TavrindProcess service({}, root);
   ASSERT_TRUE(service.Start()) << service.Log();
   TestClient client(service.SocketPath());
@@ -150,19 +130,21 @@ TEST(ProtocolE2eTest, DriverStatisticsAtStopAndTheSummaryFileOfAnInternalBuild) 
   // Requests run in order: once this one is answered, the start has taken its snapshot.
   client.Send(40, protocol::GetAllReporters{});
   for (uint64_t call : {1, 2, 3, 40}) EXPECT_EQ(MustRead(client, service).call, call);
-  WriteFile(root + "/driverstats/Speaker/xruns", "9\n");  // +4; actuations unchanged
+  WriteFileAtomically(root + "/driverstats/Speaker/xruns", "9\n");  // +4; actuations unchanged
   client.Send(5, protocol::SendMessage{Dictionary{{"a", 1}}, 1, 0, std::vector<int64_t>{21}});
   client.Send(6, protocol::StopReportingSessionForID{21});
   for (uint64_t call : {5, 4, 6}) EXPECT_EQ(MustRead(client, service).call, call);
   EXPECT_TRUE(testing::WaitUntil([&] {
-    return !Column(service.DatabasePath(), "SELECT 1 FROM session_messages WHERE category = 9")
+    return !QueryStoreColumn(service.DatabasePath(),
+                             "SELECT 1 FROM session_messages WHERE category = 9")
                 .empty();
   })) << service.Log();
   EXPECT_EQ(service.Stop(SIGTERM), 0);
 
-  EXPECT_EQ(Column(service.DatabasePath(),
-                   "SELECT payload FROM session_messages WHERE category = 9 AND type = 0"),
-            (std::vector<std::string>{"{\"Speaker_xruns\":4}"}));
+  EXPECT_EQ(
+      QueryStoreColumn(service.DatabasePath(),
+                       "SELECT payload FROM session_messages WHERE category = 9 AND type = 0"),
+      (std::vector<std::string>{"{\"Speaker_xruns\":4}"}));
   std::vector<std::filesystem::path> files;
   for (const auto& entry :
        std::filesystem::directory_iterator(root + "/log/DiagnosticLogs/Audio/Reporting")) {

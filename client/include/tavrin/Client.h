@@ -163,8 +163,9 @@ class Client {
   void startReportingSessionForID(int64_t reporterID, ReplyHandler<bool> reply);
   Result<bool> startReportingSessionForID(int64_t reporterID,
                                           std::chrono::milliseconds timeout = kDefaultTimeout);
-  // 6: to the sessions named in `reporterIDs`, or to every running session of this client when
-  // there is none. Fails with kOperationError ("com.quorvex.audio.reporting", 1) while reporting
+  // 6: to the sessions named in `reporterIDs` (any client's), or, when there is no list, to every
+  // running session of every client (with none running, the service records the message on its
+  // own). Fails with kOperationError ("com.quorvex.audio.reporting", 1) while reporting
   // is disabled on the service.
   Result<Done> sendMessage(const Dictionary& message, uint32_t category, uint16_t type,
                            std::optional<std::vector<int64_t>> reporterIDs = std::nullopt);

@@ -1,0 +1,347 @@
+// libtavrin against the real service: every operation, the answers that come twice, late or
+// never, the service going away, and the errors a user sees.
+
+#include <gtest/gtest.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <csignal>
+#include <cstdlib>
+#include <filesystem>
+#include <mutex>
+#include <thread>
+
+#include "tavrin/Client.h"
+#include "tests/support/StoreFiles.h"
+#include "tests/support/TavrindProcess.h"
+
+namespace tavrin {
+namespace {
+
+using client::Client;
+using client::Done;
+using client::Errc;
+using client::Result;
+using client::Session;
+using testing::QueryStore;
+using testing::TavrindProcess;
+
+constexpr auto kWait = std::chrono::milliseconds(10000);
+
+std::unique_ptr<Client> MustConnect(const TavrindProcess& service) {
+  auto connected = Client::Connect({service.SocketPath(), kWait});
+  EXPECT_TRUE(connected) << connected.error().message;
+  return connected ? std::move(connected.value()) : nullptr;
+}
+
+// Collects the answers an asynchronous handler is given, from the reader thread.
+template <typename T>
+struct Answers {
+  std::mutex mutex;
+  std::vector<Result<T>> results;
+
+  client::ReplyHandler<T> Handler() {
+    return [this](Result<T> result) {
+      std::lock_guard lock(mutex);
+      results.push_back(std::move(result));
+    };
+  }
+  size_t Count() {
+    std::lock_guard lock(mutex);
+    return results.size();
+  }
+  Result<T> At(size_t i) {
+    std::lock_guard lock(mutex);
+    return results.at(i);
+  }
+};
+
+size_t MessageRows(const TavrindProcess& service, int64_t reporter, uint32_t category) {
+  return QueryStore(service.DatabasePath(),
+                    "SELECT row FROM session_messages WHERE reporter_id = " +
+                        std::to_string(reporter) + " AND category = " + std::to_string(category))
+      .size();
+}
+
+TEST(ClientLibraryE2eTest, EveryOperationAgainstTheService) {
+  TavrindProcess service;
+  ASSERT_TRUE(service.Start()) << service.Log();
+  auto client = MustConnect(service);
+  ASSERT_TRUE(client);
+  const int64_t id = 4242;
+
+  ASSERT_EQ(client->createReportingSession(id, kWait).value(), true);
+  ASSERT_EQ(client->setServiceType(7, id, kWait).value(), true);
+  EXPECT_EQ(client->getServiceNameForReporterID(id, kWait).value(), 7);
+  ASSERT_EQ(client->setConfiguration({{"route", "speaker"}}, id, kWait).value(), true);
+
+  Answers<bool> started;
+  client->startReportingSessionForID(id, started.Handler());
+  // Requests run in order: once this is answered the start has run and holds its answer.
+  EXPECT_EQ(client->reporterID(id, kWait).value(), (client::Validity{id, 7}));
+  EXPECT_EQ(started.Count(), 0u);
+
+  EXPECT_TRUE(client->sendMessage({{"xruns", 2}}, 5, 1, std::vector<int64_t>{id}, kWait));
+  ASSERT_TRUE(client->sendMessage({{"xruns", 3}}, 5, 1));  // fire-and-forget, to every session
+  Answers<Done> sent;
+  client->sendMessage({{"xruns", 4}}, 5, 1, std::nullopt, sent.Handler());
+
+  auto reporters = client->getAllReporters(kWait);
+  ASSERT_TRUE(reporters);
+  EXPECT_NE(std::find(reporters.value().begin(), reporters.value().end(), id),
+            reporters.value().end());
+  EXPECT_EQ(sent.Count(), 1u);  // answered before the later call
+  EXPECT_TRUE(sent.At(0));
+
+  ASSERT_EQ(client->stopReportingSessionForID(id, kWait).value(), true);
+  ASSERT_TRUE(testing::WaitUntil([&] { return started.Count() == 1; }));
+  EXPECT_EQ(started.At(0).value(), true);
+  ASSERT_EQ(client->destroyReportingSession(id, kWait).value(), true);
+  EXPECT_EQ(client->reporterID(id, kWait).value(), (client::Validity{0, 0xFFFF}));
+  EXPECT_EQ(client->pendingCalls(), 0u);
+
+  EXPECT_TRUE(testing::WaitUntil([&] { return MessageRows(service, id, 5) == 3; }))
+      << MessageRows(service, id, 5);
+}
+
+TEST(ClientLibraryE2eTest, AnswersThatComeTwiceLateOrNever) {
+  TavrindProcess service;
+  ASSERT_TRUE(service.Start()) << service.Log();
+  auto client = MustConnect(service);
+  ASSERT_TRUE(client);
+
+  // Reporter ID 0 is answered twice; both reach the handler, and nothing stays pending.
+  Answers<uint16_t> names;
+  client->getServiceNameForReporterID(0, names.Handler());
+  ASSERT_TRUE(client->getAllReporters(kWait));
+  ASSERT_EQ(names.Count(), 2u);
+  EXPECT_EQ(names.At(0).value(), 0xFFFF);
+  EXPECT_EQ(names.At(1).value(), 0xFFFF);
+  EXPECT_EQ(client->getServiceNameForReporterID(0, kWait).value(), 0xFFFF);
+
+  // A held start whose session is destroyed is never answered by the service.
+  ASSERT_TRUE(client->createReportingSession(11, kWait));
+  Answers<bool> destroyedStart;
+  client->startReportingSessionForID(11, destroyedStart.Handler());
+  ASSERT_TRUE(client->destroyReportingSession(11, kWait));
+  ASSERT_EQ(destroyedStart.Count(), 1u);
+  EXPECT_EQ(destroyedStart.At(0).error().code, Errc::kNoReply);
+
+  // ...nor one whose session is replaced by a new one under the same ID.
+  ASSERT_TRUE(client->createReportingSession(12, kWait));
+  Answers<bool> replacedStart;
+  client->startReportingSessionForID(12, replacedStart.Handler());
+  ASSERT_TRUE(client->createReportingSession(12, kWait));
+  ASSERT_EQ(replacedStart.Count(), 1u);
+  EXPECT_EQ(replacedStart.At(0).error().code, Errc::kNoReply);
+  // The new session's own start is held as usual and answered by the stop.
+  Answers<bool> newStart;
+  client->startReportingSessionForID(12, newStart.Handler());
+  ASSERT_TRUE(client->stopReportingSessionForID(12, kWait));
+  ASSERT_EQ(newStart.Count(), 1u);
+  EXPECT_EQ(newStart.At(0).value(), true);
+
+  // A blocking start waits for the held answer; its time-out forgets the call, and the late
+  // answer (at the stop) finds no one and harms nothing.
+  ASSERT_TRUE(client->createReportingSession(13, kWait));
+  auto timedOut = client->startReportingSessionForID(13, std::chrono::milliseconds(100));
+  ASSERT_FALSE(timedOut);
+  EXPECT_EQ(timedOut.error().code, Errc::kTimedOut);
+  EXPECT_EQ(client->pendingCalls(), 0u);
+  ASSERT_TRUE(client->stopReportingSessionForID(13, kWait));
+  EXPECT_TRUE(client->getAllReporters(kWait));
+
+  // A start held when the client closes is ended with the connection.
+  ASSERT_TRUE(client->createReportingSession(14, kWait));
+  Answers<bool> openAtClose;
+  client->startReportingSessionForID(14, openAtClose.Handler());
+  ASSERT_TRUE(client->getAllReporters(kWait));
+  client->Close();
+  ASSERT_EQ(openAtClose.Count(), 1u);
+  EXPECT_EQ(openAtClose.At(0).error().code, Errc::kConnectionLost);
+  EXPECT_EQ(client->pendingCalls(), 0u);
+  auto afterClose = client->getAllReporters(kWait);
+  ASSERT_FALSE(afterClose);
+  EXPECT_EQ(afterClose.error().code, Errc::kConnectionLost);
+}
+
+TEST(ClientLibraryE2eTest, TheServiceGoingAwayEndsEveryWaitingCallAtOnce) {
+  TavrindProcess service;
+  ASSERT_TRUE(service.Start()) << service.Log();
+  auto client = MustConnect(service);
+  ASSERT_TRUE(client);
+  ASSERT_TRUE(client->createReportingSession(21, kWait));
+
+  // A blocking start on another thread waits for the held answer, with a long time-out.
+  std::optional<Result<bool>> blocked;
+  std::thread waiting([&] { blocked = client->startReportingSessionForID(21, kWait * 6); });
+  ASSERT_TRUE(testing::WaitUntil([&] { return client->pendingCalls() == 1; }));
+  const auto killedAt = std::chrono::steady_clock::now();
+  ASSERT_EQ(service.Stop(SIGKILL), 128 + SIGKILL);
+  waiting.join();
+  EXPECT_LT(std::chrono::steady_clock::now() - killedAt, kWait);
+  ASSERT_TRUE(blocked.has_value());
+  ASSERT_FALSE(*blocked);
+  EXPECT_EQ(blocked->error().code, Errc::kConnectionLost);
+  EXPECT_NE(blocked->error().message.find(service.SocketPath()), std::string::npos);
+  EXPECT_FALSE(client->connected());
+
+  auto fireAndForget = client->sendMessage({{"a", 1}}, 1, 1);
+  ASSERT_FALSE(fireAndForget);
+  EXPECT_EQ(fireAndForget.error().code, Errc::kConnectionLost);
+}
+
+TEST(ClientLibraryE2eTest, ConnectingWhereNoServiceRunsSaysWhatToDo) {
+  const std::string directory = testing::MakeTempDirectory("tavrin-client-");
+  auto missing = Client::Connect({directory + "/run/reporting.sock"});
+  ASSERT_FALSE(missing);
+  EXPECT_EQ(missing.error().code, Errc::kNotRunning);
+  EXPECT_NE(missing.error().message.find(directory + "/run/reporting.sock"), std::string::npos);
+  EXPECT_NE(missing.error().message.find("TAVRIN_SOCKET"), std::string::npos);
+
+  // A socket file left behind by a service that is gone: nothing listens.
+  const std::string stale = directory + "/stale.sock";
+  const int fd = ::socket(AF_UNIX, SOCK_STREAM, 0);
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  std::snprintf(address.sun_path, sizeof(address.sun_path), "%s", stale.c_str());
+  ASSERT_EQ(::bind(fd, reinterpret_cast<sockaddr*>(&address), sizeof(address)), 0);
+  ::close(fd);
+  auto refused = Client::Connect({stale});
+  ASSERT_FALSE(refused);
+  EXPECT_EQ(refused.error().code, Errc::kNotRunning);
+
+  auto tooLong = Client::Connect({"/" + std::string(200, 'x')});
+  ASSERT_FALSE(tooLong);
+  EXPECT_EQ(tooLong.error().code, Errc::kInvalidArgument);
+  std::filesystem::remove_all(directory);
+}
+
+TEST(ClientLibraryE2eTest, SocketPathComesFromTheArgumentThenTheEnvironment) {
+  ::setenv("TAVRIN_SOCKET", "/tmp/from-env.sock", 1);
+  ::setenv("TAVRIN_ROOT", "/tmp/root", 1);
+  EXPECT_EQ(client::ResolveSocketPath("/tmp/given.sock"), "/tmp/given.sock");
+  EXPECT_EQ(client::ResolveSocketPath(), "/tmp/from-env.sock");
+  ::setenv("TAVRIN_SOCKET", "", 1);
+  EXPECT_EQ(client::ResolveSocketPath(), "/tmp/root/run/reporting.sock");
+  ::unsetenv("TAVRIN_SOCKET");
+  ::unsetenv("TAVRIN_ROOT");
+  EXPECT_EQ(client::ResolveSocketPath(), client::kDefaultSocketPath);
+}
+
+TEST(ClientLibraryE2eTest, BadRequestsAndRefusalsAreErrorsAndTheConnectionStaysUsable) {
+  TavrindProcess service;
+  ASSERT_TRUE(service.Start()) << service.Log();
+  auto client = MustConnect(service);
+  ASSERT_TRUE(client);
+
+  auto notADictionary = client->sendMessage(client::Dictionary::array({1, 2}), 1, 1);
+  ASSERT_FALSE(notADictionary);
+  EXPECT_EQ(notADictionary.error().code, Errc::kInvalidArgument);
+
+  client::Dictionary huge{{"blob", std::string(protocol::kDefaultFrameLimit, 'x')}};
+  auto tooBig = client->sendMessage(huge, 1, 1, std::nullopt, kWait);
+  ASSERT_FALSE(tooBig);
+  EXPECT_EQ(tooBig.error().code, Errc::kInvalidArgument);
+  EXPECT_NE(tooBig.error().message.find("frame limit"), std::string::npos);
+
+  // A value MessagePack can carry but the protocol refuses: the service answers status 2.
+  auto binary = client->sendMessage({{"raw", client::Dictionary::binary({1, 2, 3})}}, 1, 1,
+                                    std::nullopt, kWait);
+  ASSERT_FALSE(binary);
+  EXPECT_EQ(binary.error().code, Errc::kRejected);
+  EXPECT_EQ(binary.error().domain, protocol::kProtocolErrorDomain);
+  EXPECT_EQ(binary.error().serviceCode, 6);
+
+  testing::WriteFileAtomically(service.DefaultsPath(), "disable_reporting = true\n");
+  ASSERT_TRUE(service.WaitForLog("re-reading tavrin defaults")) << service.Log();
+  auto disabled = client->sendMessage({{"a", 1}}, 1, 1, std::nullopt, kWait);
+  ASSERT_FALSE(disabled);
+  EXPECT_EQ(disabled.error().code, Errc::kOperationError);
+  EXPECT_EQ(disabled.error().domain, "com.quorvex.audio.reporting");
+  EXPECT_EQ(disabled.error().serviceCode, 1);
+  EXPECT_NE(disabled.error().message.find("disable_reporting"), std::string::npos);
+
+  EXPECT_TRUE(client->connected());
+  EXPECT_TRUE(client->createReportingSession(31, kWait));
+}
+
+TEST(ClientLibraryE2eTest, BlockingCallInsideAHandlerIsRefusedInsteadOfHanging) {
+  TavrindProcess service;
+  ASSERT_TRUE(service.Start()) << service.Log();
+  auto client = MustConnect(service);
+  ASSERT_TRUE(client);
+  std::atomic<int> nested{-1};
+  client->getAllReporters([&](Result<std::vector<int64_t>>) {
+    auto inner = client->createReportingSession(1, kWait);
+    nested = inner ? 0 : static_cast<int>(inner.error().code);
+  });
+  ASSERT_TRUE(testing::WaitUntil([&] { return nested.load() != -1; }));
+  EXPECT_EQ(nested.load(), static_cast<int>(Errc::kWouldDeadlock));
+}
+
+TEST(ClientLibraryE2eTest, ConcurrentCallersShareOneConnection) {
+  TavrindProcess service;
+  ASSERT_TRUE(service.Start()) << service.Log();
+  auto client = MustConnect(service);
+  ASSERT_TRUE(client);
+  constexpr int kThreads = 4;
+  constexpr int kMessages = 50;
+  std::atomic<int> failures{0};
+  std::vector<std::thread> threads;
+  for (int t = 0; t < kThreads; ++t) {
+    threads.emplace_back([&, t] {
+      const int64_t id = 500 + t;
+      if (!client->createReportingSession(id, kWait)) ++failures;
+      for (int i = 0; i < kMessages; ++i) {
+        if (!client->sendMessage({{"i", i}}, 3, 0, std::vector<int64_t>{id}, kWait)) ++failures;
+      }
+      if (!client->destroyReportingSession(id, kWait)) ++failures;
+    });
+  }
+  for (auto& thread : threads) thread.join();
+  EXPECT_EQ(failures.load(), 0);
+  EXPECT_EQ(client->pendingCalls(), 0u);
+}
+
+TEST(ClientLibraryE2eTest, SessionHelperStopsAndDestroysOnScopeExit) {
+  TavrindProcess service;
+  ASSERT_TRUE(service.Start()) << service.Log();
+  auto client = MustConnect(service);
+  ASSERT_TRUE(client);
+  int64_t id = 0;
+  {
+    Session::Options options;
+    options.serviceType = 3;
+    options.configuration = {{"route", "headphones"}};
+    auto opened = Session::Open(*client, 0, options);
+    ASSERT_TRUE(opened) << opened.error().message;
+    Session session = std::move(opened.value());
+    id = session.reporterID();
+    EXPECT_NE(id, 0);
+    EXPECT_EQ(client->getServiceNameForReporterID(id, kWait).value(), 3);
+    for (int i = 0; i < 3; ++i) ASSERT_TRUE(session.send({{"n", i}}, 8, 2));
+    EXPECT_TRUE(session.send({{"n", 3}}, 8, 2, kWait));
+  }
+  EXPECT_EQ(client->reporterID(id, kWait).value(), (client::Validity{0, 0xFFFF}));
+  EXPECT_EQ(client->pendingCalls(), 0u);
+  EXPECT_TRUE(testing::WaitUntil([&] { return MessageRows(service, id, 8) == 4; }));
+  // The stop wrote the session's summary through its own path.
+  EXPECT_TRUE(testing::WaitUntil([&] { return MessageRows(service, id, 0xFFFF) == 1; }));
+}
+
+TEST(ClientLibraryE2eTest, KillServiceIsAnsweredByTheServiceEnding) {
+  TavrindProcess service;
+  ASSERT_TRUE(service.Start()) << service.Log();
+  auto client = MustConnect(service);
+  ASSERT_TRUE(client);
+  auto killed = client->killService(kWait);
+  EXPECT_TRUE(killed) << killed.error().message;
+  EXPECT_EQ(service.WaitForExit(), 2);
+  EXPECT_FALSE(client->connected());
+}
+
+}  // namespace
+}  // namespace tavrin
