@@ -238,9 +238,9 @@ void OperationCommands::AddTo(CLI::App& app, bool oneShot) {
               : "";
 
   auto* create = add("create",
-                     oneShot ? "create a session (ID random unless given); it ends with this "
-                               "command's connection"
-                             : "create a session (ID random unless given) on this connection",
+                     oneShot ? "create a session (random ID unless given); it ends with this "
+                               "command"
+                             : "create a session (random ID unless given) on this connection",
                      Operation::kCreate);
   create->add_option("ID", reporter_, "reporter ID");
 
@@ -263,14 +263,12 @@ void OperationCommands::AddTo(CLI::App& app, bool oneShot) {
       ->required();
 
   auto* start =
-      add("start", "start a session of any connection; its answer comes when the session stops",
-          Operation::kStart);
+      add("start", "start a session; its answer comes when the session stops", Operation::kStart);
   start->add_option("ID", reporter_, "reporter ID")->required();
 
-  auto* send = add("send",
-                   "send a message (JSON object) to --to sessions, else to every running one, "
-                   "else standalone",
-                   Operation::kSend);
+  auto* send =
+      add("send", "send a message (JSON object) to --to IDs, else to every running session",
+          Operation::kSend);
   send->add_option("JSON", json_, "the payload, a JSON object, e.g. '{\"level\": 3}'")->required();
   send->add_option("--category,-c", category_, "category (default 1)");
   send->add_option("--type,-t", type_, "type (default 0)");
@@ -301,31 +299,78 @@ bool OperationCommands::Selected() const {
                      [](const auto& command) { return command.first->parsed(); });
 }
 
-int OperationCommands::Run(Connection& connection, const Context& context) {
-  for (const auto& [command, operation] : commands_) {
-    if (command->parsed()) return RunParsed(operation, connection, context);
-  }
-  return Fail(kExitUsage, "no operation given");
-}
-
-int OperationCommands::RunParsed(Operation operation, Connection& connection,
-                                 const Context& context) {
-  client::Client& client = connection.client();
-  const auto timeout = context.timeout;
+int OperationCommands::Prepare() {
+  const auto chosen = std::find_if(commands_.begin(), commands_.end(),
+                                   [](const auto& command) { return command.first->parsed(); });
+  if (chosen == commands_.end()) return Fail(kExitUsage, "no operation given");
+  Request request;
+  request.operation = chosen->second;
+  const Operation operation = request.operation;
   std::string error;
 
-  int64_t reporterID = 0;
   const bool needsReporter = operation != Operation::kSend && operation != Operation::kReporters &&
                              operation != Operation::kKill;
   if (needsReporter) {
     if (operation == Operation::kCreate && reporter_.empty()) {
-      reporterID = client::NewReporterID();
+      request.reporterID = client::NewReporterID();
     } else if (auto parsed = ReporterArgument(reporter_, &error)) {
-      reporterID = *parsed;
+      request.reporterID = *parsed;
     } else {
       return Fail(kExitUsage, error);
     }
   }
+  if (operation == Operation::kSetType) {
+    const auto serviceType = ParseServiceType(serviceType_);
+    if (!serviceType) {
+      return Fail(kExitUsage, fmt::format("'{}' is not a service type (0-65535 or a name such "
+                                          "as generic, telephony, haptics)",
+                                          serviceType_));
+    }
+    request.serviceType = *serviceType;
+  }
+  if (operation == Operation::kConfigure || operation == Operation::kSend) {
+    auto object = ParseJsonObject(json_, &error);
+    if (!object) {
+      return Fail(kExitUsage, operation == Operation::kSend
+                                  ? "send: the message is " + error
+                                  : "configure: the configuration is " + error);
+    }
+    request.json = std::move(*object);
+  }
+  if (operation == Operation::kSend) {
+    const auto category = ParseUnsigned(category_, UINT32_MAX);
+    if (!category) {
+      return Fail(kExitUsage, fmt::format("'{}' is not a category (0 to 0xFFFFFFFF)", category_));
+    }
+    const auto type = ParseUnsigned(type_, UINT16_MAX);
+    if (!type) return Fail(kExitUsage, fmt::format("'{}' is not a type (0 to 65535)", type_));
+    request.category = uint32_t(*category);
+    request.type = uint16_t(*type);
+    if (!to_.empty()) {
+      request.to.emplace();
+      for (const std::string& text : to_) {
+        auto id = ReporterArgument(text, &error);
+        if (!id) return Fail(kExitUsage, error);
+        request.to->push_back(*id);
+      }
+    }
+  }
+  request_ = std::move(request);
+  return kExitOk;
+}
+
+int OperationCommands::Run(Connection& connection, const Context& context) {
+  if (!request_) {
+    if (const int status = Prepare(); status != kExitOk) return status;
+  }
+  return Execute(*request_, connection, context);
+}
+
+int OperationCommands::Execute(const Request& request, Connection& connection,
+                               const Context& context) {
+  client::Client& client = connection.client();
+  const auto timeout = context.timeout;
+  const int64_t reporterID = request.reporterID;
 
   // Operations answered with a plain boolean, which the service sends as true in every case.
   auto printAnswer = [&](const char* name, client::Result<bool> answer,
@@ -343,7 +388,7 @@ int OperationCommands::RunParsed(Operation operation, Connection& connection,
     return kExitOk;
   };
 
-  switch (operation) {
+  switch (request.operation) {
     case Operation::kCreate: {
       auto answer = client.createReportingSession(reporterID, timeout);
       if (!answer) return ReportError(answer.error(), context, "create");
@@ -356,16 +401,10 @@ int OperationCommands::RunParsed(Operation operation, Connection& connection,
       }
       return kExitOk;
     }
-    case Operation::kSetType: {
-      const auto serviceType = ParseServiceType(serviceType_);
-      if (!serviceType) {
-        return Fail(kExitUsage, fmt::format("'{}' is not a service type (0-65535 or a name such "
-                                            "as generic, telephony, haptics)",
-                                            serviceType_));
-      }
-      return printAnswer("set-type", client.setServiceType(*serviceType, reporterID, timeout),
-                         {{"serviceType", *serviceType}});
-    }
+    case Operation::kSetType:
+      return printAnswer("set-type",
+                         client.setServiceType(request.serviceType, reporterID, timeout),
+                         {{"serviceType", request.serviceType}});
     case Operation::kGetType: {
       auto answer = client.getServiceNameForReporterID(reporterID, timeout);
       if (!answer) return ReportError(answer.error(), context, "get-type");
@@ -385,11 +424,8 @@ int OperationCommands::RunParsed(Operation operation, Connection& connection,
       }
       return kExitOk;
     }
-    case Operation::kConfigure: {
-      auto configuration = ParseJsonObject(json_, &error);
-      if (!configuration) return Fail(kExitUsage, "configure: the configuration is " + error);
-      return printAnswer("configure", client.setConfiguration(*configuration, reporterID, timeout));
-    }
+    case Operation::kConfigure:
+      return printAnswer("configure", client.setConfiguration(request.json, reporterID, timeout));
     case Operation::kStart: {
       auto answer = connection.Start(reporterID, context);
       if (answer && !*answer) return ReportError(answer->error(), context, "start");
@@ -410,29 +446,13 @@ int OperationCommands::RunParsed(Operation operation, Connection& connection,
       return kExitOk;
     }
     case Operation::kSend: {
-      auto message = ParseJsonObject(json_, &error);
-      if (!message) return Fail(kExitUsage, "send: the message is " + error);
-      const auto category = ParseUnsigned(category_, UINT32_MAX);
-      const auto type = ParseUnsigned(type_, UINT16_MAX);
-      if (!category) {
-        return Fail(kExitUsage, fmt::format("'{}' is not a category (0 to 0xFFFFFFFF)", category_));
-      }
-      if (!type) return Fail(kExitUsage, fmt::format("'{}' is not a type (0 to 65535)", type_));
-      std::optional<std::vector<int64_t>> to;
-      if (!to_.empty()) {
-        to.emplace();
-        for (const std::string& text : to_) {
-          auto id = ReporterArgument(text, &error);
-          if (!id) return Fail(kExitUsage, error);
-          to->push_back(*id);
-        }
-      }
-      auto answer = client.sendMessage(*message, uint32_t(*category), uint16_t(*type), to, timeout);
+      const auto& to = request.to;
+      auto answer = client.sendMessage(request.json, request.category, request.type, to, timeout);
       if (!answer) return ReportError(answer.error(), context, "send");
       if (context.json) {
         PrintJsonLine({{"operation", "send"},
-                       {"category", *category},
-                       {"type", *type},
+                       {"category", request.category},
+                       {"type", request.type},
                        {"to", to ? Json(*to) : Json()},
                        {"accepted", true}});
       } else if (to) {

@@ -79,7 +79,10 @@ class OperationCommands {
   void AddTo(CLI::App& app, bool oneShot);
   // Whether one of them was chosen by the last parse.
   bool Selected() const;
-  // Runs the chosen one and answers the exit status.
+  // Checks the chosen one's arguments, so that a usage error is reported before connecting.
+  // Answers the exit status of that error, or 0.
+  int Prepare();
+  // Runs the chosen one (after Prepare) and answers the exit status.
   int Run(Connection& connection, const Context& context);
 
  private:
@@ -96,8 +99,19 @@ class OperationCommands {
     kReporters,
     kKill
   };
-  int RunParsed(Operation operation, Connection& connection, const Context& context);
+  // The chosen operation with its arguments checked and converted.
+  struct Request {
+    Operation operation = Operation::kReporters;
+    int64_t reporterID = 0;
+    uint16_t serviceType = 0;
+    client::Dictionary json;
+    uint32_t category = 0;
+    uint16_t type = 0;
+    std::optional<std::vector<int64_t>> to;
+  };
+  int Execute(const Request& request, Connection& connection, const Context& context);
 
+  std::optional<Request> request_;
   std::vector<std::pair<CLI::App*, Operation>> commands_;
   std::string reporter_;
   std::string serviceType_;

@@ -44,15 +44,21 @@ int main(int argc, char** argv) {
   app.get_formatter()->column_width(28);
 
   GlobalOptions global;
-  app.add_option("--socket", global.socket, "the service's socket [TAVRIN_SOCKET]");
+  app.add_option("--socket", global.socket, "the service's socket [TAVRIN_SOCKET]")
+      ->type_name("PATH");
   app.add_option("--root", global.root, "the root tavrind runs in (tavrind --root)")
-      ->envname("TAVRIN_ROOT");
-  app.add_option("--state-dir", global.stateDir, "directory of the store tavrin.db");
+      ->envname("TAVRIN_ROOT")
+      ->type_name("DIR");
+  app.add_option("--state-dir", global.stateDir, "directory of the store tavrin.db")
+      ->type_name("DIR");
   app.add_option("--diagnostic-dir", global.diagnosticDir,
-                 "summary files are in DIR/Audio/Reporting");
-  app.add_option("--defaults", global.defaults, "the defaults file [TAVRIN_DEFAULTS]");
+                 "summary files are in DIR/Audio/Reporting")
+      ->type_name("DIR");
+  app.add_option("--defaults", global.defaults, "the defaults file [TAVRIN_DEFAULTS]")
+      ->type_name("PATH");
   app.add_option("--timeout", global.timeout,
-                 "how long to wait for the service: 500ms, 5s (default), 1m");
+                 "how long to wait for the service: 500ms, 5s (default), 1m")
+      ->type_name("TIME");
   app.add_flag("--json", global.json, "machine-readable output: one JSON value per line");
 
   OperationCommands operations;
@@ -70,6 +76,11 @@ int main(int argc, char** argv) {
   try {
     app.parse(argc, argv);
   } catch (const CLI::ParseError& error) {
+    // CLI11 reports a misspelt command as a missing one.
+    const std::vector<std::string> left = app.remaining();
+    if (app.get_subcommands().empty() && !left.empty()) {
+      return Fail(kExitUsage, fmt::format("unknown command '{}'; see tavrinctl --help", left[0]));
+    }
     const int status = app.exit(error);
     return status == 0 ? kExitOk : kExitUsage;
   }
@@ -90,6 +101,7 @@ int main(int argc, char** argv) {
   if (events->parsed()) return RunEvents(eventsOptions, context);
   if (summaries->parsed()) return RunSummaries(*summaries, summariesOptions, context);
   if (operations.Selected()) {
+    if (const int status = operations.Prepare(); status != kExitOk) return status;
     auto opened = Connection::Open(context);
     if (auto* status = std::get_if<int>(&opened)) return *status;
     return operations.Run(*std::get<std::unique_ptr<Connection>>(opened), context);
