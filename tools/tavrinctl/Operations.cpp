@@ -261,6 +261,7 @@ void OperationCommands::AddTo(CLI::App& app, bool oneShot) {
   configure
       ->add_option("JSON", json_, "a JSON object, e.g. '{\"HostApplicationDisplayID\":\"player\"}'")
       ->required();
+  configure->footer(ownNote);
 
   auto* start =
       add("start", "start a session; its answer comes when the session stops", Operation::kStart);
