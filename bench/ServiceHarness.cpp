@@ -15,7 +15,7 @@
 // Not a test: nothing is asserted beyond what a run needs to be valid (every reply and every row
 // arrives). Figures, machine and commands are in docs/performance.md.
 //
-//   build/hb/bench/ServiceHarness            # about a minute with the defaults
+//   build/hb/bench/ServiceHarness            # about 35 s with the defaults
 //   build/hb/bench/ServiceHarness --help
 
 #include <sqlite3.h>
@@ -66,7 +66,7 @@ using SteadyClock = std::chrono::steady_clock;
 constexpr uint32_t kCategory = 0x80000003;
 constexpr int64_t kStoredCategory = kCategory & 0xFFFF;
 constexpr uint16_t kType = 1;
-// Frames per write in the bulk senders: one 64 KiB-ish write, as a busy client library would.
+// Frames per write in the bulk senders (about 80 KB), as a client library that batches would.
 constexpr int kFramesPerWrite = 512;
 // Reporter IDs of the harness's sessions start here (clear of 0, which means "none").
 constexpr int64_t kFirstReporter = 1000;
@@ -74,7 +74,8 @@ constexpr int64_t kFirstReporter = 1000;
 // (its row and the analytics event derived from it), so this keeps the store's queue (65,536
 // records) at most half full.
 constexpr int64_t kDefaultWindow = 16384;
-// An unpaced run's count is final once it has not moved for this long after the last stop answer.
+// An unpaced run's count is final once it has not moved for this long after the work queue has
+// run every message.
 constexpr auto kUnpacedSettle = std::chrono::seconds(2);
 // How often the store file is polled while waiting for rows.
 constexpr auto kStorePollInterval = std::chrono::milliseconds(5);
@@ -97,8 +98,8 @@ std::string LoadAverage() {
   return one + " " + five + " " + fifteen;
 }
 
-// A message as audio clients send them: about 150 bytes of MessagePack. No "EngineOnTime", so no
-// power event rides along.
+// A message as audio clients send them: about 160 bytes a frame. No "EngineOnTime", so no power
+// event rides along.
 Dictionary Payload() {
   return Dictionary{{"ruvoreporting_timestamp", 1794806865123},
                     {"route", "Speaker"},
@@ -352,6 +353,7 @@ struct ThroughputResult {
   double cpuMicrosPerMessage = 0;
   int64_t rssBeforeKiB = 0;   // the service's resident memory before the first message
   int64_t rssCountedKiB = 0;  // and when the count was final, the sessions still running
+  int64_t rssStoppedKiB = 0;  // and once every session was stopped
   int64_t analyticsRows = 0;  // analytics_events rows the run added
   size_t lossLines = 0;
 };
@@ -471,6 +473,7 @@ std::optional<ThroughputResult> RunThroughput(int clients, int64_t messages, int
   const int64_t rssCounted = StatusKiB(service.pid(), "VmRSS");
   stopNow.store(true);
   for (auto& sender : senders) sender.join();
+  const int64_t rssStopped = StatusKiB(service.pid(), "VmRSS");
   if (abandon.load() || failures.load() != 0 || count > messages ||
       (window > 0 && count != messages)) {
     std::fprintf(stderr, "%d client(s): %" PRId64 " of %" PRId64 " rows; the service's log:\n%s\n",
@@ -493,6 +496,7 @@ std::optional<ThroughputResult> RunThroughput(int clients, int64_t messages, int
   result.cpuSeconds = cpu;
   result.rssBeforeKiB = rssBefore;
   result.rssCountedKiB = rssCounted;
+  result.rssStoppedKiB = rssStopped;
   double total = 0;
   for (const auto& [name, seconds] : cpu) total += seconds;
   result.cpuMicrosPerMessage = 1e6 * total / static_cast<double>(messages);
@@ -571,6 +575,7 @@ std::optional<LatencyResult> RunLatency(double rate, double seconds) {
 
   std::vector<double> latencyMs;
   latencyMs.reserve(static_cast<size_t>(total));
+  std::vector<bool> answered(static_cast<size_t>(total), false);
   int64_t bad = 0;
   while (static_cast<int64_t>(latencyMs.size()) + bad < total) {
     std::optional<protocol::Reply> reply =
@@ -578,11 +583,13 @@ std::optional<LatencyResult> RunLatency(double rate, double seconds) {
     const auto now = SteadyClock::now();
     if (!reply) break;
     const int64_t i = static_cast<int64_t>(reply->call - kFirstCall);
-    if (reply->call < kFirstCall || i >= total || reply->status != protocol::Status::kOk ||
-        !protocol::IsNilReplyValue(reply->value)) {
+    // A second answer to one call is as wrong as none.
+    if (reply->call < kFirstCall || i >= total || answered[static_cast<size_t>(i)] ||
+        reply->status != protocol::Status::kOk || !protocol::IsNilReplyValue(reply->value)) {
       ++bad;
       continue;
     }
+    answered[static_cast<size_t>(i)] = true;
     latencyMs.push_back(std::chrono::duration<double, std::milli>(now - dueAt(i)).count());
   }
   sender.join();
@@ -813,6 +820,8 @@ int main(int argc, char** argv) {
   tavrin::Value out = tavrin::MakeDictionary();
   out["tavrind"] = gTavrindPath;
   out["cores"] = std::thread::hardware_concurrency();
+  const size_t frameBytes = RequestFrame(std::nullopt, MessageFor(kFirstReporter)).size();
+  out["message_frame_bytes"] = frameBytes;
   out["load_before"] = LoadAverage();
   bool ok = true;
   std::vector<ThroughputResult> throughput;
@@ -858,6 +867,7 @@ int main(int argc, char** argv) {
                           {"service_cpu_us_per_message", r.cpuMicrosPerMessage},
                           {"rss_before_kib", r.rssBeforeKiB},
                           {"rss_counted_kib", r.rssCountedKiB},
+                          {"rss_stopped_kib", r.rssStoppedKiB},
                           {"analytics_rows", r.analyticsRows},
                           {"loss_lines", r.lossLines}};
     if (pipe) item["ratio_to_socketpair"] = r.rate / pipe->rate;
@@ -900,7 +910,8 @@ int main(int argc, char** argv) {
     std::printf("%s\n", out.dump(2).c_str());
     return ok ? 0 : 1;
   }
-  std::printf("tavrind over its socket: %s\n", gTavrindPath.c_str());
+  std::printf("tavrind over its socket: %s; a message frame is %zu bytes\n", gTavrindPath.c_str(),
+              frameBytes);
   std::printf("cores %u, load average before %s, after %s\n", std::thread::hardware_concurrency(),
               out["load_before"].get<std::string>().c_str(),
               out["load_after"].get<std::string>().c_str());
@@ -924,9 +935,11 @@ int main(int argc, char** argv) {
     }
     std::printf("%-40s service CPU %.1f us per message (%s)\n", "", r.cpuMicrosPerMessage,
                 cpu.c_str());
-    std::printf("%-40s resident memory %.1f MiB before, %.1f MiB with the sessions still open\n",
-                "", static_cast<double>(r.rssBeforeKiB) / 1024,
-                static_cast<double>(r.rssCountedKiB) / 1024);
+    std::printf(
+        "%-40s resident memory %.1f MiB before, %.1f MiB with the sessions still open, "
+        "%.1f MiB once stopped\n",
+        "", static_cast<double>(r.rssBeforeKiB) / 1024, static_cast<double>(r.rssCountedKiB) / 1024,
+        static_cast<double>(r.rssStoppedKiB) / 1024);
   }
   if (latency) {
     const std::string label = "(b) latency, " + Thousands(latency->offeredRate) + " for " +
