@@ -200,7 +200,8 @@ int RunShell(const Context& context, std::FILE* in) {
   std::string line;
   size_t lineNumber = 0;
   bool tooLong = false;
-  while (!killed && lines.Next(&line, &tooLong)) {
+  bool ended = false;
+  while (!killed && !(ended = !lines.Next(&line, &tooLong))) {
     ++lineNumber;
     // A script's errors say which line they come from.
     if (!lines.interactive()) SetFailPrefix(fmt::format("line {}: ", lineNumber));
@@ -258,6 +259,8 @@ int RunShell(const Context& context, std::FILE* in) {
   }
 
   SetFailPrefix("");
+  // Ctrl-D leaves the cursor after the prompt.
+  if (ended && lines.interactive()) std::printf("\n");
   if (!killed) {
     for (int64_t reporterID : connection.RunningOwnSessions()) {
       auto stopped = connection.client().stopReportingSessionForID(reporterID, context.timeout);
