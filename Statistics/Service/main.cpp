@@ -32,6 +32,10 @@ namespace {
 constexpr int kUsageError = 64;     // a flag or value that cannot be used
 constexpr int kStartupFailure = 1;  // the socket cannot be set up
 
+// Decoded requests and deliveries waiting for a thread, beyond which requests are left unread:
+// about 16 MB of typical messages.
+constexpr uint64_t kMaxQueuedWorkItems = 16384;
+
 // How long a stop waits for queued work: longer than a session's wait for its back-ends (9 s), so
 // that messages queued behind a waiting session are still delivered.
 constexpr std::chrono::seconds kShutdownDrainLimit{10};
@@ -174,6 +178,10 @@ int main(int argc, char** argv) {
 
   auto delegate = RuvoReportingServiceDelegate::init(services);
   listener.SetDelegate(delegate.get());
+  // Clients that send faster than the store commits are slowed down through their sockets rather
+  // than have their records dropped.
+  listener.SetReadGate(
+      [&] { return dispatcher.QueuedItems() < kMaxQueuedWorkItems && !reporting.Congested(); });
 
   asio::signal_set stopSignals(listener.Io(), SIGTERM, SIGINT);
   stopSignals.async_wait([&](const asio::error_code& waitError, int signal) {

@@ -115,6 +115,11 @@ class ReportingBackend {
   // The highest session row the back-end holds (0 when none), so that new sessions continue the
   // numbering of an existing store.
   virtual int64_t LastSessionRow() const { return 0; }
+  // Records taken in and not yet written out, and the number at which the back-end starts
+  // dropping (0: it keeps no bounded queue of its own). Cheap: read for every request the service
+  // decodes, to slow clients down before records are lost.
+  virtual size_t Backlog() const { return 0; }
+  virtual size_t BacklogCapacity() const { return 0; }
 };
 using ReportingBackendPtr = std::unique_ptr<ReportingBackend>;
 

@@ -277,6 +277,14 @@ void BackendReportingService::ApplyDefaults(const Dictionary& defaults) {
   SetAnalyticsPolicy(enabled, std::move(prefixes));
 }
 
+bool BackendReportingService::Congested() const {
+  for (const auto& backend : backends_) {
+    const size_t capacity = backend->BacklogCapacity();
+    if (capacity > 0 && backend->Backlog() * 2 >= capacity) return true;
+  }
+  return false;
+}
+
 BackendList BackendReportingService::UpBackends() const {
   std::vector<std::string> names;
   for (const auto& backend : backends_) {

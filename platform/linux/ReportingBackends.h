@@ -124,6 +124,10 @@ class BackendReportingService final : public TelvoroService,
   // Events turned away by the analytics policy.
   uint64_t AnalyticsFiltered() const { return analyticsFiltered_.load(); }
 
+  // True while some back-end's queue is at least half full: the service then stops reading
+  // requests until it drains, so that clients are slowed down instead of losing records.
+  bool Congested() const;
+
   // What discovery lists now: the names of the back-ends that are up; nothing when none is.
   BackendList UpBackends() const;
   std::vector<BackendStatus> Status() const;

@@ -299,6 +299,7 @@ bool SqliteStore::Append(ReportRecordPtr record) {
     stopping = stopping_;
     if (!stopping && queue_.size() < options_.queueCapacity) {
       queue_.push_back(Queued{++acceptedSeq_, std::move(record)});
+      queued_.store(queue_.size(), std::memory_order_relaxed);
       accepted_.fetch_add(1, std::memory_order_relaxed);
       wakeup_.notify_one();
       return true;
@@ -364,6 +365,7 @@ void SqliteStore::WriterLoop() {
             batch.push_back(std::move(queue_.front()));
             queue_.pop_front();
           }
+          queued_.store(queue_.size(), std::memory_order_relaxed);
           // Whoever waits for a flush or the shutdown waits for this batch: commit it now.
           if (batch.size() >= kMaxBatchRecords || stopping_ || !waiters_.empty()) break;
           if (!wakeup_.wait_until(lock, deadline, hasWork)) break;

@@ -102,6 +102,8 @@ class SqliteStore final : public ReportingBackend {
   BackendStats Stats() const override;
   void Shutdown() override;
   int64_t LastSessionRow() const override { return lastSessionRow_; }
+  size_t Backlog() const override { return queued_.load(std::memory_order_relaxed); }
+  size_t BacklogCapacity() const override { return options_.queueCapacity; }
 
   // Records lost so far, for any reason.
   uint64_t DroppedRecords() const { return drops_.Total(); }
@@ -149,6 +151,7 @@ class SqliteStore final : public ReportingBackend {
   std::atomic<State> state_{State::kUp};
   std::atomic<uint64_t> accepted_{0};
   std::atomic<uint64_t> committed_{0};
+  std::atomic<size_t> queued_{0};  // queue_.size(), readable without the lock
 
   mutable std::mutex mutex_;  // guards the fields below
   std::condition_variable wakeup_;

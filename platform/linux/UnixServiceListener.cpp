@@ -51,7 +51,10 @@ class UnixClientConnection final : public ClientConnection,
                                    public std::enable_shared_from_this<UnixClientConnection> {
  public:
   UnixClientConnection(UnixServiceListener& listener, Socket socket, uint32_t frameLimit)
-      : listener_(listener), socket_(std::move(socket)), reader_(frameLimit) {
+      : listener_(listener),
+        socket_(std::move(socket)),
+        reader_(frameLimit),
+        gateTimer_(socket_.get_executor()) {
     ucred credentials{};
     socklen_t size = sizeof(credentials);
     if (getsockopt(socket_.native_handle(), SOL_SOCKET, SO_PEERCRED, &credentials, &size) == 0) {
@@ -111,7 +114,21 @@ class UnixClientConnection final : public ClientConnection,
       return;
     }
     reader_.Append(std::span<const uint8_t>(buffer_.data(), size));
+    HandleFrames();
+  }
+
+  // Handles the complete frames received so far, then reads more; pauses while the read gate is
+  // closed, leaving the rest in the reader.
+  void HandleFrames() {
     for (;;) {
+      if (!listener_.MayRead()) {
+        listener_.readGateStalls_.fetch_add(1, std::memory_order_relaxed);
+        gateTimer_.expires_after(UnixServiceListener::kReadGatePause);
+        gateTimer_.async_wait([self = shared_from_this()](const asio::error_code& error) {
+          if (!error && !self->ended_) self->HandleFrames();
+        });
+        return;
+      }
       const auto status = reader_.Next();
       if (status == protocol::FrameReader::Status::kNeedMore) break;
       if (status == protocol::FrameReader::Status::kBadLength) {
@@ -193,6 +210,7 @@ class UnixClientConnection final : public ClientConnection,
     asio::error_code ignored;
     socket_.shutdown(Socket::shutdown_both, ignored);
     socket_.close(ignored);
+    gateTimer_.cancel();
     auto self = shared_from_this();
     if (abnormal && interruption_) interruption_();
     if (invalidation_) invalidation_();
@@ -206,6 +224,7 @@ class UnixClientConnection final : public ClientConnection,
   UnixServiceListener& listener_;
   Socket socket_;
   protocol::FrameReader reader_;
+  asio::steady_timer gateTimer_;
   std::array<uint8_t, kReadChunk> buffer_{};
   int32_t pid_ = 0;
   uint32_t uid_ = 0;

@@ -1,6 +1,9 @@
 #pragma once
 
+#include <atomic>
+#include <chrono>
 #include <cstdint>
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <set>
@@ -48,6 +51,14 @@ class UnixServiceListener final : public ServiceListener {
   const std::string& SocketPath() const { return options_.socketPath; }
 
   void SetDelegate(ServiceListenerDelegate* delegate) override;
+  // Asked before each request is decoded, on the I/O thread; while it answers false, connections
+  // leave their requests unread (clients see their sockets fill up and slow down) and ask again
+  // after kReadGatePause. Set before Resume().
+  void SetReadGate(std::function<bool()> mayRead) { readGate_ = std::move(mayRead); }
+  // Short enough to add little latency once the gate opens, long enough not to spin the thread.
+  static constexpr auto kReadGatePause = std::chrono::milliseconds(1);
+  // Times a connection found the gate closed.
+  uint64_t ReadGateStalls() const { return readGateStalls_.load(std::memory_order_relaxed); }
   // Runs the I/O loop on the calling thread until Stop().
   void Resume() override;
   // Thread-safe; makes Resume() return. Connections are closed.
@@ -67,7 +78,11 @@ class UnixServiceListener final : public ServiceListener {
   UnixListenerOptions options_;
   asio::io_context io_;
   asio::local::stream_protocol::acceptor acceptor_;
+  bool MayRead() const { return !readGate_ || readGate_(); }
+
   ServiceListenerDelegate* delegate_ = nullptr;
+  std::function<bool()> readGate_;
+  std::atomic<uint64_t> readGateStalls_{0};
   bool socketActivated_ = false;
   bool boundPath_ = false;
   mutable std::mutex connectionsMutex_;

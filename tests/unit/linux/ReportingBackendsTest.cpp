@@ -257,6 +257,41 @@ TEST_F(ReportingBackendsTest, DiscoveryAnswersOnAnotherThreadWithTheBackendsThat
   EXPECT_NE(thread, std::this_thread::get_id()) << "never on the caller's stack";
 }
 
+// A back-end whose queue depth the test sets.
+class BacklogBackend final : public ReportingBackend {
+ public:
+  BacklogBackend(std::atomic<size_t>& backlog, size_t capacity)
+      : backlog_(backlog), capacity_(capacity) {}
+  std::string Name() const override { return "backlog"; }
+  bool IsUp() const override { return true; }
+  bool Append(ReportRecordPtr) override { return true; }
+  void Flush(FlushCallback done) override { done(std::nullopt); }
+  BackendStats Stats() const override { return {}; }
+  void Shutdown() override {}
+  size_t Backlog() const override { return backlog_.load(); }
+  size_t BacklogCapacity() const override { return capacity_; }
+
+ private:
+  std::atomic<size_t>& backlog_;
+  const size_t capacity_;
+};
+
+TEST_F(ReportingBackendsTest, CongestedFromHalfOfAnyBoundedQueue) {
+  std::atomic<size_t> bounded{0};
+  std::atomic<size_t> unbounded{1000000};
+  std::vector<ReportingBackendPtr> backends;
+  backends.push_back(std::make_unique<BacklogBackend>(unbounded, 0));
+  backends.push_back(std::make_unique<BacklogBackend>(bounded, 100));
+  auto service = MakeService(std::move(backends));
+  EXPECT_FALSE(service->Congested()) << "a back-end without a bounded queue never congests";
+  bounded = 49;
+  EXPECT_FALSE(service->Congested());
+  bounded = 50;
+  EXPECT_TRUE(service->Congested());
+  bounded = 0;
+  EXPECT_FALSE(service->Congested());
+}
+
 TEST_F(ReportingBackendsTest, DiscoveryLeavesOutADownBackendAndAnswersNothingWhenNoneIsUp) {
   {
     std::vector<ReportingBackendPtr> backends;
