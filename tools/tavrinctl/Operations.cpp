@@ -165,8 +165,9 @@ Connection::~Connection() {
 
 std::optional<client::Result<bool>> Connection::Start(int64_t reporterID, const Context& context) {
   auto state = std::make_shared<HeldStart>();
+  const bool json = context.json;
   client_->startReportingSessionForID(
-      reporterID, [this, state, reporterID](client::Result<bool> answer) {
+      reporterID, [this, state, reporterID, json](client::Result<bool> answer) {
         std::lock_guard lock(mutex_);
         if (!state->roundTripDone) {
           state->immediateAnswer = std::move(answer);
@@ -175,13 +176,23 @@ std::optional<client::Result<bool>> Connection::Start(int64_t reporterID, const 
         const auto held = heldStarts_.find(reporterID);
         if (held != heldStarts_.end() && held->second == state) heldStarts_.erase(held);
         if (answer.ok()) {
-          notes_.push_back(fmt::format("the start of {} was answered {} (its session stopped)",
-                                       reporterID, answer.value()));
+          notes_.push_back(json ? Json({{"operation", "start"},
+                                        {"reporterID", reporterID},
+                                        {"answer", answer.value()},
+                                        {"answeredAtStop", true}})
+                                      .dump()
+                                : fmt::format("the start of {} was answered {} (its session "
+                                              "stopped)",
+                                              reporterID, answer.value()));
         } else if (answer.error().code == client::Errc::kNoReply) {
-          notes_.push_back(fmt::format(
-              "the start of {} will never be answered: its session went away (destroyed, or "
-              "replaced by a new create)",
-              reporterID));
+          notes_.push_back(json ? Json({{"operation", "start"},
+                                        {"reporterID", reporterID},
+                                        {"answer", nullptr},
+                                        {"dropped", true}})
+                                      .dump()
+                                : fmt::format("the start of {} will never be answered: its session "
+                                              "went away (destroyed, or replaced by a new create)",
+                                              reporterID));
         }
       });
   // Requests are answered in order: once this query is answered, an immediate answer to the

@@ -268,8 +268,14 @@ int RunShell(const Context& context, std::FILE* in) {
         lastFailure = ReportError(stopped.error(), context, fmt::format("stop {}", reporterID));
         continue;
       }
-      if (!context.json)
+      if (context.json) {
+        PrintJsonLine({{"operation", "stop"},
+                       {"reporterID", reporterID},
+                       {"answer", stopped.value()},
+                       {"atEnd", true}});
+      } else {
         std::printf("stopped %lld, still running at the end\n", static_cast<long long>(reporterID));
+      }
     }
   }
   return lastFailure;
