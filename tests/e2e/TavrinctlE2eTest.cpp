@@ -86,6 +86,12 @@ Outcome Sh(const std::string& command) {
   run.status = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
   run.out = ReadAll(outPath);
   run.err = ReadAll(errPath);
+  // A sanitizer's report may come with the very exit status a test expects.
+  for (const char* report : {"Sanitizer", "runtime error:"}) {
+    if (run.err.find(report) != std::string::npos) {
+      ADD_FAILURE() << "sanitizer report from: " << command << "\n" << run.err;
+    }
+  }
   std::error_code ignored;
   std::filesystem::remove_all(directory, ignored);
   return run;
@@ -343,6 +349,24 @@ TEST(TavrinctlE2eTest, TheShellRunsPipedCommandsOnOneConnection) {
     return RowCount(service, "reporter_id = 42 AND payload = '{\"x\":1}'") == 1 &&
            service.LogCount("stopping 43") == 1;
   })) << service.Log();
+
+  // With --json everything it prints is a JSON line, late answers included.
+  const Outcome json = Sh(Ctl(service.root()) +
+                          " --json shell <<'EOF'\n"
+                          "create 44\n"
+                          "start 44\n"
+                          "stop 44\n"
+                          "EOF\n");
+  EXPECT_EQ(json.status, 0) << Describe(json);
+  const std::vector<Json> lines = JsonLines(json.out);
+  ASSERT_EQ(lines.size(), 4u) << json.out;
+  EXPECT_EQ(
+      lines[1],
+      Json({{"operation", "start"}, {"reporterID", 44}, {"held", true}, {"answer", nullptr}}));
+  EXPECT_EQ(lines[3], Json({{"operation", "start"},
+                            {"reporterID", 44},
+                            {"answer", true},
+                            {"answeredAtStop", true}}));
 }
 
 TEST(TavrinctlE2eTest, KillEndsTheServiceWithItsStatus) {
