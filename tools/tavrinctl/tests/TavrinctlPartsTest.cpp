@@ -116,6 +116,50 @@ TEST(TavrinctlParsersTest, ReadBoundedLineSplitsStripsAndSkipsOverlongLines) {
   std::fclose(in);
 }
 
+TEST(TavrinctlParsersTest, PathsComeFromFlagsThenTheEnvironmentThenTheRootThenTheDefaults) {
+  ::unsetenv("TAVRIN_SOCKET");
+  ::unsetenv("TAVRIN_DEFAULTS");
+  GlobalOptions options;
+  Paths paths = ResolvePaths(options);
+  EXPECT_EQ(paths.socket, "/run/tavrin/reporting.sock");
+  EXPECT_EQ(paths.socketSource, "the default");
+  EXPECT_EQ(paths.stateDir, "/var/lib/tavrin");
+  EXPECT_EQ(paths.diagnosticDir, "/var/log/tavrin/DiagnosticLogs");
+  EXPECT_EQ(paths.defaults, "/etc/tavrin/com.quorvex.tavrin.toml");
+
+  options.root = "/srv/t/";
+  paths = ResolvePaths(options);
+  EXPECT_EQ(paths.socket, "/srv/t/run/reporting.sock");
+  EXPECT_EQ(paths.stateDir, "/srv/t/lib");
+  EXPECT_EQ(paths.diagnosticDir, "/srv/t/log/DiagnosticLogs");
+  EXPECT_EQ(paths.defaults, "/srv/t/etc/com.quorvex.tavrin.toml");
+
+  // The environment beats the root, as it does for tavrind.
+  ::setenv("TAVRIN_SOCKET", "/env.sock", 1);
+  ::setenv("TAVRIN_DEFAULTS", "/env.toml", 1);
+  paths = ResolvePaths(options);
+  EXPECT_EQ(paths.socket, "/env.sock");
+  EXPECT_EQ(paths.socketSource, "TAVRIN_SOCKET");
+  EXPECT_EQ(paths.defaults, "/env.toml");
+  EXPECT_EQ(paths.stateDir, "/srv/t/lib");
+
+  options.socket = "/flag.sock";
+  options.defaults = "/flag.toml";
+  options.stateDir = "/state";
+  paths = ResolvePaths(options);
+  EXPECT_EQ(paths.socket, "/flag.sock");
+  EXPECT_EQ(paths.defaults, "/flag.toml");
+  EXPECT_EQ(paths.stateDir, "/state");
+  ::unsetenv("TAVRIN_SOCKET");
+  ::unsetenv("TAVRIN_DEFAULTS");
+
+  // A relative root is taken from the working directory, like tavrind's.
+  options = GlobalOptions{};
+  options.root = "rel";
+  EXPECT_EQ(ResolvePaths(options).socket,
+            (std::filesystem::current_path() / "rel/run/reporting.sock").string());
+}
+
 // ---------------------------------------------------------------------------------------------
 
 TEST(TavrinctlDefaultsTest, ValuesAreTypedLikeTomlAndEverythingElseIsAString) {
