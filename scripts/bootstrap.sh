@@ -6,7 +6,7 @@ set -euo pipefail
 
 packages=(
   # toolchain
-  g++ cmake ninja-build pkg-config git ccache
+  g++ cmake ninja-build pkg-config git ccache make
   # tests, benchmarks, formatting
   libgtest-dev libgmock-dev libbenchmark-dev clang-format clang-tidy
   # libraries of the service
