@@ -22,7 +22,7 @@ namespace {
 using Socket = asio::local::stream_protocol::socket;
 
 // Bytes read from a socket per system call.
-constexpr size_t kReadChunk = 64 * 1024;
+constexpr size_t kReadChunk = 16 * 1024;
 // Replies waiting for a client that does not read them. Past this the client is cut off rather
 // than let it pin the service's memory.
 constexpr size_t kMaxPendingReplyBytes = 16 * 1024 * 1024;
