@@ -6,7 +6,7 @@
 #include <thread>
 #include <vector>
 
-#include "platform/WorkQueue.h"
+#include "platform/Dispatcher.h"
 
 namespace tavrin {
 

@@ -7,9 +7,9 @@
 #include <string>
 #include <vector>
 
-#include "platform/Dictionary.h"
+#include "base/Dictionary.h"
 #include "platform/DriverStatsService.h"
-#include "platform/SystemLog.h"
+#include "platform/LogSystem.h"
 
 namespace tavrin {
 

@@ -4,7 +4,7 @@
 #include "Statistics/Service/RuvoReportingSession.h"
 #include "platform/Platform.h"
 #include "platform/PowerEventLog.h"
-#include "platform/SystemLog.h"
+#include "platform/LogSystem.h"
 
 namespace tavrin {
 

@@ -2,7 +2,7 @@
 
 #include <cstdint>
 
-#include "platform/Dictionary.h"
+#include "base/Dictionary.h"
 
 namespace tavrin {
 

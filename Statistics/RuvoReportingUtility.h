@@ -9,8 +9,8 @@
 
 #include "platform/Condition.h"
 #include "platform/DeviceInfoQuery.h"
-#include "platform/Dictionary.h"
-#include "platform/SystemLog.h"
+#include "base/Dictionary.h"
+#include "platform/LogSystem.h"
 
 namespace tavrin {
 

@@ -43,7 +43,7 @@
 
 #include <CLI/CLI.hpp>
 
-#include "platform/Dictionary.h"
+#include "base/Dictionary.h"
 #include "protocol/Codec.h"
 #include "protocol/Frame.h"
 

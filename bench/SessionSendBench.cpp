@@ -23,9 +23,9 @@
 #include <benchmark/benchmark.h>
 
 #include "Statistics/Service/RuvoReportingSession.h"
-#include "platform/SystemLog.h"
+#include "platform/LogSystem.h"
 #include "platform/TelvoroSession.h"
-#include "platform/linux/AsioDispatcher.h"
+#include "platform/linux/dispatch/AsioDispatcher.h"
 #include "tests/fakes/FakePlatform.h"
 
 // The replacements below pair malloc with free; GCC cannot see that operator new is replaced

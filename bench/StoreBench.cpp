@@ -12,8 +12,8 @@
 #include <future>
 #include <string>
 
-#include "platform/Dictionary.h"
-#include "platform/linux/SqliteStore.h"
+#include "base/Dictionary.h"
+#include "platform/linux/store/SqliteStore.h"
 
 namespace tavrin {
 namespace {

@@ -19,19 +19,9 @@ class Clock {
   virtual WallTime WallNow() const = 0;
 };
 
-// Source of randomness, replaceable in tests.
-class RandomSource {
- public:
-  virtual ~RandomSource() = default;
-  // A uniformly distributed integer in [0, bound); bound > 0.
-  virtual uint64_t UniformBelow(uint64_t bound) = 0;
-};
-
-// The real clock and a real random source (thread-safe, process-wide).
-Clock& SystemClock();
-RandomSource& SystemRandom();
-
 // Seconds since the epoch, as stored in records.
-double SecondsSinceEpoch(WallTime time);
+inline double SecondsSinceEpoch(WallTime time) {
+  return std::chrono::duration<double>(time.time_since_epoch()).count();
+}
 
 }  // namespace tavrin

@@ -1,7 +1,5 @@
 #pragma once
 
-#include <memory>
-
 #include "platform/Clock.h"
 
 namespace tavrin {
@@ -21,8 +19,5 @@ class Condition {
   // The clock that deadlines refer to.
   virtual Clock& GetClock() = 0;
 };
-
-// A condition over the real steady clock.
-std::unique_ptr<Condition> MakeCondition();
 
 }  // namespace tavrin

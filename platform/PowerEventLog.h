@@ -3,7 +3,7 @@
 #include <cstdint>
 #include <string>
 
-#include "platform/Dictionary.h"
+#include "base/Dictionary.h"
 
 namespace tavrin {
 

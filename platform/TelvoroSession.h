@@ -7,8 +7,8 @@
 #include <string>
 #include <vector>
 
-#include "platform/Dictionary.h"
-#include "platform/Error.h"
+#include "base/Dictionary.h"
+#include "base/Error.h"
 
 namespace tavrin {
 

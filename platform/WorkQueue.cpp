@@ -1,4 +1,4 @@
-#include "platform/WorkQueue.h"
+#include "platform/Dispatcher.h"
 
 namespace tavrin {
 

@@ -25,8 +25,8 @@
 #include <variant>
 #include <vector>
 
-#include "platform/Dictionary.h"
-#include "platform/Error.h"
+#include "base/Dictionary.h"
+#include "base/Error.h"
 #include "protocol/Operations.h"
 
 namespace tavrin::protocol {

@@ -7,7 +7,7 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/Dictionary.h"
+#include "base/Dictionary.h"
 
 namespace tavrin::protocol {
 

@@ -5,8 +5,8 @@
 #include <optional>
 #include <vector>
 
-#include "platform/Dictionary.h"
-#include "platform/Error.h"
+#include "base/Dictionary.h"
+#include "base/Error.h"
 
 namespace tavrin {
 

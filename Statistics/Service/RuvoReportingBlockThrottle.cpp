@@ -13,7 +13,7 @@
 #include <utility>
 
 #include "Statistics/RuvoReportingUtility.h"
-#include "platform/SystemLog.h"
+#include "platform/LogSystem.h"
 
 namespace tavrin {
 namespace {
@@ -76,7 +76,7 @@ void RuvoReportingBlockThrottleTimerWrapper::sleepFor(double seconds) {
     delay = std::chrono::duration_cast<Duration>(
         std::chrono::duration<double>(std::min(seconds, kMaxSleepSeconds)));
   }
-  fireDate_.store((SystemClock().Now() + delay).time_since_epoch().count());
+  fireDate_.store((std::chrono::steady_clock::now() + delay).time_since_epoch().count());
 }
 
 SteadyTime RuvoReportingBlockThrottleTimerWrapper::fireDate() const {
@@ -323,7 +323,7 @@ void RuvoReportingBlockThrottle::onTimer(const WrapperPtr& wrapper, const std::s
   // callback, so a callback seen here is never run before its own throttle time.
   Block block = wrapper->block();
   // A duplicate pushed the fire date after this wait was armed.
-  if (wrapper->fireDate() > SystemClock().Now()) {
+  if (wrapper->fireDate() > std::chrono::steady_clock::now()) {
     arm(wrapper, key);
     return;
   }

@@ -17,7 +17,7 @@
 #include <vector>
 
 #include "platform/Clock.h"
-#include "platform/Dictionary.h"
+#include "base/Dictionary.h"
 
 namespace tavrin {
 

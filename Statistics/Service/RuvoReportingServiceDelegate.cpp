@@ -10,7 +10,7 @@
 #include "Statistics/RuvoReportingStratikBridge.h"
 #include "Statistics/RuvoReportingUtility.h"
 #include "platform/AnalyticsSink.h"
-#include "platform/Defaults.h"
+#include "platform/NotificationCenter.h"
 #include "platform/ProcessInfo.h"
 #include "platform/TracePoints.h"
 

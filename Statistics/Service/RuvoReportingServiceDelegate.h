@@ -13,11 +13,11 @@
 #include "Statistics/RuvoReportingDriverUtility.h"
 #include "Statistics/Service/RuvoReportingSession.h"
 #include "platform/Clock.h"
-#include "platform/Dictionary.h"
+#include "base/Dictionary.h"
 #include "platform/Platform.h"
 #include "platform/ServiceListener.h"
-#include "platform/SystemLog.h"
-#include "platform/WorkQueue.h"
+#include "platform/LogSystem.h"
+#include "platform/Dispatcher.h"
 #include "protocol/RuvoReportingServiceProtocol.h"
 
 namespace tavrin {

@@ -10,13 +10,13 @@
 #include <vector>
 
 #include "platform/Clock.h"
-#include "platform/Dictionary.h"
-#include "platform/Error.h"
+#include "base/Dictionary.h"
+#include "base/Error.h"
 #include "platform/OrientationRegistry.h"
 #include "platform/Platform.h"
-#include "platform/SystemLog.h"
+#include "platform/LogSystem.h"
 #include "platform/TelvoroSession.h"
-#include "platform/WorkQueue.h"
+#include "platform/Dispatcher.h"
 
 namespace tavrin {
 

@@ -7,7 +7,7 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/WorkQueue.h"
+#include "platform/Dispatcher.h"
 #include "tests/fakes/FakeClock.h"
 
 namespace tavrin::testing {

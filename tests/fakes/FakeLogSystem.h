@@ -6,7 +6,7 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/SystemLog.h"
+#include "platform/LogSystem.h"
 
 namespace tavrin::testing {
 

@@ -3,14 +3,14 @@
 #include "platform/Platform.h"
 #include "tests/fakes/FakeAnalyticsSink.h"
 #include "tests/fakes/FakeClock.h"
-#include "tests/fakes/FakeDeviceInfo.h"
+#include "tests/fakes/FakeDeviceInfoQuery.h"
 #include "tests/fakes/FakeDispatcher.h"
 #include "tests/fakes/FakeDriverStatsService.h"
 #include "tests/fakes/FakeFileSystem.h"
 #include "tests/fakes/FakeOrientationRegistry.h"
 #include "tests/fakes/FakePowerEventLog.h"
-#include "tests/fakes/FakeRandom.h"
-#include "tests/fakes/FakeTelvoroService.h"
+#include "tests/fakes/FakeRandomSource.h"
+#include "tests/fakes/FakeTelvoroSession.h"
 
 namespace tavrin::testing {
 

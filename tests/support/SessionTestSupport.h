@@ -9,10 +9,10 @@
 #include <gtest/gtest.h>
 
 #include "Statistics/Service/RuvoReportingSession.h"
-#include "platform/SystemLog.h"
+#include "platform/LogSystem.h"
 #include "tests/fakes/FakeLogSystem.h"
 #include "tests/fakes/FakePlatform.h"
-#include "tests/fakes/RecordingTraceRecorder.h"
+#include "tests/fakes/FakeTraceRecorder.h"
 
 namespace tavrin::testing {
 

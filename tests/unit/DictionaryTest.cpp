@@ -1,4 +1,4 @@
-#include "platform/Dictionary.h"
+#include "base/Dictionary.h"
 
 #include <fmt/format.h>
 #include <gtest/gtest.h>

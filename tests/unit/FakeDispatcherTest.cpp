@@ -9,7 +9,7 @@
 #include <gtest/gtest.h>
 
 #include "tests/fakes/FakeClock.h"
-#include "tests/fakes/FakeRandom.h"
+#include "tests/fakes/FakeRandomSource.h"
 
 namespace tavrin::testing {
 namespace {

@@ -4,7 +4,7 @@
 
 #include <algorithm>
 
-#include "platform/linux/CountersTreeDriverStats.h"
+#include "platform/linux/driverstats/CountersTreeDriverStats.h"
 #include "tests/fakes/FakeDriverStatsService.h"
 #include "tests/fakes/FakeLogSystem.h"
 #include "tests/support/TempCountersTree.h"

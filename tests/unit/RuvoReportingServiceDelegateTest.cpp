@@ -8,11 +8,12 @@
 
 #include "platform/TracePoints.h"
 #include "tests/fakes/FakeClientConnection.h"
-#include "tests/fakes/FakeDefaults.h"
+#include "tests/fakes/FakeDefaultsDomain.h"
+#include "tests/fakes/FakeNotificationCenter.h"
 #include "tests/fakes/FakeLogSystem.h"
 #include "tests/fakes/FakePlatform.h"
 #include "tests/fakes/FakeProcessInfo.h"
-#include "tests/fakes/RecordingTraceRecorder.h"
+#include "tests/fakes/FakeTraceRecorder.h"
 
 namespace tavrin {
 namespace {

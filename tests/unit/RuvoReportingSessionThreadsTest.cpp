@@ -14,7 +14,7 @@
 #include <gtest/gtest.h>
 
 #include "Statistics/Service/RuvoReportingSession.h"
-#include "platform/linux/AsioDispatcher.h"
+#include "platform/linux/dispatch/AsioDispatcher.h"
 #include "tests/support/SessionTestSupport.h"
 
 namespace tavrin::testing {

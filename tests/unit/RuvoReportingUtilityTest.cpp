@@ -15,8 +15,9 @@
 
 #include "platform/Platform.h"
 #include "tests/fakes/FakeCondition.h"
-#include "tests/fakes/FakeDeviceInfo.h"
+#include "tests/fakes/FakeDeviceInfoQuery.h"
 #include "tests/fakes/FakeLogSystem.h"
+#include "platform/linux/dispatch/StdCondition.h"
 
 namespace tavrin {
 namespace {

@@ -14,8 +14,8 @@
 #include <fmt/format.h>
 
 #include "Operations.h"
-#include "platform/linux/PosixFileSystem.h"
-#include "platform/linux/TomlDefaultsDomain.h"
+#include "platform/linux/files/PosixFileSystem.h"
+#include "platform/linux/settings/TomlDefaultsDomain.h"
 
 namespace tavrin::ctl {
 namespace {

@@ -17,7 +17,7 @@
 #include "CounterWriter.h"
 #include "ProfilerCounters.h"
 #include "ProfilerPod.h"
-#include "platform/linux/CountersTreeDriverStats.h"
+#include "platform/linux/driverstats/CountersTreeDriverStats.h"
 #include "tests/support/TempCountersTree.h"
 
 extern char** environ;

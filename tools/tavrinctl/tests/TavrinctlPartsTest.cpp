@@ -18,7 +18,7 @@
 #include "Shell.h"
 #include "Store.h"
 #include "Summaries.h"
-#include "platform/linux/TomlDefaultsDomain.h"
+#include "platform/linux/settings/TomlDefaultsDomain.h"
 
 namespace tavrin::ctl {
 namespace {

@@ -1,0 +1,359 @@
+#include "platform/linux/socket/UnixServiceListener.h"
+
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <systemd/sd-daemon.h>
+#include <unistd.h>
+
+#include <array>
+#include <cerrno>
+#include <deque>
+#include <filesystem>
+#include <system_error>
+
+#include "platform/LogSystem.h"
+#include "protocol/Codec.h"
+#include "protocol/Dispatch.h"
+
+namespace tavrin {
+namespace {
+
+using Socket = asio::local::stream_protocol::socket;
+
+// Bytes read from a socket per system call.
+constexpr size_t kReadChunk = 16 * 1024;
+// Replies waiting for a client that does not read them. Past this the client is cut off rather
+// than let it pin the service's memory.
+constexpr size_t kMaxPendingReplyBytes = 16 * 1024 * 1024;
+constexpr int kListenBacklog = 128;
+// Pause after a failed accept (EMFILE and the like) before trying again.
+constexpr auto kAcceptRetryDelay = std::chrono::milliseconds(100);
+
+std::system_error PathError(int error, const std::string& what, const std::string& path) {
+  return std::system_error(error, std::generic_category(), what + " " + path);
+}
+
+// True when something accepts connections at `path` (a live service).
+bool SomeoneListensAt(const std::string& path) {
+  asio::io_context io;
+  Socket probe(io);
+  asio::error_code error;
+  probe.connect(asio::local::stream_protocol::endpoint(path), error);
+  return !error;
+}
+
+}  // namespace
+
+// One client connection. Lives in the listener's set until it has ended; reply senders hold it
+// weakly, so a reply produced after the end is dropped.
+class UnixClientConnection final : public ClientConnection,
+                                   public std::enable_shared_from_this<UnixClientConnection> {
+ public:
+  UnixClientConnection(UnixServiceListener& listener, Socket socket, uint32_t frameLimit)
+      : listener_(listener),
+        socket_(std::move(socket)),
+        reader_(frameLimit),
+        gateTimer_(socket_.get_executor()) {
+    ucred credentials{};
+    socklen_t size = sizeof(credentials);
+    if (getsockopt(socket_.native_handle(), SOL_SOCKET, SO_PEERCRED, &credentials, &size) == 0) {
+      pid_ = credentials.pid;
+      uid_ = credentials.uid;
+    }
+  }
+
+  int32_t ProcessIdentifier() const override { return pid_; }
+  void SetExportedInterface(std::string_view name) override { interface_ = std::string(name); }
+  void SetExportedObject(std::shared_ptr<RuvoReportingServiceProtocol> object) override {
+    object_ = std::move(object);
+  }
+  std::shared_ptr<RuvoReportingServiceProtocol> ExportedObject() const override { return object_; }
+  void SetInterruptionHandler(std::function<void()> handler) override {
+    interruption_ = std::move(handler);
+  }
+  void SetInvalidationHandler(std::function<void()> handler) override {
+    invalidation_ = std::move(handler);
+  }
+  void Resume() override {
+    if (resumed_) return;
+    resumed_ = true;
+    Read();
+  }
+  std::string Description() const override {
+    return fmt::format("<connection from pid {} uid {} to {}>", pid_, uid_,
+                       interface_.empty() ? "(no interface)" : interface_);
+  }
+
+  // Queues one reply frame; any thread.
+  void Send(std::vector<uint8_t> body) {
+    std::vector<uint8_t> frame = protocol::EncodeFrame(body);
+    asio::post(socket_.get_executor(),
+               [self = shared_from_this(), frame = std::move(frame)]() mutable {
+                 self->QueueWrite(std::move(frame));
+               });
+  }
+
+  // Ends the connection from the service's side (shutdown of the listener).
+  void Close() { End(/*abnormal=*/false, "service stopping"); }
+
+ private:
+  void Read() {
+    socket_.async_read_some(asio::buffer(buffer_), [self = shared_from_this()](
+                                                       const asio::error_code& error, size_t size) {
+      self->OnRead(error, size);
+    });
+  }
+
+  void OnRead(const asio::error_code& error, size_t size) {
+    if (ended_) return;
+    if (error) {
+      // A stream that ends between frames is an ordinary goodbye; inside a frame it is not.
+      const bool insideFrame = reader_.InsideFrame();
+      End(insideFrame, insideFrame ? "stream ended inside a frame" : error.message());
+      return;
+    }
+    reader_.Append(std::span<const uint8_t>(buffer_.data(), size));
+    HandleFrames();
+  }
+
+  // Handles the complete frames received so far, then reads more; pauses while the read gate is
+  // closed, leaving the rest in the reader.
+  void HandleFrames() {
+    for (;;) {
+      if (!listener_.MayRead()) {
+        listener_.readGateStalls_.fetch_add(1, std::memory_order_relaxed);
+        gateTimer_.expires_after(UnixServiceListener::kReadGatePause);
+        gateTimer_.async_wait([self = shared_from_this()](const asio::error_code& error) {
+          if (!error && !self->ended_) self->HandleFrames();
+        });
+        return;
+      }
+      const auto status = reader_.Next();
+      if (status == protocol::FrameReader::Status::kNeedMore) break;
+      if (status == protocol::FrameReader::Status::kBadLength) {
+        TLOG_ERROR(nullptr, "closing connection of pid {}: frame length {} outside 1..{}", pid_,
+                   reader_.BadLength(), reader_.FrameLimit());
+        End(/*abnormal=*/true, "bad frame length");
+        return;
+      }
+      if (!HandleFrame(reader_.Body())) return;
+    }
+    Read();
+  }
+
+  // False when the frame ended the connection.
+  bool HandleFrame(std::span<const uint8_t> body) {
+    auto decoded = protocol::DecodeRequest(body);
+    if (auto* error = std::get_if<protocol::RequestError>(&decoded)) {
+      if (error->kind == protocol::RequestError::Kind::kCloseConnection) {
+        TLOG_ERROR(nullptr, "closing connection of pid {}: undecodable request: {}", pid_,
+                   error->reason);
+        End(/*abnormal=*/true, "undecodable request");
+        return false;
+      }
+      TLOG_INFO(nullptr, "rejected request from pid {}: code {}: {}", pid_,
+                static_cast<int64_t>(error->code), error->reason);
+      if (auto reply = protocol::EncodeRejectReply(*error)) Send(std::move(*reply));
+      return true;
+    }
+    std::shared_ptr<RuvoReportingServiceProtocol> object = object_;
+    if (!object) return true;
+    std::weak_ptr<UnixClientConnection> weakSelf = weak_from_this();
+    protocol::Dispatch(std::move(std::get<protocol::Request>(decoded)), *object,
+                       [weakSelf](std::vector<uint8_t> reply) {
+                         if (auto self = weakSelf.lock()) self->Send(std::move(reply));
+                       });
+    return !ended_;
+  }
+
+  void QueueWrite(std::vector<uint8_t> frame) {
+    if (ended_) return;
+    pendingBytes_ += frame.size();
+    if (pendingBytes_ > kMaxPendingReplyBytes) {
+      TLOG_ERROR(nullptr, "closing connection of pid {}: {} bytes of replies not read", pid_,
+                 pendingBytes_);
+      End(/*abnormal=*/true, "replies not read");
+      return;
+    }
+    writes_.push_back(std::move(frame));
+    if (!writing_) WriteNext();
+  }
+
+  void WriteNext() {
+    if (writes_.empty() || ended_) {
+      writing_ = false;
+      return;
+    }
+    writing_ = true;
+    asio::async_write(socket_, asio::buffer(writes_.front()),
+                      [self = shared_from_this()](const asio::error_code& error, size_t) {
+                        if (self->ended_) return;
+                        self->pendingBytes_ -= self->writes_.front().size();
+                        self->writes_.pop_front();
+                        if (error) {
+                          // A client that left without reading its replies: the read side
+                          // reports the end.
+                          self->writing_ = false;
+                          self->writes_.clear();
+                          self->pendingBytes_ = 0;
+                          return;
+                        }
+                        self->WriteNext();
+                      });
+  }
+
+  void End(bool abnormal, std::string_view why) {
+    if (ended_) return;
+    ended_ = true;
+    TLOG_DEBUG(nullptr, "connection of pid {} ended: {}", pid_, why);
+    asio::error_code ignored;
+    socket_.shutdown(Socket::shutdown_both, ignored);
+    socket_.close(ignored);
+    gateTimer_.cancel();
+    auto self = shared_from_this();
+    if (abnormal && interruption_) interruption_();
+    if (invalidation_) invalidation_();
+    interruption_ = nullptr;
+    invalidation_ = nullptr;
+    object_.reset();
+    writes_.clear();
+    listener_.Forget(self);
+  }
+
+  UnixServiceListener& listener_;
+  Socket socket_;
+  protocol::FrameReader reader_;
+  asio::steady_timer gateTimer_;
+  std::array<uint8_t, kReadChunk> buffer_{};
+  int32_t pid_ = 0;
+  uint32_t uid_ = 0;
+  std::string interface_;
+  std::shared_ptr<RuvoReportingServiceProtocol> object_;
+  std::function<void()> interruption_;
+  std::function<void()> invalidation_;
+  bool resumed_ = false;
+  bool ended_ = false;
+  // Write side, I/O thread only.
+  std::deque<std::vector<uint8_t>> writes_;
+  size_t pendingBytes_ = 0;
+  bool writing_ = false;
+};
+
+UnixServiceListener::UnixServiceListener(UnixListenerOptions options)
+    : options_(std::move(options)), acceptor_(io_) {}
+
+UnixServiceListener::~UnixServiceListener() {
+  Stop();
+  asio::error_code ignored;
+  acceptor_.close(ignored);
+  if (boundPath_) ::unlink(options_.socketPath.c_str());
+}
+
+void UnixServiceListener::Open() {
+  if (options_.allowSocketActivation) {
+    const int count = sd_listen_fds(/*unset_environment=*/1);
+    if (count > 0) {
+      const int fd = SD_LISTEN_FDS_START;
+      if (sd_is_socket_unix(fd, SOCK_STREAM, /*listening=*/1, nullptr, 0) <= 0) {
+        throw std::system_error(EINVAL, std::generic_category(),
+                                "descriptor 3 passed by the service manager is not a listening "
+                                "unix stream socket");
+      }
+      acceptor_.assign(asio::local::stream_protocol(), fd);
+      socketActivated_ = true;
+      return;
+    }
+  }
+
+  const std::string& path = options_.socketPath;
+  if (path.empty()) throw std::system_error(EINVAL, std::generic_category(), "no socket path");
+  if (path.size() >= sizeof(sockaddr_un::sun_path)) {
+    throw PathError(ENAMETOOLONG, "socket path too long:", path);
+  }
+  std::error_code fsError;
+  const std::filesystem::path parent = std::filesystem::path(path).parent_path();
+  if (!parent.empty()) {
+    std::filesystem::create_directories(parent, fsError);
+    if (fsError) throw PathError(fsError.value(), "cannot create the directory of", path);
+  }
+  struct stat existing {};
+  if (::lstat(path.c_str(), &existing) == 0) {
+    if (!S_ISSOCK(existing.st_mode)) {
+      throw PathError(EEXIST, "refusing to replace a file that is not a socket:", path);
+    }
+    if (SomeoneListensAt(path)) throw PathError(EADDRINUSE, "another service listens at", path);
+    ::unlink(path.c_str());  // a stale socket of a service that is gone
+  }
+
+  asio::error_code error;
+  acceptor_.open(asio::local::stream_protocol(), error);
+  if (!error) acceptor_.bind(asio::local::stream_protocol::endpoint(path), error);
+  if (error) throw PathError(error.value(), "cannot bind", path);
+  boundPath_ = true;
+  if (::chmod(path.c_str(), options_.socketMode) != 0) {
+    throw PathError(errno, "cannot set the mode of", path);
+  }
+  acceptor_.listen(kListenBacklog, error);
+  if (error) throw PathError(error.value(), "cannot listen on", path);
+}
+
+void UnixServiceListener::SetDelegate(ServiceListenerDelegate* delegate) { delegate_ = delegate; }
+
+void UnixServiceListener::Resume() {
+  StartAccept();
+  io_.run();
+}
+
+void UnixServiceListener::Stop() {
+  asio::post(io_, [this] {
+    asio::error_code ignored;
+    acceptor_.cancel(ignored);
+    std::set<std::shared_ptr<UnixClientConnection>> open;
+    {
+      std::lock_guard lock(connectionsMutex_);
+      open = connections_;
+    }
+    for (const auto& connection : open) connection->Close();
+    io_.stop();
+  });
+}
+
+size_t UnixServiceListener::ConnectionCount() const {
+  std::lock_guard lock(connectionsMutex_);
+  return connections_.size();
+}
+
+void UnixServiceListener::StartAccept() {
+  acceptor_.async_accept([this](const asio::error_code& error, Socket socket) {
+    if (error == asio::error::operation_aborted) return;
+    if (!error) {
+      auto connection =
+          std::make_shared<UnixClientConnection>(*this, std::move(socket), options_.frameLimit);
+      {
+        std::lock_guard lock(connectionsMutex_);
+        connections_.insert(connection);
+      }
+      const bool accepted =
+          delegate_ != nullptr && delegate_->shouldAcceptNewConnection(*this, connection);
+      if (!accepted) {
+        connection->Close();
+      }
+      StartAccept();
+      return;
+    }
+    // Out of descriptors or memory: retry a little later instead of spinning.
+    TLOG_ERROR(nullptr, "accept failed: {}", error.message());
+    auto retry = std::make_shared<asio::steady_timer>(io_, kAcceptRetryDelay);
+    retry->async_wait([this, retry](const asio::error_code& waitError) {
+      if (!waitError) StartAccept();
+    });
+  });
+}
+
+void UnixServiceListener::Forget(const std::shared_ptr<UnixClientConnection>& connection) {
+  std::lock_guard lock(connectionsMutex_);
+  connections_.erase(connection);
+}
+
+}  // namespace tavrin

@@ -1,0 +1,511 @@
+#include "platform/linux/store/SqliteStore.h"
+
+#include <fcntl.h>
+#include <pthread.h>
+#include <sqlite3.h>
+#include <stdio.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+#include <ctime>
+#include <filesystem>
+#include <vector>
+
+namespace tavrin {
+namespace {
+
+constexpr const char* kSchema = R"sql(
+CREATE TABLE IF NOT EXISTS sessions(row INTEGER PRIMARY KEY, reporter_id INTEGER,
+  session_info TEXT, user_info TEXT, created_at REAL, flushed_at REAL);
+CREATE TABLE IF NOT EXISTS session_messages(row INTEGER PRIMARY KEY, session_row INTEGER,
+  reporter_id INTEGER, category INTEGER, type INTEGER, payload TEXT, received_at REAL);
+CREATE TABLE IF NOT EXISTS single_messages(row INTEGER PRIMARY KEY, session_info TEXT,
+  user_info TEXT, category INTEGER, type INTEGER, payload TEXT, received_at REAL);
+CREATE TABLE IF NOT EXISTS analytics_events(row INTEGER PRIMARY KEY, name TEXT, payload TEXT,
+  received_at REAL);
+CREATE TABLE IF NOT EXISTS power_events(row INTEGER PRIMARY KEY, agent INTEGER, name TEXT,
+  payload TEXT, received_at REAL);
+)sql";
+
+// A session's row is handed over twice: at creation, and with flushed_at when it is flushed.
+constexpr const char* kInsertSession =
+    "INSERT INTO sessions(row, reporter_id, session_info, user_info, created_at, flushed_at) "
+    "VALUES(?1, ?2, ?3, ?4, ?5, ?6) "
+    "ON CONFLICT(row) DO UPDATE SET flushed_at = excluded.flushed_at";
+constexpr const char* kInsertSessionMessage =
+    "INSERT INTO session_messages(session_row, reporter_id, category, type, payload, "
+    "received_at) VALUES(?1, ?2, ?3, ?4, ?5, ?6)";
+constexpr const char* kInsertSingleMessage =
+    "INSERT INTO single_messages(session_info, user_info, category, type, payload, received_at) "
+    "VALUES(?1, ?2, ?3, ?4, ?5, ?6)";
+constexpr const char* kInsertAnalyticsEvent =
+    "INSERT INTO analytics_events(name, payload, received_at) VALUES(?1, ?2, ?3)";
+constexpr const char* kInsertPowerEvent =
+    "INSERT INTO power_events(agent, name, payload, received_at) VALUES(?1, ?2, ?3, ?4)";
+
+// Several stores may be moved aside within one second (tests, a crash loop); a numbered suffix
+// keeps every one of them. Past this many the store gives up rather than search forever.
+constexpr int kMaxCorruptNameAttempts = 100;
+
+bool IsCorruption(int rc) {
+  const int primary = rc & 0xff;
+  return primary == SQLITE_NOTADB || primary == SQLITE_CORRUPT;
+}
+
+std::string SqliteError(sqlite3* db, int rc) {
+  return fmt::format("{} (SQLite code {})", db ? sqlite3_errmsg(db) : sqlite3_errstr(rc), rc);
+}
+
+std::string UtcStamp(WallTime time) {
+  const std::time_t seconds = std::chrono::system_clock::to_time_t(time);
+  std::tm parts{};
+  gmtime_r(&seconds, &parts);
+  char text[32];
+  std::strftime(text, sizeof text, "%Y%m%dT%H%M%S", &parts);
+  return text;
+}
+
+// True for a missing or empty file (SQLite makes a new database of it) and for a file that
+// begins with SQLite's 16-byte magic text.
+bool HasDatabaseHeader(const std::string& path) {
+  const int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK);
+  if (fd < 0) return true;  // missing, or not openable: SQLite reports that itself
+  struct stat info;
+  char header[16] = {};
+  bool sound = true;
+  if (::fstat(fd, &info) == 0 && S_ISREG(info.st_mode) && info.st_size > 0) {
+    sound = ::pread(fd, header, sizeof header, 0) == ssize_t(sizeof header) &&
+            std::memcmp(header, "SQLite format 3", sizeof header) == 0;
+  }
+  ::close(fd);
+  return sound;
+}
+
+bool Exists(const std::string& path) {
+  struct stat info;
+  return ::lstat(path.c_str(), &info) == 0 || errno != ENOENT;
+}
+
+// Renames without ever replacing an existing file.
+int RenameNoReplace(const std::string& from, const std::string& to) {
+  if (::renameat2(AT_FDCWD, from.c_str(), AT_FDCWD, to.c_str(), RENAME_NOREPLACE) == 0) return 0;
+  if (errno != EINVAL && errno != ENOSYS) return errno;
+  // File systems without RENAME_NOREPLACE: link() refuses to replace as well.
+  if (::link(from.c_str(), to.c_str()) != 0) return errno;
+  if (::unlink(from.c_str()) != 0) return errno;
+  return 0;
+}
+
+void BindOptionalInt(sqlite3_stmt* statement, int index, const std::optional<int64_t>& value) {
+  if (value) {
+    sqlite3_bind_int64(statement, index, *value);
+  } else {
+    sqlite3_bind_null(statement, index);
+  }
+}
+
+void BindText(sqlite3_stmt* statement, int index, const std::string& text) {
+  // The text outlives the step that reads it.
+  sqlite3_bind_text(statement, index, text.data(), static_cast<int>(text.size()), SQLITE_STATIC);
+}
+
+int Step(sqlite3_stmt* statement) {
+  const int rc = sqlite3_step(statement);
+  sqlite3_reset(statement);
+  sqlite3_clear_bindings(statement);
+  return rc == SQLITE_DONE ? SQLITE_OK : rc;
+}
+
+}  // namespace
+
+SqliteStore::SqliteStore(SqliteStoreOptions options)
+    : options_(std::move(options)),
+      path_((std::filesystem::path(options_.stateDirectory) / kFileName).string()),
+      drops_(*options_.clock, options_.log, "sqlite:" + path_) {
+  if (Open()) {
+    TLOG_INFO(options_.log, "store {} open (WAL, {} sessions so far)", path_, lastSessionRow_);
+  }
+  // The writer runs even when the store is down: it answers flushes from its own thread.
+  writer_ = std::thread([this] { WriterLoop(); });
+}
+
+SqliteStore::~SqliteStore() { Shutdown(); }
+
+std::string SqliteStore::Name() const { return "sqlite:" + path_; }
+
+bool SqliteStore::IsUp() const { return state_.load(std::memory_order_acquire) == State::kUp; }
+
+std::string SqliteStore::DownReason() const {
+  std::lock_guard lock(mutex_);
+  return downReason_;
+}
+
+void SqliteStore::Fail(std::string reason) {
+  TLOG_ERROR(options_.log, "store {} is not up, records will be dropped: {}", path_, reason);
+  std::lock_guard lock(mutex_);
+  downReason_ = std::move(reason);
+  state_.store(State::kFailed, std::memory_order_release);
+}
+
+bool SqliteStore::Open() {
+  std::error_code error;
+  std::filesystem::create_directories(options_.stateDirectory, error);
+  if (error) {
+    Fail(fmt::format("cannot create state directory {}: {}", options_.stateDirectory,
+                     error.message()));
+    return false;
+  }
+  std::string reason;
+  int rc = OpenDatabase(&reason);
+  if (IsCorruption(rc)) {
+    CloseDatabase();
+    std::string movedTo;
+    if (!MoveCorruptFilesAside(&movedTo)) return false;
+    TLOG_ERROR(options_.log,
+               "store {} is not a database or is corrupt ({}); moved it to {} and started a "
+               "fresh store",
+               path_, reason, movedTo);
+    rc = OpenDatabase(&reason);
+  }
+  if (rc != SQLITE_OK) {
+    CloseDatabase();
+    Fail(fmt::format("cannot open {}: {}", path_, reason));
+    return false;
+  }
+  return true;
+}
+
+int SqliteStore::OpenDatabase(std::string* reason) {
+  // SQLite deletes the -wal of a database it closes; a file that is no database is therefore
+  // recognised by its header before SQLite opens it, so its -wal stays as it is.
+  if (!HasDatabaseHeader(path_)) {
+    *reason = "the file does not begin with the SQLite header";
+    return SQLITE_NOTADB;
+  }
+  int rc =
+      sqlite3_open_v2(path_.c_str(), &db_, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE, nullptr);
+  const auto failed = [&](int code) {
+    *reason = SqliteError(db_, code);
+    return code;
+  };
+  if (rc != SQLITE_OK) return failed(rc);
+  // Until the file has proved sound, closing must not checkpoint into it (or delete its -wal).
+  sqlite3_db_config(db_, SQLITE_DBCONFIG_NO_CKPT_ON_CLOSE, 1, nullptr);
+  sqlite3_extended_result_codes(db_, 1);
+  sqlite3_busy_timeout(db_, static_cast<int>(options_.busyTimeout.count()));
+
+  // The first statement reads the file header: a file that is no database fails here.
+  sqlite3_stmt* statement = nullptr;
+  rc = sqlite3_prepare_v2(db_, "PRAGMA journal_mode=WAL", -1, &statement, nullptr);
+  if (rc != SQLITE_OK) return failed(rc);
+  rc = sqlite3_step(statement);
+  std::string mode;
+  if (rc == SQLITE_ROW) {
+    mode = reinterpret_cast<const char*>(sqlite3_column_text(statement, 0));
+    rc = SQLITE_OK;
+  }
+  sqlite3_finalize(statement);
+  if (rc != SQLITE_OK) return failed(rc);
+  if (mode != "wal") {
+    TLOG_ERROR(options_.log, "store {}: WAL mode refused, journal mode is {}", path_, mode);
+  }
+
+  std::string pragmas = "PRAGMA synchronous=NORMAL;";
+  if (options_.maxPageCount > 0) {
+    pragmas += fmt::format("PRAGMA max_page_count={};", options_.maxPageCount);
+  }
+  rc = sqlite3_exec(db_, pragmas.c_str(), nullptr, nullptr, nullptr);
+  if (rc != SQLITE_OK) return failed(rc);
+  rc = sqlite3_exec(db_, kSchema, nullptr, nullptr, nullptr);
+  if (rc != SQLITE_OK) return failed(rc);
+
+  rc = sqlite3_prepare_v2(db_, "SELECT COALESCE(MAX(row), 0) FROM sessions", -1, &statement,
+                          nullptr);
+  if (rc != SQLITE_OK) return failed(rc);
+  rc = sqlite3_step(statement);
+  if (rc == SQLITE_ROW) {
+    lastSessionRow_ = sqlite3_column_int64(statement, 0);
+    rc = SQLITE_OK;
+  }
+  sqlite3_finalize(statement);
+  if (rc != SQLITE_OK) return failed(rc);
+
+  const std::pair<const char*, sqlite3_stmt**> statements[] = {
+      {kInsertSession, &insertSession_},
+      {kInsertSessionMessage, &insertSessionMessage_},
+      {kInsertSingleMessage, &insertSingleMessage_},
+      {kInsertAnalyticsEvent, &insertAnalyticsEvent_},
+      {kInsertPowerEvent, &insertPowerEvent_},
+  };
+  for (const auto& [sql, target] : statements) {
+    rc = sqlite3_prepare_v3(db_, sql, -1, SQLITE_PREPARE_PERSISTENT, target, nullptr);
+    if (rc != SQLITE_OK) return failed(rc);
+  }
+  sqlite3_db_config(db_, SQLITE_DBCONFIG_NO_CKPT_ON_CLOSE, 0, nullptr);
+  return SQLITE_OK;
+}
+
+void SqliteStore::CloseDatabase() {
+  for (sqlite3_stmt** statement : {&insertSession_, &insertSessionMessage_, &insertSingleMessage_,
+                                   &insertAnalyticsEvent_, &insertPowerEvent_}) {
+    sqlite3_finalize(*statement);
+    *statement = nullptr;
+  }
+  sqlite3_close_v2(db_);
+  db_ = nullptr;
+}
+
+bool SqliteStore::MoveCorruptFilesAside(std::string* movedTo) {
+  const std::string stamp = UtcStamp(options_.clock->WallNow());
+  const char* suffixes[] = {"", "-wal", "-shm"};
+  std::string base;
+  for (int attempt = 0; attempt < kMaxCorruptNameAttempts && base.empty(); ++attempt) {
+    const std::string candidate = attempt == 0
+                                      ? fmt::format("{}.corrupt-{}", path_, stamp)
+                                      : fmt::format("{}.corrupt-{}.{}", path_, stamp, attempt);
+    bool taken = false;
+    for (const char* suffix : suffixes) taken = taken || Exists(candidate + suffix);
+    if (!taken) base = candidate;
+  }
+  if (base.empty()) {
+    Fail(fmt::format("{} is corrupt and no free name to move it to was found", path_));
+    return false;
+  }
+  // The main file first; its -wal must never stay beside a fresh database, which would replay it.
+  for (const char* suffix : suffixes) {
+    const std::string from = path_ + suffix;
+    if (!Exists(from)) continue;
+    if (const int error = RenameNoReplace(from, base + suffix); error != 0) {
+      Fail(fmt::format("{} is corrupt and could not be moved to {}: {}", from, base + suffix,
+                       std::strerror(error)));
+      return false;
+    }
+  }
+  *movedTo = base;
+  return true;
+}
+
+bool SqliteStore::Append(ReportRecordPtr record) {
+  const State state = state_.load(std::memory_order_acquire);
+  if (state == State::kFailed || state == State::kClosed) {
+    drops_.Dropped(1, state == State::kClosed ? "the store is shut down" : "the store is not up");
+    return false;
+  }
+  bool stopping = false;
+  {
+    std::lock_guard lock(mutex_);
+    stopping = stopping_;
+    if (!stopping && queue_.size() < options_.queueCapacity) {
+      queue_.push_back(Queued{++acceptedSeq_, std::move(record)});
+      queued_.store(queue_.size(), std::memory_order_relaxed);
+      accepted_.fetch_add(1, std::memory_order_relaxed);
+      wakeup_.notify_one();
+      return true;
+    }
+  }
+  // Counted outside the lock: the drop line must not hold up the writer.
+  if (stopping) {
+    drops_.Dropped(1, "the store is shut down");
+  } else {
+    drops_.Dropped(1,
+                   fmt::format("the store's queue is full ({} records)", options_.queueCapacity));
+  }
+  return false;
+}
+
+void SqliteStore::Flush(FlushCallback done) {
+  std::unique_lock lock(mutex_);
+  if (stopping_) {
+    // No writer thread is left to answer from.
+    lock.unlock();
+    if (done) done(Error{kGeneralErrorDomain, -1, fmt::format("store {} is shut down", path_)});
+    return;
+  }
+  waiters_.push_back(Waiter{acceptedSeq_, std::move(done)});
+  wakeup_.notify_one();
+}
+
+BackendStats SqliteStore::Stats() const {
+  return BackendStats{accepted_.load(std::memory_order_relaxed),
+                      committed_.load(std::memory_order_relaxed), drops_.Total()};
+}
+
+void SqliteStore::Shutdown() {
+  std::lock_guard shutdownLock(shutdownMutex_);
+  {
+    std::lock_guard lock(mutex_);
+    if (stopping_) return;
+    stopping_ = true;
+    wakeup_.notify_one();
+  }
+  if (writer_.joinable()) writer_.join();
+  CloseDatabase();
+  const State previous = state_.exchange(State::kClosed, std::memory_order_acq_rel);
+  if (previous != State::kFailed) {
+    TLOG_INFO(options_.log, "store {} closed: {} records committed, {} dropped", path_,
+              committed_.load(), drops_.Total());
+  }
+}
+
+void SqliteStore::WriterLoop() {
+  pthread_setname_np(pthread_self(), "tavrin-store");
+  std::deque<Queued> batch;
+  for (;;) {
+    bool finished = false;
+    {
+      std::unique_lock lock(mutex_);
+      const auto hasWork = [this] { return !queue_.empty() || !waiters_.empty() || stopping_; };
+      wakeup_.wait(lock, hasWork);
+      if (!queue_.empty()) {
+        const auto deadline = std::chrono::steady_clock::now() + kMaxBatchDelay;
+        for (;;) {
+          while (!queue_.empty() && batch.size() < kMaxBatchRecords) {
+            batch.push_back(std::move(queue_.front()));
+            queue_.pop_front();
+          }
+          queued_.store(queue_.size(), std::memory_order_relaxed);
+          // Whoever waits for a flush or the shutdown waits for this batch: commit it now.
+          if (batch.size() >= kMaxBatchRecords || stopping_ || !waiters_.empty()) break;
+          if (!wakeup_.wait_until(lock, deadline, hasWork)) break;
+        }
+      } else {
+        finished = stopping_ && waiters_.empty();
+      }
+    }
+    if (finished) return;
+    if (!batch.empty()) WriteBatch(batch);
+    AnswerFlushes();
+  }
+}
+
+void SqliteStore::WriteBatch(std::deque<Queued>& batch) {
+  const uint64_t lastSeq = batch.back().seq;
+  const size_t count = batch.size();
+  int rc = db_ ? sqlite3_exec(db_, "BEGIN IMMEDIATE", nullptr, nullptr, nullptr) : SQLITE_MISUSE;
+  if (rc == SQLITE_OK) {
+    for (const Queued& queued : batch) {
+      rc = WriteRecord(*queued.record);
+      if (rc != SQLITE_OK) break;
+    }
+    if (rc == SQLITE_OK) rc = sqlite3_exec(db_, "COMMIT", nullptr, nullptr, nullptr);
+  }
+  batch.clear();
+  if (rc == SQLITE_OK) {
+    committed_.fetch_add(count, std::memory_order_relaxed);
+    State expected = State::kWriteFailing;
+    if (state_.compare_exchange_strong(expected, State::kUp, std::memory_order_acq_rel)) {
+      TLOG_ERROR(options_.log, "store {} is written again ({} records dropped in all)", path_,
+                 drops_.Total());
+      std::lock_guard lock(mutex_);
+      downReason_.clear();
+    }
+  } else {
+    const std::string reason = SqliteError(db_, rc);
+    if (db_ && !sqlite3_get_autocommit(db_)) {
+      sqlite3_exec(db_, "ROLLBACK", nullptr, nullptr, nullptr);
+    }
+    SetWriteFailing(reason);
+    drops_.Dropped(count, fmt::format("writing to the store failed: {}", reason));
+  }
+  std::lock_guard lock(mutex_);
+  processedSeq_ = lastSeq;
+}
+
+int SqliteStore::WriteRecord(const ReportRecord& record) {
+  if (const auto* r = std::get_if<SessionMessageRecord>(&record)) {
+    const std::string payload = JsonText(r->payload);
+    sqlite3_bind_int64(insertSessionMessage_, 1, r->sessionRow);
+    BindOptionalInt(insertSessionMessage_, 2, r->reporterId);
+    sqlite3_bind_int(insertSessionMessage_, 3, r->category);
+    sqlite3_bind_int(insertSessionMessage_, 4, r->type);
+    BindText(insertSessionMessage_, 5, payload);
+    sqlite3_bind_double(insertSessionMessage_, 6, r->receivedAt);
+    return Step(insertSessionMessage_);
+  }
+  if (const auto* r = std::get_if<SessionRecord>(&record)) {
+    const std::string sessionInfo = JsonText(r->sessionInfo);
+    const std::string userInfo = JsonText(r->userInfo);
+    sqlite3_bind_int64(insertSession_, 1, r->row);
+    BindOptionalInt(insertSession_, 2, r->reporterId);
+    BindText(insertSession_, 3, sessionInfo);
+    BindText(insertSession_, 4, userInfo);
+    sqlite3_bind_double(insertSession_, 5, r->createdAt);
+    if (r->flushedAt) {
+      sqlite3_bind_double(insertSession_, 6, *r->flushedAt);
+    } else {
+      sqlite3_bind_null(insertSession_, 6);
+    }
+    return Step(insertSession_);
+  }
+  if (const auto* r = std::get_if<SingleMessageRecord>(&record)) {
+    const std::string sessionInfo = JsonText(r->sessionInfo);
+    const std::string userInfo = JsonText(r->userInfo);
+    const std::string payload = JsonText(r->payload);
+    BindText(insertSingleMessage_, 1, sessionInfo);
+    BindText(insertSingleMessage_, 2, userInfo);
+    sqlite3_bind_int(insertSingleMessage_, 3, r->category);
+    sqlite3_bind_int(insertSingleMessage_, 4, r->type);
+    BindText(insertSingleMessage_, 5, payload);
+    sqlite3_bind_double(insertSingleMessage_, 6, r->receivedAt);
+    return Step(insertSingleMessage_);
+  }
+  if (const auto* r = std::get_if<AnalyticsEventRecord>(&record)) {
+    const std::string payload = JsonText(r->payload);
+    BindText(insertAnalyticsEvent_, 1, r->name);
+    BindText(insertAnalyticsEvent_, 2, payload);
+    sqlite3_bind_double(insertAnalyticsEvent_, 3, r->receivedAt);
+    return Step(insertAnalyticsEvent_);
+  }
+  const auto& r = std::get<PowerEventRecord>(record);
+  const std::string payload = JsonText(r.payload);
+  sqlite3_bind_int(insertPowerEvent_, 1, r.agent);
+  BindText(insertPowerEvent_, 2, r.name);
+  BindText(insertPowerEvent_, 3, payload);
+  sqlite3_bind_double(insertPowerEvent_, 4, r.receivedAt);
+  return Step(insertPowerEvent_);
+}
+
+void SqliteStore::SetWriteFailing(const std::string& reason) {
+  State expected = State::kUp;
+  if (!state_.compare_exchange_strong(expected, State::kWriteFailing, std::memory_order_acq_rel)) {
+    return;
+  }
+  TLOG_ERROR(options_.log,
+             "store {} is not up, records are dropped until a write succeeds again: {}", path_,
+             reason);
+  std::lock_guard lock(mutex_);
+  downReason_ = reason;
+}
+
+void SqliteStore::AnswerFlushes() {
+  std::vector<std::pair<FlushCallback, OptionalError>> ready;
+  {
+    std::lock_guard lock(mutex_);
+    const bool failed = state_.load(std::memory_order_acquire) == State::kFailed;
+    // Every flush answered now covers the records lost since the previous answer.
+    const uint64_t lostNow = drops_.Total();
+    const uint64_t lost = lostNow - lostReported_;
+    while (!waiters_.empty() && waiters_.front().target <= processedSeq_) {
+      Waiter& waiter = waiters_.front();
+      OptionalError error;
+      lostReported_ = lostNow;
+      if (failed) {
+        error = Error{kGeneralErrorDomain, -1,
+                      fmt::format("store {} is not up: {}", path_, downReason_)};
+      } else if (lost > 0) {
+        error = Error{kGeneralErrorDomain, -1,
+                      fmt::format("store {} dropped {} record(s) since the previous flush answer",
+                                  path_, lost)};
+      }
+      ready.emplace_back(std::move(waiter.done), std::move(error));
+      waiters_.pop_front();
+    }
+  }
+  for (auto& [done, error] : ready) {
+    if (done) done(error);
+  }
+}
+
+}  // namespace tavrin
