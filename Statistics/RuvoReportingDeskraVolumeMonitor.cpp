@@ -8,8 +8,8 @@ std::unique_ptr<RuvoReportingDeskraVolumeMonitor> RuvoReportingDeskraVolumeMonit
 
 void RuvoReportingDeskraVolumeMonitor::addSession(const std::shared_ptr<RuvoReportingSession>&) {}
 
-void RuvoReportingDeskraVolumeMonitor::removeSession(
-    const std::shared_ptr<RuvoReportingSession>&) {}
+void RuvoReportingDeskraVolumeMonitor::removeSession(const std::shared_ptr<RuvoReportingSession>&) {
+}
 
 void RuvoReportingDeskraVolumeMonitor::stop() {}
 

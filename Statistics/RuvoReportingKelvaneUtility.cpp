@@ -2,9 +2,9 @@
 
 #include "Statistics/RuvoReportingUtility.h"
 #include "Statistics/Service/RuvoReportingSession.h"
+#include "platform/LogSystem.h"
 #include "platform/Platform.h"
 #include "platform/PowerEventLog.h"
-#include "platform/LogSystem.h"
 
 namespace tavrin {
 

@@ -7,9 +7,9 @@
 #include <string>
 #include <string_view>
 
+#include "base/Dictionary.h"
 #include "platform/Condition.h"
 #include "platform/DeviceInfoQuery.h"
-#include "base/Dictionary.h"
 #include "platform/LogSystem.h"
 
 namespace tavrin {

@@ -27,9 +27,9 @@ class DriverStatsService {
  public:
   virtual ~DriverStatsService() = default;
   // The channels whose group and subgroup equal the names given; an absent name matches any.
-  virtual std::optional<DriverChannels> CopyChannelsInGroup(const std::optional<std::string>& group,
-                                                            const std::optional<std::string>& subgroup,
-                                                            uint64_t options, OptionalError* error) = 0;
+  virtual std::optional<DriverChannels> CopyChannelsInGroup(
+      const std::optional<std::string>& group, const std::optional<std::string>& subgroup,
+      uint64_t options, OptionalError* error) = 0;
   virtual int32_t ChannelCount(const DriverChannels& channels) = 0;
   // Subscribes to `channels`; fills *subscribed with the channels actually subscribed.
   virtual DriverSubscription CreateSubscription(const DriverChannels& channels,

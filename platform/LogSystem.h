@@ -87,14 +87,14 @@ void Write(LogScope& scope, LogLevel level, std::string_view file, int line,
 // Writes one line with the "file:line:function: " prefix to `target` (a LogHandle, which may be
 // null for the default log, or a LogScope&). The format uses fmt's "{}" placeholders; a Value
 // prints in its text form. Nothing is formatted when the scope filters the level out.
-#define TAVRIN_LOG(target, level, format, ...)                                                   \
-  do {                                                                                           \
-    ::tavrin::LogScope& tavrin_log_scope_ = ::tavrin::LogTarget(target);                         \
-    if (tavrin_log_scope_.ShouldLog(level)) {                                                    \
-      ::tavrin::log_detail::Write(tavrin_log_scope_, level,                                      \
+#define TAVRIN_LOG(target, level, format, ...)                                                  \
+  do {                                                                                          \
+    ::tavrin::LogScope& tavrin_log_scope_ = ::tavrin::LogTarget(target);                        \
+    if (tavrin_log_scope_.ShouldLog(level)) {                                                   \
+      ::tavrin::log_detail::Write(tavrin_log_scope_, level,                                     \
                                   ::tavrin::log_detail::BaseName(__FILE__), __LINE__, __func__, \
-                                  format __VA_OPT__(, ) __VA_ARGS__);                            \
-    }                                                                                            \
+                                  format __VA_OPT__(, ) __VA_ARGS__);                           \
+    }                                                                                           \
   } while (0)
 
 #define TLOG_DEBUG(target, format, ...) \

@@ -57,9 +57,9 @@ class TelvoroService {
  public:
   virtual ~TelvoroService() = default;
   virtual TelvoroTokenPtr NewSecureHierarchyToken(const TelvoroTokenPtr& parent) = 0;
-  virtual TelvoroSessionPtr CreateTelvoroSession(const Dictionary& sessionInfo,
-                                                 const Dictionary& userInfo,
-                                                 const std::vector<std::string>& frameworksToCheck) = 0;
+  virtual TelvoroSessionPtr CreateTelvoroSession(
+      const Dictionary& sessionInfo, const Dictionary& userInfo,
+      const std::vector<std::string>& frameworksToCheck) = 0;
   // Sends one message without a session. Never blocks on I/O.
   virtual bool SendOneMessage(const Dictionary& sessionInfo, const Dictionary& userInfo,
                               uint16_t category, uint16_t type, const Dictionary& payload,

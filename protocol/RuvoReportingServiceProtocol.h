@@ -23,21 +23,21 @@ class RuvoReportingServiceProtocol {
 
   virtual ~RuvoReportingServiceProtocol() = default;
 
-  virtual void createReportingSession(int64_t reporterID, BoolReply reply) = 0;                 // 1
-  virtual void setServiceType(uint16_t serviceType, int64_t reporterID, BoolReply reply) = 0;   // 2
-  virtual void getServiceNameForReporterID(int64_t reporterID, ServiceTypeReply reply) = 0;     // 3
+  virtual void createReportingSession(int64_t reporterID, BoolReply reply) = 0;                // 1
+  virtual void setServiceType(uint16_t serviceType, int64_t reporterID, BoolReply reply) = 0;  // 2
+  virtual void getServiceNameForReporterID(int64_t reporterID, ServiceTypeReply reply) = 0;    // 3
   virtual void setConfiguration(const Dictionary& configuration, int64_t reporterID,
-                                BoolReply reply) = 0;                                           // 4
-  virtual void startReportingSessionForID(int64_t reporterID, BoolReply reply) = 0;             // 5
+                                BoolReply reply) = 0;                                // 4
+  virtual void startReportingSessionForID(int64_t reporterID, BoolReply reply) = 0;  // 5
   // `reporterIDs` absent means every running session.
   virtual void sendMessage(const Dictionary& message, uint32_t category, uint16_t type,
                            const std::optional<std::vector<int64_t>>& reporterIDs,
-                           ErrorReply reply) = 0;                                               // 6
-  virtual void stopReportingSessionForID(int64_t reporterID, BoolReply reply) = 0;              // 7
-  virtual void destroyReportingSession(int64_t reporterID, BoolReply reply) = 0;                // 8
-  virtual void reporterID(int64_t reporterID, DictionaryReply valid) = 0;                       // 9
-  virtual void getAllReporters(ReportersReply reply) = 0;                                       // 10
-  virtual void killService(BoolReply reply) = 0;                                                // 11
+                           ErrorReply reply) = 0;                                   // 6
+  virtual void stopReportingSessionForID(int64_t reporterID, BoolReply reply) = 0;  // 7
+  virtual void destroyReportingSession(int64_t reporterID, BoolReply reply) = 0;    // 8
+  virtual void reporterID(int64_t reporterID, DictionaryReply valid) = 0;           // 9
+  virtual void getAllReporters(ReportersReply reply) = 0;                           // 10
+  virtual void killService(BoolReply reply) = 0;                                    // 11
 };
 
 }  // namespace tavrin

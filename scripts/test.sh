@@ -29,6 +29,11 @@ run_build() {
   ctest --test-dir "$dir" --output-on-failure --timeout 600 -j "$(nproc)"
 }
 
+# Formatting is checked before anything is built: clang-format with the repo's .clang-format, on
+# every tracked C and C++ source.
+echo "== format check"
+git ls-files -z '*.c' '*.cc' '*.cpp' '*.h' '*.hpp' | xargs -0 clang-format --dry-run --Werror
+
 builds=("$@")
 [ ${#builds[@]} -gt 0 ] || builds=(release asan tsan)
 for build in "${builds[@]}"; do

@@ -16,8 +16,8 @@
 #include <thread>
 #include <vector>
 
-#include "platform/Clock.h"
 #include "base/Dictionary.h"
+#include "platform/Clock.h"
 
 namespace tavrin {
 

@@ -12,12 +12,12 @@
 
 #include "Statistics/RuvoReportingDriverUtility.h"
 #include "Statistics/Service/RuvoReportingSession.h"
-#include "platform/Clock.h"
 #include "base/Dictionary.h"
+#include "platform/Clock.h"
+#include "platform/Dispatcher.h"
+#include "platform/LogSystem.h"
 #include "platform/Platform.h"
 #include "platform/ServiceListener.h"
-#include "platform/LogSystem.h"
-#include "platform/Dispatcher.h"
 #include "protocol/RuvoReportingServiceProtocol.h"
 
 namespace tavrin {

@@ -9,14 +9,14 @@
 #include <string>
 #include <vector>
 
-#include "platform/Clock.h"
 #include "base/Dictionary.h"
 #include "base/Error.h"
+#include "platform/Clock.h"
+#include "platform/Dispatcher.h"
+#include "platform/LogSystem.h"
 #include "platform/OrientationRegistry.h"
 #include "platform/Platform.h"
-#include "platform/LogSystem.h"
 #include "platform/TelvoroSession.h"
-#include "platform/Dispatcher.h"
 
 namespace tavrin {
 

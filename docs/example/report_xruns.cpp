@@ -32,7 +32,8 @@ int main(int argc, char** argv) {
   constexpr uint16_t kType = 1;
   for (int period = 0; period < 3; ++period) {
     // Fire-and-forget: returns once the message is on its way.
-    if (auto sent = session.send({{"xruns", period}, {"period", period}}, kCategory, kType); !sent) {
+    if (auto sent = session.send({{"xruns", period}, {"period", period}}, kCategory, kType);
+        !sent) {
       std::fprintf(stderr, "report_xruns: %s\n", sent.error().message.c_str());
       return 1;
     }

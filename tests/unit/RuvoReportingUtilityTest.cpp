@@ -14,10 +14,10 @@
 #include <vector>
 
 #include "platform/Platform.h"
+#include "platform/linux/dispatch/StdCondition.h"
 #include "tests/fakes/FakeCondition.h"
 #include "tests/fakes/FakeDeviceInfoQuery.h"
 #include "tests/fakes/FakeLogSystem.h"
-#include "platform/linux/dispatch/StdCondition.h"
 
 namespace tavrin {
 namespace {

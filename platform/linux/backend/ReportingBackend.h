@@ -13,9 +13,9 @@
 #include <string_view>
 #include <variant>
 
-#include "platform/Clock.h"
 #include "base/Dictionary.h"
 #include "base/Error.h"
+#include "platform/Clock.h"
 #include "platform/LogSystem.h"
 
 namespace tavrin {

@@ -18,8 +18,7 @@ class StdCondition final : public Condition {
     // Signals are counted so that a spurious wake-up is not mistaken for a signal.
     const uint64_t seen = signals_;
     std::unique_lock lock(mutex_, std::adopt_lock);
-    const bool signalled =
-        condition_.wait_until(lock, deadline, [&] { return signals_ != seen; });
+    const bool signalled = condition_.wait_until(lock, deadline, [&] { return signals_ != seen; });
     lock.release();
     return signalled;
   }

@@ -10,8 +10,8 @@
 #include <string_view>
 #include <thread>
 
-#include "platform/OrientationRegistry.h"
 #include "platform/LogSystem.h"
+#include "platform/OrientationRegistry.h"
 #include "platform/linux/orientation/OrientationCallbacks.h"
 
 namespace sdbus {

@@ -8,8 +8,8 @@
 #include <string>
 #include <thread>
 
-#include "platform/OrientationRegistry.h"
 #include "platform/LogSystem.h"
+#include "platform/OrientationRegistry.h"
 
 namespace tavrin {
 

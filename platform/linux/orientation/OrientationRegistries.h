@@ -3,8 +3,8 @@
 #include <memory>
 #include <string>
 
-#include "platform/OrientationRegistry.h"
 #include "platform/LogSystem.h"
+#include "platform/OrientationRegistry.h"
 
 namespace tavrin {
 

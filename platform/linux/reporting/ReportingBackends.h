@@ -19,9 +19,9 @@
 
 #include "platform/AnalyticsSink.h"
 #include "platform/Clock.h"
-#include "platform/RandomSource.h"
-#include "platform/PowerEventLog.h"
 #include "platform/LogSystem.h"
+#include "platform/PowerEventLog.h"
+#include "platform/RandomSource.h"
 #include "platform/TelvoroSession.h"
 #include "platform/linux/backend/ReportingBackend.h"
 #include "platform/linux/time/SystemClock.h"

@@ -4,8 +4,8 @@
 #include <memory>
 #include <string>
 
-#include "platform/NotificationCenter.h"
 #include "base/Error.h"
+#include "platform/NotificationCenter.h"
 
 namespace asio {
 class io_context;

@@ -4,8 +4,8 @@
 #include <optional>
 #include <string>
 
-#include "platform/DefaultsDomain.h"
 #include "base/Dictionary.h"
+#include "platform/DefaultsDomain.h"
 
 namespace tavrin {
 

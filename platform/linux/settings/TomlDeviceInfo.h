@@ -5,8 +5,8 @@
 #include <set>
 #include <string>
 
-#include "platform/DeviceInfoQuery.h"
 #include "base/Dictionary.h"
+#include "platform/DeviceInfoQuery.h"
 
 namespace tavrin {
 

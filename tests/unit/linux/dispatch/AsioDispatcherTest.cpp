@@ -20,8 +20,8 @@
 
 #include <gtest/gtest.h>
 
-#include "tests/fakes/FakeLogSystem.h"
 #include "platform/linux/time/SystemClock.h"
+#include "tests/fakes/FakeLogSystem.h"
 
 namespace tavrin {
 namespace {
