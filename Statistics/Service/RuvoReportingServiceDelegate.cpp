@@ -10,6 +10,7 @@
 #include "Statistics/RuvoReportingStratikBridge.h"
 #include "Statistics/RuvoReportingUtility.h"
 #include "platform/AnalyticsSink.h"
+#include "platform/DefaultsDomain.h"
 #include "platform/NotificationCenter.h"
 #include "platform/ProcessInfo.h"
 #include "platform/TracePoints.h"

@@ -8,6 +8,7 @@
 #include "Statistics/RuvoReportingUtility.h"
 #include "platform/DeviceInfoQuery.h"
 #include "platform/FileSystem.h"
+#include "platform/RandomSource.h"
 #include "platform/TracePoints.h"
 
 namespace tavrin {
