@@ -308,11 +308,12 @@ std::vector<uint8_t> EncodeNilReply(uint64_t call) {
   return EncodeReply(call, Status::kOk, nullptr);
 }
 
-std::vector<uint8_t> EncodeOperationErrorReply(uint64_t call, std::string_view domain,
-                                               int64_t code) {
+std::vector<uint8_t> EncodeOperationErrorReply(uint64_t call, std::string_view domain, int64_t code,
+                                               std::string_view reason) {
   Value error = Value::object();
   error["domain"] = domain;
   error["code"] = code;
+  if (!reason.empty()) error["reason"] = reason;
   return EncodeReply(call, Status::kOperationError, std::move(error));
 }
 

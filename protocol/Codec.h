@@ -35,6 +35,9 @@ inline constexpr std::string_view kProtocolErrorDomain = "com.quorvex.tavrin.pro
 // The message path's own error domain, and its one code: reporting is disabled by the defaults.
 inline constexpr std::string_view kReportingErrorDomain = "com.quorvex.audio.reporting";
 inline constexpr int64_t kReportingDisabledCode = 1;
+// Refusals of a peer that may not make the request; code 1: not allowed to stop the service.
+inline constexpr std::string_view kAccessErrorDomain = "com.quorvex.tavrin.access";
+inline constexpr int64_t kKillNotAllowedCode = 1;
 
 // Codes of status 2 replies.
 enum class RejectCode : int64_t {
@@ -156,9 +159,10 @@ std::vector<uint8_t> EncodeServiceTypeReply(uint64_t call, uint16_t serviceType)
 std::vector<uint8_t> EncodeDictionaryReply(uint64_t call, const Dictionary& value);
 std::vector<uint8_t> EncodeReportersReply(uint64_t call, std::span<const int64_t> reporterIDs);
 std::vector<uint8_t> EncodeNilReply(uint64_t call);
-// Status 1 {"domain", "code"}; the error's description does not travel.
-std::vector<uint8_t> EncodeOperationErrorReply(uint64_t call, std::string_view domain,
-                                               int64_t code);
+// Status 1 {"domain", "code"}, and "reason" when one is given; the error's description does not
+// travel.
+std::vector<uint8_t> EncodeOperationErrorReply(uint64_t call, std::string_view domain, int64_t code,
+                                               std::string_view reason = {});
 // Status 2 {"domain": kProtocolErrorDomain, "code", "reason"}.
 std::vector<uint8_t> EncodeRejectReply(uint64_t call, RejectCode code, std::string_view reason);
 // The status 2 reply for a rejected request, or nothing when there is none to send (the request

@@ -17,7 +17,9 @@ namespace {
 constexpr const char* kSummaryEventKey = "Ruvo_Session_Summary_Event";
 constexpr const char* kHostApplicationKey = "HostApplicationDisplayID";
 constexpr const char* kSummaryDirectory = "/Audio/Reporting";
-constexpr unsigned kSummaryDirectoryMode = 0777;
+// Never world-writable: on a shared machine that would let any local user forge or delete
+// summaries. The service's group may read them.
+constexpr unsigned kSummaryDirectoryMode = 0750;
 // Indentation of the summary file: readable by a person, parsed by tools.
 constexpr int kSummaryJsonIndent = 2;
 constexpr const char* kOrientationIDFormat = "RuvoReportingService {}";

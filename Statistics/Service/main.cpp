@@ -1,8 +1,11 @@
 // Entry point of tavrind: builds the Linux platform services, creates the one listener delegate
 // and runs the listener until SIGTERM or SIGINT, which flush the store and exit 0.
 
+#include <sys/stat.h>
+
 #include <chrono>
 #include <csignal>
+#include <cstdint>
 #include <cstdio>
 #include <filesystem>
 #include <memory>
@@ -44,7 +47,7 @@ constexpr std::chrono::seconds kShutdownDrainLimit{10};
 struct Options {
   std::string root;
   std::string socket = "/run/tavrin/reporting.sock";
-  std::string socketMode = "0666";
+  std::string socketMode = "0660";
   std::string defaults = "/etc/tavrin/com.quorvex.tavrin.toml";
   std::string deviceInfo = "/etc/tavrin/device.toml";
   std::string stateDir = "/var/lib/tavrin";
@@ -75,6 +78,29 @@ void ApplyRoot(Options& options, const CLI::App& app) {
   }
 }
 
+// The extra uids whose killService is honoured: the integers of "limits.kill_uids". Anything else
+// there is an error line naming the key and what it should hold, and is ignored.
+std::vector<uint32_t> KillUids(const tavrin::Dictionary& defaults) {
+  std::vector<uint32_t> uids;
+  auto limits = defaults.find("limits");
+  if (limits == defaults.end() || !limits->is_object()) return uids;
+  auto list = limits->find("kill_uids");
+  if (list == limits->end()) return uids;
+  if (!list->is_array()) {
+    TLOG_ERROR(nullptr, "limits.kill_uids: expected an array of uids, got {}", list->type_name());
+    return uids;
+  }
+  for (const auto& uid : *list) {
+    if (uid.is_number_integer() && uid.get<int64_t>() >= 0 && uid.get<int64_t>() <= UINT32_MAX) {
+      uids.push_back(uid.get<uint32_t>());
+    } else {
+      TLOG_ERROR(nullptr, "limits.kill_uids: expected uids (integers 0..{}), got {}", UINT32_MAX,
+                 tavrin::JsonText(uid));
+    }
+  }
+  return uids;
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -98,6 +124,9 @@ int main(int argc, char** argv) {
   app.add_option("--log-target", options.logTarget, "stderr or journal")
       ->check(CLI::IsMember({"stderr", "journal"}));
   CLI11_PARSE(app, argc, argv);
+  // Whatever the service creates (store, WAL, directories, summary files) is readable by its group
+  // at most and writable by nobody else.
+  ::umask(027);
   ApplyRoot(options, app);
 
   unsigned socketMode = 0;
@@ -152,6 +181,7 @@ int main(int argc, char** argv) {
   BackendReportingService reporting(CreateBackends(*choices, environment), SystemClock(),
                                     SystemRandom());
   reporting.ApplyDefaults(defaults.Read());
+  listener.SetKillUids(KillUids(defaults.Read()));
 
   PlatformServices services;
   services.dispatcher = &dispatcher;
@@ -174,7 +204,9 @@ int main(int argc, char** argv) {
   notifications.RegisterNotificationHandler(kDefaultsNotificationName, &refreshToken,
                                             dispatcher.BackgroundQueue(), [&](int) {
                                               logSystem.Refresh();
-                                              reporting.ApplyDefaults(defaults.Read());
+                                              const Dictionary settings = defaults.Read();
+                                              reporting.ApplyDefaults(settings);
+                                              listener.SetKillUids(KillUids(settings));
                                             });
 
   auto delegate = RuvoReportingServiceDelegate::init(services);

@@ -161,7 +161,8 @@ TEST(ProtocolE2eTest, DriverStatisticsAtStopAndTheSummaryFileOfAnInternalBuild) 
   EXPECT_EQ(summary[1].begin().key(), "Generic_Generic_1");
   const auto mode =
       std::filesystem::status(root + "/log/DiagnosticLogs/Audio/Reporting").permissions();
-  EXPECT_EQ(mode & std::filesystem::perms::all, std::filesystem::perms::all);
+  // Never world-writable, so no other local user can forge or delete summaries.
+  EXPECT_EQ(mode & std::filesystem::perms::all, std::filesystem::perms(0750));
 }
 
 }  // namespace

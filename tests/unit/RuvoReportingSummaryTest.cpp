@@ -113,7 +113,7 @@ TEST_F(SummaryTest, TheFileHoldsTheUserInfoFirstThenEveryMessageById) {
   const auto creates = platform.fileSystem.CreateDirectoriesCalls();
   ASSERT_EQ(creates.size(), 1u);
   EXPECT_EQ(creates[0].first, kDirectory);
-  EXPECT_EQ(creates[0].second, 0777u);
+  EXPECT_EQ(creates[0].second, 0750u);
 
   const std::string contents = *platform.fileSystem.ReadFile(path);
   const Value expected = Value::array({

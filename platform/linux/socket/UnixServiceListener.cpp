@@ -6,6 +6,7 @@
 #include <systemd/sd-daemon.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
 #include <deque>
@@ -157,13 +158,24 @@ class UnixClientConnection final : public ClientConnection,
       if (auto reply = protocol::EncodeRejectReply(*error)) Send(std::move(*reply));
       return true;
     }
+    auto& request = std::get<protocol::Request>(decoded);
+    if (std::holds_alternative<protocol::KillService>(request.arguments) &&
+        !listener_.MayKill(uid_)) {
+      listener_.killRefusals_.fetch_add(1, std::memory_order_relaxed);
+      TLOG_ERROR(nullptr, "refused killService from pid {} uid {}: not allowed", pid_, uid_);
+      if (request.call) {
+        Send(protocol::EncodeOperationErrorReply(
+            *request.call, protocol::kAccessErrorDomain, protocol::kKillNotAllowedCode,
+            "killService is allowed only to root, the service's user and limits.kill_uids"));
+      }
+      return true;
+    }
     std::shared_ptr<RuvoReportingServiceProtocol> object = object_;
     if (!object) return true;
     std::weak_ptr<UnixClientConnection> weakSelf = weak_from_this();
-    protocol::Dispatch(std::move(std::get<protocol::Request>(decoded)), *object,
-                       [weakSelf](std::vector<uint8_t> reply) {
-                         if (auto self = weakSelf.lock()) self->Send(std::move(reply));
-                       });
+    protocol::Dispatch(std::move(request), *object, [weakSelf](std::vector<uint8_t> reply) {
+      if (auto self = weakSelf.lock()) self->Send(std::move(reply));
+    });
     return !ended_;
   }
 
@@ -317,6 +329,17 @@ void UnixServiceListener::Stop() {
     for (const auto& connection : open) connection->Close();
     io_.stop();
   });
+}
+
+void UnixServiceListener::SetKillUids(std::vector<uint32_t> uids) {
+  std::lock_guard lock(killUidsMutex_);
+  killUids_ = std::move(uids);
+}
+
+bool UnixServiceListener::MayKill(uint32_t uid) const {
+  if (uid == 0 || uid == ::geteuid()) return true;
+  std::lock_guard lock(killUidsMutex_);
+  return std::find(killUids_.begin(), killUids_.end(), uid) != killUids_.end();
 }
 
 size_t UnixServiceListener::ConnectionCount() const {

@@ -8,6 +8,7 @@
 #include <mutex>
 #include <set>
 #include <string>
+#include <vector>
 
 #include <asio.hpp>
 
@@ -19,8 +20,9 @@ namespace tavrin {
 struct UnixListenerOptions {
   // Where to bind when the socket is not handed over by systemd.
   std::string socketPath;
-  // Permission bits of the socket file (not reduced by the umask).
-  unsigned socketMode = 0666;
+  // Permission bits of the socket file (not reduced by the umask): owner and group only, so that a
+  // local user gets in only by being put in the service's group.
+  unsigned socketMode = 0660;
   uint32_t frameLimit = protocol::kDefaultFrameLimit;
   // Adopt a listening socket passed as descriptor 3 (LISTEN_FDS/LISTEN_PID) when there is one.
   bool allowSocketActivation = true;
@@ -57,6 +59,12 @@ class UnixServiceListener final : public ServiceListener {
   void SetReadGate(std::function<bool()> mayRead) { readGate_ = std::move(mayRead); }
   // Short enough to add little latency once the gate opens, long enough not to spin the thread.
   static constexpr auto kReadGatePause = std::chrono::milliseconds(1);
+  // Besides root and the service's own uid, the peers whose killService is honoured; anyone else
+  // is answered with an access error and the service goes on. Thread-safe.
+  void SetKillUids(std::vector<uint32_t> uids);
+  bool MayKill(uint32_t uid) const;
+  // killService requests refused for the peer's uid.
+  uint64_t KillRefusals() const { return killRefusals_.load(std::memory_order_relaxed); }
   // Times a connection found the gate closed.
   uint64_t ReadGateStalls() const { return readGateStalls_.load(std::memory_order_relaxed); }
   // Runs the I/O loop on the calling thread until Stop().
@@ -83,6 +91,9 @@ class UnixServiceListener final : public ServiceListener {
   ServiceListenerDelegate* delegate_ = nullptr;
   std::function<bool()> readGate_;
   std::atomic<uint64_t> readGateStalls_{0};
+  mutable std::mutex killUidsMutex_;
+  std::vector<uint32_t> killUids_;  // guarded by killUidsMutex_
+  std::atomic<uint64_t> killRefusals_{0};
   bool socketActivated_ = false;
   bool boundPath_ = false;
   mutable std::mutex connectionsMutex_;

@@ -1,0 +1,116 @@
+// Who may reach the service and stop it: the socket's mode keeps out users outside the service's
+// group, and killService is honoured only for root, the service's own user and limits.kill_uids.
+// These cases switch to another uid in a child process, so they run only as root.
+
+#include <grp.h>
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <csignal>
+#include <fstream>
+#include <functional>
+
+#include "tests/support/TavrindProcess.h"
+
+namespace tavrin {
+namespace {
+
+using testing::TavrindProcess;
+using testing::TestClient;
+
+constexpr uid_t kOtherUid = 65534;  // nobody
+
+unsigned Mode(const std::string& path) {
+  struct stat info {};
+  return ::stat(path.c_str(), &info) == 0 ? (info.st_mode & 07777) : 0xFFFFu;
+}
+
+// Runs `body` as kOtherUid in a child process and returns its exit status (0: all held).
+int RunAsOtherUser(const std::function<int()>& body) {
+  const pid_t child = ::fork();
+  if (child == 0) {
+    if (::setgroups(0, nullptr) != 0 || ::setgid(kOtherUid) != 0 || ::setuid(kOtherUid) != 0) {
+      ::_exit(100);
+    }
+    ::_exit(body());
+  }
+  int status = 0;
+  ::waitpid(child, &status, 0);
+  return WIFEXITED(status) ? WEXITSTATUS(status) : 200;
+}
+
+class AccessE2eTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    if (::geteuid() != 0) GTEST_SKIP() << "needs root to act as another user";
+  }
+  // Lets other users walk to the socket, so that only the socket's own mode decides.
+  static void OpenPathTo(const TavrindProcess& service) {
+    ::chmod(service.root().c_str(), 0711);
+    ::chmod((service.root() + "/run").c_str(), 0711);
+  }
+};
+
+TEST_F(AccessE2eTest, FilesAreClosedToOtherUsersAndTheSocketToOtherGroups) {
+  TavrindProcess service;
+  ASSERT_TRUE(service.Start()) << service.Log();
+  OpenPathTo(service);
+  EXPECT_EQ(Mode(service.SocketPath()), 0660u);
+  EXPECT_EQ(Mode(service.root() + "/lib"), 0750u);
+  EXPECT_EQ(Mode(service.DatabasePath()), 0640u);
+
+  const std::string socketPath = service.SocketPath();
+  EXPECT_EQ(RunAsOtherUser([&] { return TestClient(socketPath).connected() ? 1 : 0; }), 0)
+      << "a user outside the service's group connected";
+  TestClient owner(socketPath);
+  EXPECT_TRUE(owner.connected());
+}
+
+TEST_F(AccessE2eTest, AnotherUserWhoMayConnectCannotStopTheServiceUnlessListed) {
+  TavrindProcess service({"--socket-mode", "0666"});
+  ASSERT_TRUE(service.Start()) << service.Log();
+  OpenPathTo(service);
+  const std::string socketPath = service.SocketPath();
+  auto killThenAsk = [&] {
+    TestClient client(socketPath);
+    if (!client.connected()) return 2;
+    client.Send(1, protocol::KillService{});
+    client.Send(2, protocol::GetAllReporters{});
+    auto refusal = client.Read();
+    if (!refusal || refusal->call != 1 || refusal->status != protocol::Status::kOperationError) {
+      return 3;
+    }
+    if (refusal->value.value("domain", "") != protocol::kAccessErrorDomain ||
+        refusal->value.value("code", 0) != protocol::kKillNotAllowedCode ||
+        refusal->value.value("reason", "").empty()) {
+      return 4;
+    }
+    auto next = client.Read();
+    return next && next->call == 2 && next->status == protocol::Status::kOk ? 0 : 5;
+  };
+  EXPECT_EQ(RunAsOtherUser(killThenAsk), 0) << service.Log();
+  EXPECT_TRUE(service.WaitForLog("refused killService")) << service.Log();
+
+  // Listed in limits.kill_uids (the defaults are re-read on SIGHUP), the same user may stop it.
+  std::ofstream(service.DefaultsPath()) << "[limits]\nkill_uids = [" << kOtherUid << "]\n";
+  ::kill(service.pid(), SIGHUP);
+  const auto allowed = [&] {
+    for (int attempt = 0; attempt < 100; ++attempt) {
+      TestClient client(socketPath);
+      client.Send(1, protocol::KillService{});
+      if (client.WaitForClose(std::chrono::milliseconds(500)) &&
+          !TestClient(socketPath).connected()) {
+        return 0;
+      }
+      ::usleep(50'000);
+    }
+    return 1;
+  };
+  EXPECT_EQ(RunAsOtherUser(allowed), 0) << service.Log();
+  EXPECT_EQ(service.WaitForExit(), 2) << service.Log();
+}
+
+}  // namespace
+}  // namespace tavrin
