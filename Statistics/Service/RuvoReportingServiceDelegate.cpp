@@ -128,7 +128,17 @@ Dictionary RuvoReportingServiceDelegate::RuvoReportingDefaults() {
     settings["device_name"] = name.is_string() ? name : Value(ValueText(name));
   }
   if (domain.is_object() && domain.contains("disable_reporting")) {
-    settings["disable_reporting"] = DefaultsBool(domain["disable_reporting"]);
+    const Value& disable = domain["disable_reporting"];
+    if (disable.is_boolean() || disable.is_number()) {
+      settings["disable_reporting"] = DefaultsBool(disable);
+    } else {
+      // A setting someone wrote but that is not a switch fails closed rather than being ignored.
+      TLOG_ERROR(ServiceLog(),
+                 "defaults key disable_reporting: expected a boolean, got {} {}; reporting stays "
+                 "disabled",
+                 disable.type_name(), JsonText(disable));
+      settings["disable_reporting"] = true;
+    }
   } else {
     settings["disable_reporting"] = 0;
   }

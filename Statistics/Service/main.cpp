@@ -211,6 +211,11 @@ int main(int argc, char** argv) {
 
   auto delegate = RuvoReportingServiceDelegate::init(services);
   listener.SetDelegate(delegate.get());
+  // Settings are applied on their first change, except that a file that does not parse at start
+  // must not leave reporting on: the domain then reads as disabled, and this applies it now.
+  if (LoadTomlFile(options.defaults).status == TomlFileLoad::Status::kFailed) {
+    notifications.Post(kDefaultsNotificationName);
+  }
   // Clients that send faster than the store commits are slowed down through their sockets rather
   // than have their records dropped.
   listener.SetReadGate(

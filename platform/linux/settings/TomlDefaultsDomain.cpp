@@ -168,24 +168,26 @@ TomlDefaultsDomain::TomlDefaultsDomain(std::string path) : path_(std::move(path)
 
 Dictionary TomlDefaultsDomain::Read() {
   TomlFileLoad load = LoadTomlFile(path_);
+  std::lock_guard lock(mutex_);
   if (load.status != TomlFileLoad::Status::kFailed) {
-    std::lock_guard lock(mutex_);
     lastLoggedFailure_.reset();
+    lastGood_ = load.values;
     return std::move(load.values);
   }
   // Every Read of an unchanged broken file would repeat the same line.
   std::string failure = load.fileState + "\n" + load.error;
-  bool repeated;
-  {
-    std::lock_guard lock(mutex_);
-    repeated = lastLoggedFailure_ == failure;
-    lastLoggedFailure_ = std::move(failure);
-  }
+  const bool repeated = lastLoggedFailure_ == failure;
+  lastLoggedFailure_ = std::move(failure);
   if (!repeated) {
-    TLOG_ERROR(nullptr, "defaults domain {} unreadable, using no settings: {}", kDefaultsDomainName,
+    TLOG_ERROR(nullptr, "defaults domain {} unreadable, {}: {}", kDefaultsDomainName,
+               lastGood_ ? "keeping the last settings that parsed"
+                         : "reporting disabled until the file parses",
                load.error);
   }
-  return MakeDictionary();
+  if (lastGood_) return *lastGood_;
+  Dictionary closed = MakeDictionary();
+  closed["disable_reporting"] = true;
+  return closed;
 }
 
 }  // namespace tavrin

@@ -28,9 +28,10 @@ struct TomlFileLoad {
 TomlFileLoad LoadTomlFile(const std::string& path);
 
 // The defaults domain over a TOML file (`--defaults`). Read() parses the file afresh on every
-// call. A missing file reads as empty, silently; an unreadable or malformed one reads as empty
-// with one error line on the default system log, not repeated until the file changes.
-// Thread-safe.
+// call. A missing file reads as empty, silently. An unreadable or malformed one fails closed: it
+// reads as the last settings that parsed, or, when none ever did, as {"disable_reporting": true},
+// so that a typo never silently turns reporting back on. Either way one error line goes to the
+// default system log, not repeated until the file changes. Thread-safe.
 class TomlDefaultsDomain final : public DefaultsDomain {
  public:
   explicit TomlDefaultsDomain(std::string path);
@@ -43,6 +44,7 @@ class TomlDefaultsDomain final : public DefaultsDomain {
   const std::string path_;
   std::mutex mutex_;
   std::optional<std::string> lastLoggedFailure_;  // guarded by mutex_
+  std::optional<Dictionary> lastGood_;            // guarded by mutex_
 };
 
 }  // namespace tavrin

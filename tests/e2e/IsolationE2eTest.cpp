@@ -1,6 +1,7 @@
-// Who may reach the service and stop it: the socket's mode keeps out users outside the service's
-// group, and killService is honoured only for root, the service's own user and limits.kill_uids.
-// These cases switch to another uid in a child process, so they run only as root.
+// What a careless or hostile local user can do to the service: who may reach it and stop it (the
+// socket's mode keeps out users outside the service's group; killService is honoured only for
+// root, the service's own user and limits.kill_uids), and what broken settings turn into. The
+// access cases switch to another uid in a child process, so they run only as root.
 
 #include <grp.h>
 #include <gtest/gtest.h>
@@ -12,6 +13,7 @@
 #include <fstream>
 #include <functional>
 
+#include "tests/support/StoreFiles.h"
 #include "tests/support/TavrindProcess.h"
 
 namespace tavrin {
@@ -41,7 +43,7 @@ int RunAsOtherUser(const std::function<int()>& body) {
   return WIFEXITED(status) ? WEXITSTATUS(status) : 200;
 }
 
-class AccessE2eTest : public ::testing::Test {
+class IsolationE2eTest : public ::testing::Test {
  protected:
   void SetUp() override {
     if (::geteuid() != 0) GTEST_SKIP() << "needs root to act as another user";
@@ -53,7 +55,7 @@ class AccessE2eTest : public ::testing::Test {
   }
 };
 
-TEST_F(AccessE2eTest, FilesAreClosedToOtherUsersAndTheSocketToOtherGroups) {
+TEST_F(IsolationE2eTest, FilesAreClosedToOtherUsersAndTheSocketToOtherGroups) {
   TavrindProcess service;
   ASSERT_TRUE(service.Start()) << service.Log();
   OpenPathTo(service);
@@ -68,7 +70,7 @@ TEST_F(AccessE2eTest, FilesAreClosedToOtherUsersAndTheSocketToOtherGroups) {
   EXPECT_TRUE(owner.connected());
 }
 
-TEST_F(AccessE2eTest, AnotherUserWhoMayConnectCannotStopTheServiceUnlessListed) {
+TEST_F(IsolationE2eTest, AnotherUserWhoMayConnectCannotStopTheServiceUnlessListed) {
   TavrindProcess service({"--socket-mode", "0666"});
   ASSERT_TRUE(service.Start()) << service.Log();
   OpenPathTo(service);
@@ -110,6 +112,40 @@ TEST_F(AccessE2eTest, AnotherUserWhoMayConnectCannotStopTheServiceUnlessListed) 
   };
   EXPECT_EQ(RunAsOtherUser(allowed), 0) << service.Log();
   EXPECT_EQ(service.WaitForExit(), 2) << service.Log();
+}
+
+// Settings fail closed: a file that does not parse never turns reporting back on.
+TEST(IsolationSettingsE2eTest, BrokenSettingsKeepTheLastGoodOnesOrDisableReporting) {
+  TavrindProcess service;
+  testing::WriteFileAtomically(service.DefaultsPath(), "disable_reporting = fals\n");
+  ASSERT_TRUE(service.Start()) << service.Log();
+  TestClient client(service.SocketPath());
+  uint64_t call = 0;
+  auto send = [&] {
+    client.Send(++call, protocol::SendMessage{Dictionary{{"x", 1}}, 1, 0, std::nullopt});
+    auto reply = client.Read();
+    return reply ? reply->status : protocol::Status::kRejected;
+  };
+  EXPECT_EQ(send(), protocol::Status::kOperationError)
+      << "a broken file at start enabled reporting";
+  EXPECT_TRUE(service.WaitForLog("reporting disabled until the file parses")) << service.Log();
+
+  int rereads = 1;  // the start's
+  auto rewrite = [&](const std::string& text) {
+    testing::WriteFileAtomically(service.DefaultsPath(), text);
+    return service.WaitForLog("re-reading tavrin defaults", ++rereads);
+  };
+  ASSERT_TRUE(rewrite("device_name = \"hall\"\n")) << service.Log();
+  EXPECT_EQ(send(), protocol::Status::kOk);
+  ASSERT_TRUE(rewrite("disable_reporting = [\n")) << service.Log();
+  EXPECT_EQ(send(), protocol::Status::kOk) << "the last good settings were not kept";
+  EXPECT_TRUE(service.WaitForLog("keeping the last settings that parsed")) << service.Log();
+
+  // A value of the wrong type names the key and its expected type, and fails closed too.
+  ASSERT_TRUE(rewrite("disable_reporting = \"false\"\n")) << service.Log();
+  EXPECT_EQ(send(), protocol::Status::kOperationError);
+  EXPECT_TRUE(service.WaitForLog("disable_reporting: expected a boolean, got string"))
+      << service.Log();
 }
 
 }  // namespace
