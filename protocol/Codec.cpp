@@ -48,11 +48,17 @@ RequestError Reject(std::optional<uint64_t> call, RejectCode code, std::string r
   return RequestError{RequestError::Kind::kReject, call, code, std::move(reason)};
 }
 
+RequestError OverLimit(std::optional<uint64_t> call, LimitCode limit, std::string reason) {
+  return RequestError{RequestError::Kind::kOverLimit, call, RejectCode::kUnknownOp,
+                      std::move(reason), limit};
+}
+
 // Reads the arguments of one request, remembering the first failure.
 class ArgumentReader {
  public:
-  ArgumentReader(const Value& request, std::optional<uint64_t> call, std::string_view operation)
-      : request_(request), call_(call), operation_(operation) {}
+  ArgumentReader(const Value& request, std::optional<uint64_t> call, std::string_view operation,
+                 const RequestLimits& limits)
+      : request_(request), call_(call), operation_(operation), limits_(limits) {}
 
   // Argument `index` (1-based, after call and op) as an integer of type T.
   template <typename T>
@@ -96,6 +102,12 @@ class ArgumentReader {
                        KindName(value)));
       return std::nullopt;
     }
+    if (value.size() > limits_.reporterIDsPerMessage) {
+      failure_ = OverLimit(call_, LimitCode::kReporterListTooLong,
+                           fmt::format("{} reporter IDs in one {}; the limit is {}", value.size(),
+                                       operation_, limits_.reporterIDsPerMessage));
+      return std::nullopt;
+    }
     std::vector<int64_t> ids;
     ids.reserve(value.size());
     for (size_t i = 0; i < value.size(); ++i) {
@@ -133,6 +145,7 @@ class ArgumentReader {
   const Value& request_;
   std::optional<uint64_t> call_;
   std::string_view operation_;
+  const RequestLimits& limits_;
   std::optional<RequestError> failure_;
 };
 
@@ -221,8 +234,9 @@ Value ArgumentValues(const Arguments& arguments) {
 
 }  // namespace
 
-std::variant<Request, RequestError> DecodeRequest(std::span<const uint8_t> body) {
-  DecodedValue decoded = DecodeMessagePack(body);
+std::variant<Request, RequestError> DecodeRequest(std::span<const uint8_t> body,
+                                                  const RequestLimits& limits) {
+  DecodedValue decoded = DecodeMessagePack(body, limits.entriesPerFrame);
   const ScanResult& scan = decoded.scan;
   if (!scan.WellFormed()) {
     return Close(fmt::format("undecodable MessagePack ({} at byte {} of {})", FormName(scan.form),
@@ -255,6 +269,11 @@ std::variant<Request, RequestError> DecodeRequest(std::span<const uint8_t> body)
   if (scan.nonStringKey) {
     return Reject(call, RejectCode::kWrongArgumentType, "map key is not a string");
   }
+  if (scan.tooManyEntries) {
+    return OverLimit(call, LimitCode::kEntriesPerFrame,
+                     fmt::format("{} entries in one frame; the limit is {}", scan.entries,
+                                 limits.entriesPerFrame));
+  }
   if (!decoded.value) return Close("undecodable MessagePack");
 
   const Value& request = *decoded.value;
@@ -274,7 +293,7 @@ std::variant<Request, RequestError> DecodeRequest(std::span<const uint8_t> body)
     return Reject(call, RejectCode::kWrongArgumentCount,
                   fmt::format("{} takes {} argument(s), got {}", *name, expected, given));
   }
-  ArgumentReader reader(request, call, *name);
+  ArgumentReader reader(request, call, *name, limits);
   Arguments arguments = ReadArguments(static_cast<Op>(*op), reader);
   if (auto failure = reader.TakeFailure()) return std::move(*failure);
   return Request{call, std::move(arguments)};
@@ -326,7 +345,11 @@ std::vector<uint8_t> EncodeRejectReply(uint64_t call, RejectCode code, std::stri
 }
 
 std::optional<std::vector<uint8_t>> EncodeRejectReply(const RequestError& error) {
-  if (error.kind != RequestError::Kind::kReject || !error.call) return std::nullopt;
+  if (error.kind == RequestError::Kind::kCloseConnection || !error.call) return std::nullopt;
+  if (error.kind == RequestError::Kind::kOverLimit) {
+    return EncodeOperationErrorReply(*error.call, kLimitsErrorDomain,
+                                     static_cast<int64_t>(error.limit), error.reason);
+  }
   return EncodeRejectReply(*error.call, error.code, error.reason);
 }
 

@@ -35,6 +35,32 @@ inline constexpr std::string_view kProtocolErrorDomain = "com.quorvex.tavrin.pro
 // The message path's own error domain, and its one code: reporting is disabled by the defaults.
 inline constexpr std::string_view kReportingErrorDomain = "com.quorvex.audio.reporting";
 inline constexpr int64_t kReportingDisabledCode = 1;
+// Requests over one of the service's limits are answered status 1 in this domain, with these
+// codes and a reason; the request has no other effect.
+inline constexpr std::string_view kLimitsErrorDomain = "com.quorvex.tavrin.limits";
+enum class LimitCode : int64_t {
+  kSessionsPerConnection = 1,
+  kReporterListTooLong = 2,
+  kEntriesPerFrame = 3,
+  kConnectionsPerUid = 4,
+  kReplyBacklog = 5,
+};
+
+// What one request may hold. Each bound is a setting (the defaults file's [limits] table) with
+// this default and a floor below which it is not lowered.
+struct RequestLimits {
+  // Elements of all arrays plus pairs of all maps in one frame. A real message has tens; the bound
+  // keeps one frame's decoding and memory small whatever its shape.
+  static constexpr uint64_t kDefaultEntriesPerFrame = 65'536;
+  static constexpr uint64_t kMinEntriesPerFrame = 1'024;
+  // Reporter IDs in one sendMessage list: each one is a copy of the message on the work queue.
+  static constexpr uint64_t kDefaultReporterIDsPerMessage = 1'024;
+  static constexpr uint64_t kMinReporterIDsPerMessage = 16;
+
+  uint64_t entriesPerFrame = kDefaultEntriesPerFrame;
+  uint64_t reporterIDsPerMessage = kDefaultReporterIDsPerMessage;
+};
+
 // Refusals of a peer that may not make the request; code 1: not allowed to stop the service.
 inline constexpr std::string_view kAccessErrorDomain = "com.quorvex.tavrin.access";
 inline constexpr int64_t kKillNotAllowedCode = 1;
@@ -128,11 +154,14 @@ struct RequestError {
     kCloseConnection,
     // Understood enough to answer with status 2 and `code` (when `call` is not nil).
     kReject,
+    // Over one of the request limits: answered status 1 in kLimitsErrorDomain with `limit`.
+    kOverLimit,
   };
   Kind kind = Kind::kCloseConnection;
   std::optional<uint64_t> call;  // kReject: the call to answer; nullopt = nil, send nothing
   RejectCode code = RejectCode::kUnknownOp;  // kReject only
-  std::string reason;                        // for the reply (kReject) or the log line (both)
+  std::string reason;  // for the reply (kReject, kOverLimit) or the log line (all)
+  LimitCode limit = LimitCode::kEntriesPerFrame;  // kOverLimit only
 };
 
 // Decodes one request frame body. Never throws on bad input.
@@ -142,12 +171,16 @@ struct RequestError {
 //     array of at least 2 whose element 0 is an integer >= 0, in any integer format, or nil):
 //     kCloseConnection;
 //  2. what the byte scan finds anywhere in the value, before any element is looked at: nesting
-//     deeper than kMaxNestingDepth (5), then bin/ext (6), then a map key that is not a string (3);
+//     deeper than kMaxNestingDepth (5), then bin/ext (6), then a map key that is not a string (3),
+//     then more entries than limits.entriesPerFrame (status 1, LimitCode::kEntriesPerFrame; the
+//     frame is never built);
 //  3. op: not an integer from 1 to 11 (1);
 //  4. the number of arguments (2);
 //  5. each argument in order: wrong type (3) or integer out of range (4). For the reporter ID list
-//     of sendMessage, element by element.
-std::variant<Request, RequestError> DecodeRequest(std::span<const uint8_t> body);
+//     of sendMessage, first its length against limits.reporterIDsPerMessage (status 1,
+//     LimitCode::kReporterListTooLong), then element by element.
+std::variant<Request, RequestError> DecodeRequest(std::span<const uint8_t> body,
+                                                  const RequestLimits& limits = {});
 
 // The request as a frame body; DecodeRequest() gives back an equal Request.
 std::vector<uint8_t> EncodeRequest(const Request& request);
@@ -165,8 +198,8 @@ std::vector<uint8_t> EncodeOperationErrorReply(uint64_t call, std::string_view d
                                                std::string_view reason = {});
 // Status 2 {"domain": kProtocolErrorDomain, "code", "reason"}.
 std::vector<uint8_t> EncodeRejectReply(uint64_t call, RejectCode code, std::string_view reason);
-// The status 2 reply for a rejected request, or nothing when there is none to send (the request
-// closes the connection, or its call is nil).
+// The status 2 reply for a rejected request, or the status 1 reply for one over a limit; nothing
+// when there is none to send (the request closes the connection, or its call is nil).
 std::optional<std::vector<uint8_t>> EncodeRejectReply(const RequestError& error);
 
 // A reply as the client sees it.

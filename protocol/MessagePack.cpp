@@ -1,6 +1,10 @@
 #include "protocol/MessagePack.h"
 
+#include <algorithm>
 #include <array>
+#include <cstring>
+#include <string>
+#include <unordered_map>
 
 namespace tavrin::protocol {
 namespace {
@@ -146,6 +150,125 @@ std::optional<uint64_t> NonNegativeInteger(uint8_t format, const uint8_t* payloa
   return raw;
 }
 
+// Builds a Value from bytes that ScanMessagePack found parsable. Maps are filled by appending,
+// with a hash index of their keys only when they are wide enough for a linear search to matter,
+// so a map of n keys costs O(n) rather than the O(n^2) of inserting key by key.
+struct TrustedParser {
+  const uint8_t* at;
+
+  static constexpr size_t kIndexedMapSize = 16;
+
+  uint64_t Take(size_t size) {
+    const uint64_t value = ReadBigEndian(at, size);
+    at += size;
+    return value;
+  }
+  std::string_view TakeString(size_t length) {
+    std::string_view text(reinterpret_cast<const char*>(at), length);
+    at += length;
+    return text;
+  }
+  template <typename Float, typename Bits>
+  Float TakeFloat() {
+    const auto bits = static_cast<Bits>(Take(sizeof(Bits)));
+    Float value;
+    std::memcpy(&value, &bits, sizeof(value));
+    return value;
+  }
+
+  Value Parse() {
+    const uint8_t format = *at++;
+    if (format <= 0x7f) return Value(static_cast<uint64_t>(format));
+    if (format >= 0xe0) return Value(static_cast<int64_t>(static_cast<int8_t>(format)));
+    if (format <= 0x8f) return ParseMap(format & 0x0fu);
+    if (format <= 0x9f) return ParseArray(format & 0x0fu);
+    if (format <= 0xbf) return Value(std::string(TakeString(format & 0x1fu)));
+    switch (format) {
+      case 0xc0:
+        return Value(nullptr);
+      case 0xc2:
+        return Value(false);
+      case 0xc3:
+        return Value(true);
+      case 0xca:
+        return Value(static_cast<double>(TakeFloat<float, uint32_t>()));
+      case 0xcb:
+        return Value(TakeFloat<double, uint64_t>());
+      case 0xcc:
+        return Value(Take(1));
+      case 0xcd:
+        return Value(Take(2));
+      case 0xce:
+        return Value(Take(4));
+      case 0xcf:
+        return Value(Take(8));
+      case 0xd0:
+        return Value(static_cast<int64_t>(static_cast<int8_t>(Take(1))));
+      case 0xd1:
+        return Value(static_cast<int64_t>(static_cast<int16_t>(Take(2))));
+      case 0xd2:
+        return Value(static_cast<int64_t>(static_cast<int32_t>(Take(4))));
+      case 0xd3:
+        return Value(static_cast<int64_t>(Take(8)));
+      case 0xd9:
+        return Value(std::string(TakeString(Take(1))));
+      case 0xda:
+        return Value(std::string(TakeString(Take(2))));
+      case 0xdb:
+        return Value(std::string(TakeString(Take(4))));
+      case 0xdc:
+        return ParseArray(Take(2));
+      case 0xdd:
+        return ParseArray(Take(4));
+      case 0xde:
+        return ParseMap(Take(2));
+      default:  // 0xdf; the scan let nothing else through
+        return ParseMap(Take(4));
+    }
+  }
+
+  Value ParseArray(uint64_t count) {
+    Value array = Value::array();
+    auto& elements = array.get_ref<Value::array_t&>();
+    elements.reserve(count);
+    for (uint64_t i = 0; i < count; ++i) elements.push_back(Parse());
+    return array;
+  }
+
+  Value ParseMap(uint64_t count) {
+    Value map = Value::object();
+    auto& pairs = map.get_ref<Value::object_t&>();
+    pairs.reserve(count);
+    std::unordered_map<std::string_view, size_t> index;
+    if (count >= kIndexedMapSize) index.reserve(count);
+    for (uint64_t i = 0; i < count; ++i) {
+      std::string key = Parse().get<std::string>();
+      Value value = Parse();
+      if (count >= kIndexedMapSize) {
+        // The index points into `pairs`, whose keys never move: the vector was reserved up front
+        // and a repeated key only ever removes the pair just added.
+        pairs.emplace_back(std::move(key), std::move(value));
+        auto [found, inserted] =
+            index.try_emplace(std::string_view(pairs.back().first), pairs.size() - 1);
+        if (!inserted) {
+          (pairs.begin() + static_cast<std::ptrdiff_t>(found->second))->second =
+              std::move(pairs.back().second);
+          pairs.pop_back();
+        }
+      } else {
+        auto existing = std::find_if(pairs.begin(), pairs.end(),
+                                     [&](const auto& pair) { return pair.first == key; });
+        if (existing != pairs.end()) {
+          existing->second = std::move(value);
+        } else {
+          pairs.emplace_back(std::move(key), std::move(value));
+        }
+      }
+    }
+    return map;
+  }
+};
+
 }  // namespace
 
 ScanResult ScanMessagePack(std::span<const uint8_t> bytes) {
@@ -193,6 +316,7 @@ ScanResult ScanMessagePack(std::span<const uint8_t> bytes) {
     if (isContainer) {
       const uint64_t count = h.lengthSize > 0 ? length : h.count;
       children = h.kind == Header::Kind::kMap ? 2 * count : count;
+      result.entries += count;
     }
     pending -= 1;
     if (children > size - pos || pending + children > size - pos) {
@@ -245,19 +369,15 @@ ScanResult ScanMessagePack(std::span<const uint8_t> bytes) {
   return result;
 }
 
-DecodedValue DecodeMessagePack(std::span<const uint8_t> bytes) {
+DecodedValue DecodeMessagePack(std::span<const uint8_t> bytes, uint64_t maxEntries) {
   DecodedValue decoded;
   decoded.scan = ScanMessagePack(bytes);
+  decoded.scan.tooManyEntries = decoded.scan.entries > maxEntries;
   if (!decoded.scan.Parsable()) return decoded;
-  // The scan has bounded the depth and ruled out every input the parser rejects, so this parse
-  // neither recurses deeply nor fails; a failure would still come back as "discarded".
-  Value value = Value::from_msgpack(bytes.data(), bytes.data() + bytes.size(),
-                                    /*strict=*/true, /*allow_exceptions=*/false);
-  if (value.is_discarded()) {
-    decoded.scan.form = ScanResult::Form::kTruncated;
-    return decoded;
-  }
-  decoded.value = std::move(value);
+  // The scan has checked every length against the bytes, bounded the depth and ruled out every
+  // format the parser does not build, so the parse can trust what it reads.
+  TrustedParser parser{bytes.data()};
+  decoded.value = parser.Parse();
   return decoded;
 }
 

@@ -49,13 +49,17 @@ struct ScanResult {
   // down to kMaxNestingDepth.
   bool nonStringKey = false;
   std::optional<uint64_t> topLevelArraySize;  // set when the value is an array
+  // Elements of every array plus pairs of every map, at all depths: what parsing will build.
+  uint64_t entries = 0;
+  // More entries than the decoder was allowed to build (DecodeMessagePack's maxEntries).
+  bool tooManyEntries = false;
   First first = First::kAbsent;
   uint64_t firstValue = 0;
 
   bool WellFormed() const { return form == Form::kWellFormed; }
   // Well-formed and nothing in it that the parser must not see.
   bool Parsable() const {
-    return WellFormed() && !tooDeep && unsupportedType.empty() && !nonStringKey;
+    return WellFormed() && !tooDeep && unsupportedType.empty() && !nonStringKey && !tooManyEntries;
   }
 };
 
@@ -67,10 +71,12 @@ struct DecodedValue {
   std::optional<Value> value;  // set exactly when scan.Parsable()
 };
 
-// Scans `bytes` and, when they are parsable, parses them into a Value (nil, boolean, signed or
-// unsigned integer as the format said, float, string, array, map with string keys in wire order;
-// a key that appears twice keeps its first place and its last value). Never throws on bad input.
-DecodedValue DecodeMessagePack(std::span<const uint8_t> bytes);
+// Scans `bytes` and, when they are parsable and hold at most `maxEntries` entries, parses them
+// into a Value (nil, boolean, signed or unsigned integer as the format said, float, string,
+// array, map with string keys in wire order; a key that appears twice keeps its first place and
+// its last value). Time and memory are linear in the size of the bytes whatever their shape
+// (wide maps included). Never throws on bad input.
+DecodedValue DecodeMessagePack(std::span<const uint8_t> bytes, uint64_t maxEntries = UINT64_MAX);
 
 // The MessagePack bytes of a value; non-negative integers are written in the unsigned formats
 // whatever their C++ type was, which every reader here accepts. The value must not hold binary.

@@ -3,6 +3,7 @@
 
 #include <sys/stat.h>
 
+#include <algorithm>
 #include <chrono>
 #include <csignal>
 #include <cstdint>
@@ -78,27 +79,59 @@ void ApplyRoot(Options& options, const CLI::App& app) {
   }
 }
 
-// The extra uids whose killService is honoured: the integers of "limits.kill_uids". Anything else
-// there is an error line naming the key and what it should hold, and is ignored.
-std::vector<uint32_t> KillUids(const tavrin::Dictionary& defaults) {
-  std::vector<uint32_t> uids;
-  auto limits = defaults.find("limits");
-  if (limits == defaults.end() || !limits->is_object()) return uids;
-  auto list = limits->find("kill_uids");
-  if (list == limits->end()) return uids;
+// The listener's settings from the defaults file's [limits] table. A value of the wrong type is
+// an error line naming the key and what it should hold, and the default stays; a number below a
+// limit's floor is raised to the floor.
+struct ListenerSettings {
+  tavrin::protocol::RequestLimits limits;
+  std::vector<uint32_t> killUids;  // besides root and the service's own uid
+};
+
+ListenerSettings ReadListenerSettings(const tavrin::Dictionary& defaults) {
+  using tavrin::protocol::RequestLimits;
+  ListenerSettings settings;
+  auto table = defaults.find("limits");
+  if (table == defaults.end()) return settings;
+  if (!table->is_object()) {
+    TLOG_ERROR(nullptr, "limits: expected a table, got {}", table->type_name());
+    return settings;
+  }
+  auto readCount = [&](const char* key, uint64_t floor, uint64_t& into) {
+    auto value = table->find(key);
+    if (value == table->end()) return;
+    if (!value->is_number_integer() || value->get<int64_t>() < 0) {
+      TLOG_ERROR(nullptr, "limits.{}: expected a non-negative integer, got {}; keeping {}", key,
+                 tavrin::JsonText(*value), into);
+      return;
+    }
+    into = std::max<uint64_t>(value->get<uint64_t>(), floor);
+  };
+  readCount("entries_per_frame", RequestLimits::kMinEntriesPerFrame,
+            settings.limits.entriesPerFrame);
+  readCount("reporter_ids_per_message", RequestLimits::kMinReporterIDsPerMessage,
+            settings.limits.reporterIDsPerMessage);
+  auto list = table->find("kill_uids");
+  if (list == table->end()) return settings;
   if (!list->is_array()) {
     TLOG_ERROR(nullptr, "limits.kill_uids: expected an array of uids, got {}", list->type_name());
-    return uids;
+    return settings;
   }
   for (const auto& uid : *list) {
     if (uid.is_number_integer() && uid.get<int64_t>() >= 0 && uid.get<int64_t>() <= UINT32_MAX) {
-      uids.push_back(uid.get<uint32_t>());
+      settings.killUids.push_back(uid.get<uint32_t>());
     } else {
       TLOG_ERROR(nullptr, "limits.kill_uids: expected uids (integers 0..{}), got {}", UINT32_MAX,
                  tavrin::JsonText(uid));
     }
   }
-  return uids;
+  return settings;
+}
+
+void ApplyListenerSettings(tavrin::UnixServiceListener& listener,
+                           const tavrin::Dictionary& defaults) {
+  ListenerSettings settings = ReadListenerSettings(defaults);
+  listener.SetRequestLimits(settings.limits);
+  listener.SetKillUids(std::move(settings.killUids));
 }
 
 }  // namespace
@@ -181,7 +214,7 @@ int main(int argc, char** argv) {
   BackendReportingService reporting(CreateBackends(*choices, environment), SystemClock(),
                                     SystemRandom());
   reporting.ApplyDefaults(defaults.Read());
-  listener.SetKillUids(KillUids(defaults.Read()));
+  ApplyListenerSettings(listener, defaults.Read());
 
   PlatformServices services;
   services.dispatcher = &dispatcher;
@@ -206,7 +239,7 @@ int main(int argc, char** argv) {
                                               logSystem.Refresh();
                                               const Dictionary settings = defaults.Read();
                                               reporting.ApplyDefaults(settings);
-                                              listener.SetKillUids(KillUids(settings));
+                                              ApplyListenerSettings(listener, settings);
                                             });
 
   auto delegate = RuvoReportingServiceDelegate::init(services);

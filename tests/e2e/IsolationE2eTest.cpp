@@ -9,6 +9,8 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
+#include <chrono>
 #include <csignal>
 #include <fstream>
 #include <functional>
@@ -112,6 +114,53 @@ TEST_F(IsolationE2eTest, AnotherUserWhoMayConnectCannotStopTheServiceUnlessListe
   };
   EXPECT_EQ(RunAsOtherUser(allowed), 0) << service.Log();
   EXPECT_EQ(service.WaitForExit(), 2) << service.Log();
+}
+
+// One wide frame or one long reporter list used to freeze every client for seconds, or take the
+// service to a gigabyte: both are now refused at once with the limits error, and another client's
+// round trips go on.
+TEST(IsolationLimitsE2eTest, WideFramesAndLongReporterListsAreRefusedWithoutStallingOthers) {
+  TavrindProcess service;
+  ASSERT_TRUE(service.Start()) << service.Log();
+  TestClient attacker(service.SocketPath());
+  TestClient bystander(service.SocketPath());
+
+  // [1, 6, {200,000 distinct 3-letter keys: 0}, 1, 0, nil]: just under 1 MiB.
+  std::vector<uint8_t> wide{0x96, 0x01, 0x06, 0xdf, 0x00, 0x03, 0x0d, 0x40};
+  for (int key = 0; key < 200'000; ++key) {
+    wide.insert(wide.end(), {0xa3, uint8_t('0' + key % 64), uint8_t('0' + key / 64 % 64),
+                             uint8_t('0' + key / 4096), 0x00});
+  }
+  wide.insert(wide.end(), {0x01, 0x00, 0xc0});
+  std::vector<int64_t> everyone(10'000, 7);  // under the entry limit, over the list limit
+
+  uint64_t call = 0;
+  auto worstRoundTrip = std::chrono::nanoseconds(0);
+  auto roundTrip = [&] {
+    const auto started = std::chrono::steady_clock::now();
+    bystander.Send(++call, protocol::GetAllReporters{});
+    auto reply = bystander.Read();
+    worstRoundTrip = std::max(worstRoundTrip, std::chrono::steady_clock::now() - started);
+    return reply && reply->status == protocol::Status::kOk;
+  };
+  ASSERT_TRUE(roundTrip());
+  const auto started = std::chrono::steady_clock::now();
+  ASSERT_TRUE(attacker.SendBody(wide));
+  ASSERT_TRUE(attacker.Send(
+      2, protocol::SendMessage{Dictionary{{"x", std::string(1024, 'x')}}, 1, 0, everyone}));
+  for (int i = 0; i < 20; ++i) EXPECT_TRUE(roundTrip());
+  for (auto [expectedCall, code] : {std::pair{1u, protocol::LimitCode::kEntriesPerFrame},
+                                    std::pair{2u, protocol::LimitCode::kReporterListTooLong}}) {
+    auto refusal = attacker.Read();
+    ASSERT_TRUE(refusal) << service.Log();
+    EXPECT_EQ(refusal->call, expectedCall);
+    EXPECT_EQ(refusal->status, protocol::Status::kOperationError);
+    EXPECT_EQ(refusal->value.value("domain", ""), protocol::kLimitsErrorDomain);
+    EXPECT_EQ(refusal->value.value("code", 0), static_cast<int64_t>(code));
+  }
+  EXPECT_LT(std::chrono::steady_clock::now() - started, std::chrono::seconds(1));
+  EXPECT_LT(worstRoundTrip, std::chrono::milliseconds(50));
+  EXPECT_EQ(service.LogCount("refused request from pid"), 2u) << service.Log();
 }
 
 // Settings fail closed: a file that does not parse never turns reporting back on.

@@ -145,8 +145,15 @@ class UnixClientConnection final : public ClientConnection,
 
   // False when the frame ended the connection.
   bool HandleFrame(std::span<const uint8_t> body) {
-    auto decoded = protocol::DecodeRequest(body);
+    auto decoded = protocol::DecodeRequest(body, listener_.RequestLimits());
     if (auto* error = std::get_if<protocol::RequestError>(&decoded)) {
+      if (error->kind == protocol::RequestError::Kind::kOverLimit) {
+        listener_.limitRefusals_.fetch_add(1, std::memory_order_relaxed);
+        TLOG_ERROR(nullptr, "refused request from pid {} uid {}: limit {}: {}", pid_, uid_,
+                   static_cast<int64_t>(error->limit), error->reason);
+        if (auto reply = protocol::EncodeRejectReply(*error)) Send(std::move(*reply));
+        return true;
+      }
       if (error->kind == protocol::RequestError::Kind::kCloseConnection) {
         TLOG_ERROR(nullptr, "closing connection of pid {}: undecodable request: {}", pid_,
                    error->reason);
@@ -334,6 +341,16 @@ void UnixServiceListener::Stop() {
 void UnixServiceListener::SetKillUids(std::vector<uint32_t> uids) {
   std::lock_guard lock(killUidsMutex_);
   killUids_ = std::move(uids);
+}
+
+void UnixServiceListener::SetRequestLimits(const protocol::RequestLimits& limits) {
+  entriesPerFrame_.store(limits.entriesPerFrame, std::memory_order_relaxed);
+  reporterIDsPerMessage_.store(limits.reporterIDsPerMessage, std::memory_order_relaxed);
+}
+
+protocol::RequestLimits UnixServiceListener::RequestLimits() const {
+  return protocol::RequestLimits{entriesPerFrame_.load(std::memory_order_relaxed),
+                                 reporterIDsPerMessage_.load(std::memory_order_relaxed)};
 }
 
 bool UnixServiceListener::MayKill(uint32_t uid) const {

@@ -13,6 +13,7 @@
 #include <asio.hpp>
 
 #include "platform/ServiceListener.h"
+#include "protocol/Codec.h"
 #include "protocol/Frame.h"
 
 namespace tavrin {
@@ -63,6 +64,11 @@ class UnixServiceListener final : public ServiceListener {
   // is answered with an access error and the service goes on. Thread-safe.
   void SetKillUids(std::vector<uint32_t> uids);
   bool MayKill(uint32_t uid) const;
+  // The bounds a request is decoded against; thread-safe, applies to the next request read.
+  void SetRequestLimits(const protocol::RequestLimits& limits);
+  protocol::RequestLimits RequestLimits() const;
+  // Requests refused for being over a request limit.
+  uint64_t LimitRefusals() const { return limitRefusals_.load(std::memory_order_relaxed); }
   // killService requests refused for the peer's uid.
   uint64_t KillRefusals() const { return killRefusals_.load(std::memory_order_relaxed); }
   // Times a connection found the gate closed.
@@ -94,6 +100,10 @@ class UnixServiceListener final : public ServiceListener {
   mutable std::mutex killUidsMutex_;
   std::vector<uint32_t> killUids_;  // guarded by killUidsMutex_
   std::atomic<uint64_t> killRefusals_{0};
+  std::atomic<uint64_t> entriesPerFrame_{protocol::RequestLimits::kDefaultEntriesPerFrame};
+  std::atomic<uint64_t> reporterIDsPerMessage_{
+      protocol::RequestLimits::kDefaultReporterIDsPerMessage};
+  std::atomic<uint64_t> limitRefusals_{0};
   bool socketActivated_ = false;
   bool boundPath_ = false;
   mutable std::mutex connectionsMutex_;
