@@ -85,6 +85,10 @@ void ApplyRoot(Options& options, const CLI::App& app) {
 struct ListenerSettings {
   tavrin::protocol::RequestLimits limits;
   std::vector<uint32_t> killUids;  // besides root and the service's own uid
+  // Read once, at start.
+  uint64_t connectionsPerUid = tavrin::UnixListenerOptions{}.connectionsPerUid;
+  uint64_t replyBytesPerConnection = tavrin::UnixListenerOptions{}.replyBytesPerConnection;
+  uint64_t replyBytesTotal = tavrin::UnixListenerOptions{}.replyBytesTotal;
 };
 
 ListenerSettings ReadListenerSettings(const tavrin::Dictionary& defaults) {
@@ -110,6 +114,9 @@ ListenerSettings ReadListenerSettings(const tavrin::Dictionary& defaults) {
             settings.limits.entriesPerFrame);
   readCount("reporter_ids_per_message", RequestLimits::kMinReporterIDsPerMessage,
             settings.limits.reporterIDsPerMessage);
+  readCount("connections_per_uid", 8, settings.connectionsPerUid);
+  readCount("reply_bytes_per_connection", 64 * 1024, settings.replyBytesPerConnection);
+  readCount("reply_bytes_total", 1024 * 1024, settings.replyBytesTotal);
   auto list = table->find("kill_uids");
   if (list == table->end()) return settings;
   if (!list->is_array()) {
@@ -190,7 +197,12 @@ int main(int argc, char** argv) {
     return kUsageError;
   }
 
-  UnixServiceListener listener(UnixListenerOptions{options.socket, socketMode});
+  const ListenerSettings startSettings = ReadListenerSettings(defaults.Read());
+  UnixListenerOptions listenerOptions{options.socket, socketMode};
+  listenerOptions.connectionsPerUid = startSettings.connectionsPerUid;
+  listenerOptions.replyBytesPerConnection = startSettings.replyBytesPerConnection;
+  listenerOptions.replyBytesTotal = startSettings.replyBytesTotal;
+  UnixServiceListener listener(listenerOptions);
   try {
     listener.Open();
   } catch (const std::system_error& failure) {

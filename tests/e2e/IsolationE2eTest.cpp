@@ -5,6 +5,7 @@
 
 #include <grp.h>
 #include <gtest/gtest.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -14,6 +15,9 @@
 #include <csignal>
 #include <fstream>
 #include <functional>
+#include <memory>
+#include <string>
+#include <vector>
 
 #include "tests/support/StoreFiles.h"
 #include "tests/support/TavrindProcess.h"
@@ -161,6 +165,92 @@ TEST(IsolationLimitsE2eTest, WideFramesAndLongReporterListsAreRefusedWithoutStal
   EXPECT_LT(std::chrono::steady_clock::now() - started, std::chrono::seconds(1));
   EXPECT_LT(worstRoundTrip, std::chrono::milliseconds(50));
   EXPECT_EQ(service.LogCount("refused request from pid"), 2u) << service.Log();
+}
+
+// Peak resident memory of a process, from /proc.
+size_t PeakRssBytes(pid_t pid) {
+  std::ifstream status("/proc/" + std::to_string(pid) + "/status");
+  std::string line;
+  while (std::getline(status, line)) {
+    if (line.rfind("VmHWM:", 0) == 0) return std::stoul(line.substr(6)) * 1024;
+  }
+  return 0;
+}
+
+// A crowd of connections is bounded twice: per uid, and by the descriptors kept for the service
+// itself. Refusals close the newcomer at once and are logged once a second with a count; the
+// connections already there, and the store, go on.
+TEST(IsolationLimitsE2eTest, ConnectionCrowdsAreCutAtThePerUidLimitAndTheDescriptorReserve) {
+  struct Case {
+    int descriptorLimit;
+    int perUid;
+    size_t kept;
+  };
+  // 100 descriptors less the reserve of 64 leaves 36 connections at most.
+  for (const Case& c : {Case{1024, 8, 8}, Case{100, 1000, 36}}) {
+    TavrindProcess service;
+    testing::WriteFileAtomically(service.DefaultsPath(), "[limits]\nconnections_per_uid = " +
+                                                             std::to_string(c.perUid) + "\n");
+    rlimit saved{};
+    ::getrlimit(RLIMIT_NOFILE, &saved);
+    rlimit lowered = saved;
+    lowered.rlim_cur = static_cast<rlim_t>(c.descriptorLimit);
+    ::setrlimit(RLIMIT_NOFILE, &lowered);  // inherited by the service
+    const bool started = service.Start();
+    ::setrlimit(RLIMIT_NOFILE, &saved);
+    ASSERT_TRUE(started) << service.Log();
+
+    std::vector<std::unique_ptr<TestClient>> crowd;
+    for (int i = 0; i < 60; ++i) {
+      crowd.push_back(std::make_unique<TestClient>(service.SocketPath()));
+      crowd.back()->Send(1, protocol::GetAllReporters{});
+    }
+    size_t answered = 0;
+    for (auto& client : crowd) answered += client->Read(std::chrono::milliseconds(500)) ? 1 : 0;
+    EXPECT_EQ(answered, c.kept) << service.Log();
+    EXPECT_LE(service.LogCount("since the last such line"), 3u) << "one line a second at most";
+    crowd.clear();
+    // Once the crowd leaves, connections are accepted again and messages reach the store.
+    ASSERT_TRUE(testing::WaitUntil([&] {
+      TestClient client(service.SocketPath());
+      client.Send(1, protocol::SendMessage{Dictionary{{"after", 1}}, 1, 0, std::nullopt});
+      auto reply = client.Read(std::chrono::milliseconds(500));
+      return reply && reply->status == protocol::Status::kOk;
+    })) << service.Log();
+    EXPECT_EQ(service.Stop(), 0);
+  }
+}
+
+// Clients that send requests and never read their replies once took the service to 2.8 GB and
+// SIGABRT. Each backlog is bounded, and so is their total: the largest backlogs are cut off.
+TEST(IsolationLimitsE2eTest, ManyClientsThatNeverReadCannotExhaustTheService) {
+  TavrindProcess service;
+  testing::WriteFileAtomically(service.DefaultsPath(), "[limits]\nconnections_per_uid = 1000\n");
+  ASSERT_TRUE(service.Start()) << service.Log();
+  TestClient owner(service.SocketPath());
+  for (int64_t id = 1; id <= 2000; ++id) owner.SendNoReply(protocol::CreateReportingSession{id});
+  owner.Send(1, protocol::GetAllReporters{});
+  ASSERT_TRUE(owner.Read()) << service.Log();  // every reply now lists 2,000 reporters
+
+  std::vector<std::unique_ptr<TestClient>> silent;
+  for (int i = 0; i < 400; ++i) {
+    silent.push_back(std::make_unique<TestClient>(service.SocketPath()));
+    for (uint64_t call = 1; call <= 100; ++call) {
+      silent.back()->Send(call, protocol::GetAllReporters{});
+    }
+  }
+  TestClient newcomer(service.SocketPath());
+  const auto started = std::chrono::steady_clock::now();
+  newcomer.Send(1, protocol::GetAllReporters{});
+  auto reply = newcomer.Read();
+  ASSERT_TRUE(reply) << service.Log();
+  EXPECT_EQ(reply->status, protocol::Status::kOk);
+  EXPECT_LT(std::chrono::steady_clock::now() - started, std::chrono::seconds(5));
+  EXPECT_LT(PeakRssBytes(service.pid()), size_t{512} << 20);
+  EXPECT_GT(
+      service.LogCount("bytes of replies not read") + service.LogCount("the largest reply backlog"),
+      0u)
+      << "no backlog was ever cut off";
 }
 
 // Settings fail closed: a file that does not parse never turns reporting back on.

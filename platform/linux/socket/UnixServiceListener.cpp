@@ -1,5 +1,6 @@
 #include "platform/linux/socket/UnixServiceListener.h"
 
+#include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
@@ -24,12 +25,11 @@ using Socket = asio::local::stream_protocol::socket;
 
 // Bytes read from a socket per system call.
 constexpr size_t kReadChunk = 16 * 1024;
-// Replies waiting for a client that does not read them. Past this the client is cut off rather
-// than let it pin the service's memory.
-constexpr size_t kMaxPendingReplyBytes = 16 * 1024 * 1024;
 constexpr int kListenBacklog = 128;
 // Pause after a failed accept (EMFILE and the like) before trying again.
 constexpr auto kAcceptRetryDelay = std::chrono::milliseconds(100);
+// Refused connections and failed accepts come in crowds: one line per interval, with the count.
+constexpr auto kRefusalLogInterval = std::chrono::seconds(1);
 
 std::system_error PathError(int error, const std::string& what, const std::string& path) {
   return std::system_error(error, std::generic_category(), what + " " + path);
@@ -97,6 +97,26 @@ class UnixClientConnection final : public ClientConnection,
 
   // Ends the connection from the service's side (shutdown of the listener).
   void Close() { End(/*abnormal=*/false, "service stopping"); }
+  // Closes a connection refused on arrival: nobody has seen it, so no handler runs.
+  void CloseUnaccepted() {
+    ended_ = true;
+    asio::error_code ignored;
+    socket_.close(ignored);
+  }
+
+  size_t PendingBytes() const { return pendingBytes_; }
+  uint32_t Uid() const { return uid_; }
+  bool Ended() const { return ended_; }
+  // Ends the connection because the replies waiting for all clients exceed their bound and this
+  // one waits for the most.
+  void CutOffForTotalBacklog() {
+    TLOG_ERROR(nullptr,
+               "closing connection of pid {}: the largest reply backlog ({} bytes) while replies "
+               "for all clients exceed {} bytes",
+               pid_, pendingBytes_, listener_.options_.replyBytesTotal);
+    listener_.backlogCutoffs_.fetch_add(1, std::memory_order_relaxed);
+    End(/*abnormal=*/true, "reply backlog over the total");
+  }
 
  private:
   void Read() {
@@ -188,15 +208,19 @@ class UnixClientConnection final : public ClientConnection,
 
   void QueueWrite(std::vector<uint8_t> frame) {
     if (ended_) return;
-    pendingBytes_ += frame.size();
-    if (pendingBytes_ > kMaxPendingReplyBytes) {
+    AddPending(static_cast<int64_t>(frame.size()));
+    if (pendingBytes_ > listener_.options_.replyBytesPerConnection) {
       TLOG_ERROR(nullptr, "closing connection of pid {}: {} bytes of replies not read", pid_,
                  pendingBytes_);
+      listener_.backlogCutoffs_.fetch_add(1, std::memory_order_relaxed);
       End(/*abnormal=*/true, "replies not read");
       return;
     }
     writes_.push_back(std::move(frame));
     if (!writing_) WriteNext();
+    if (listener_.totalPendingReplyBytes_ > listener_.options_.replyBytesTotal) {
+      listener_.ShedLargestBacklogs();
+    }
   }
 
   void WriteNext() {
@@ -208,14 +232,14 @@ class UnixClientConnection final : public ClientConnection,
     asio::async_write(socket_, asio::buffer(writes_.front()),
                       [self = shared_from_this()](const asio::error_code& error, size_t) {
                         if (self->ended_) return;
-                        self->pendingBytes_ -= self->writes_.front().size();
+                        self->AddPending(-static_cast<int64_t>(self->writes_.front().size()));
                         self->writes_.pop_front();
                         if (error) {
                           // A client that left without reading its replies: the read side
                           // reports the end.
                           self->writing_ = false;
                           self->writes_.clear();
-                          self->pendingBytes_ = 0;
+                          self->AddPending(-static_cast<int64_t>(self->pendingBytes_));
                           return;
                         }
                         self->WriteNext();
@@ -237,7 +261,15 @@ class UnixClientConnection final : public ClientConnection,
     invalidation_ = nullptr;
     object_.reset();
     writes_.clear();
+    AddPending(-static_cast<int64_t>(pendingBytes_));
     listener_.Forget(self);
+  }
+
+  // Keeps this connection's backlog and the listener's total in step. I/O thread.
+  void AddPending(int64_t bytes) {
+    pendingBytes_ = static_cast<size_t>(static_cast<int64_t>(pendingBytes_) + bytes);
+    listener_.totalPendingReplyBytes_ =
+        static_cast<size_t>(static_cast<int64_t>(listener_.totalPendingReplyBytes_) + bytes);
   }
 
   UnixServiceListener& listener_;
@@ -270,6 +302,10 @@ UnixServiceListener::~UnixServiceListener() {
 }
 
 void UnixServiceListener::Open() {
+  rlimit descriptors{};
+  if (::getrlimit(RLIMIT_NOFILE, &descriptors) == 0 && descriptors.rlim_cur != RLIM_INFINITY) {
+    descriptorLimit_ = static_cast<size_t>(descriptors.rlim_cur);
+  }
   if (options_.allowSocketActivation) {
     const int count = sd_listen_fds(/*unset_environment=*/1);
     if (count > 0) {
@@ -370,6 +406,12 @@ void UnixServiceListener::StartAccept() {
     if (!error) {
       auto connection =
           std::make_shared<UnixClientConnection>(*this, std::move(socket), options_.frameLimit);
+      if (auto refusal = RefusalOf(connection->Uid())) {
+        NoteRefusal(*refusal);
+        connection->CloseUnaccepted();
+        StartAccept();
+        return;
+      }
       {
         std::lock_guard lock(connectionsMutex_);
         connections_.insert(connection);
@@ -383,12 +425,56 @@ void UnixServiceListener::StartAccept() {
       return;
     }
     // Out of descriptors or memory: retry a little later instead of spinning.
-    TLOG_ERROR(nullptr, "accept failed: {}", error.message());
+    NoteRefusal("accept failed: " + error.message());
     auto retry = std::make_shared<asio::steady_timer>(io_, kAcceptRetryDelay);
     retry->async_wait([this, retry](const asio::error_code& waitError) {
       if (!waitError) StartAccept();
     });
   });
+}
+
+std::optional<std::string> UnixServiceListener::RefusalOf(uint32_t uid) {
+  std::lock_guard lock(connectionsMutex_);
+  if (descriptorLimit_ > 0 &&
+      connections_.size() + options_.reservedDescriptors >= descriptorLimit_) {
+    return fmt::format(
+        "connection of uid {} closed: {} connections leave only the {} descriptors "
+        "kept for the service",
+        uid, connections_.size(), options_.reservedDescriptors);
+  }
+  const auto sameUid = std::count_if(connections_.begin(), connections_.end(),
+                                     [uid](const auto& c) { return c->Uid() == uid; });
+  if (static_cast<size_t>(sameUid) >= options_.connectionsPerUid) {
+    return fmt::format("connection of uid {} closed: it has {} open, the limit", uid, sameUid);
+  }
+  return std::nullopt;
+}
+
+void UnixServiceListener::NoteRefusal(const std::string& why) {
+  connectionRefusals_.fetch_add(1, std::memory_order_relaxed);
+  ++refusalsSinceLog_;
+  const auto now = std::chrono::steady_clock::now();
+  if (now - lastRefusalLog_ < kRefusalLogInterval) return;
+  TLOG_ERROR(nullptr, "{} ({} refused or failed since the last such line)", why, refusalsSinceLog_);
+  refusalsSinceLog_ = 0;
+  lastRefusalLog_ = now;
+}
+
+void UnixServiceListener::ShedLargestBacklogs() {
+  while (totalPendingReplyBytes_ > options_.replyBytesTotal) {
+    std::shared_ptr<UnixClientConnection> largest;
+    {
+      std::lock_guard lock(connectionsMutex_);
+      for (const auto& connection : connections_) {
+        if (!connection->Ended() &&
+            (!largest || connection->PendingBytes() > largest->PendingBytes())) {
+          largest = connection;
+        }
+      }
+    }
+    if (!largest || largest->PendingBytes() == 0) return;
+    largest->CutOffForTotalBacklog();
+  }
 }
 
 void UnixServiceListener::Forget(const std::shared_ptr<UnixClientConnection>& connection) {

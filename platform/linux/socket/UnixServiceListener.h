@@ -6,6 +6,7 @@
 #include <functional>
 #include <memory>
 #include <mutex>
+#include <optional>
 #include <set>
 #include <string>
 #include <vector>
@@ -27,6 +28,17 @@ struct UnixListenerOptions {
   uint32_t frameLimit = protocol::kDefaultFrameLimit;
   // Adopt a listening socket passed as descriptor 3 (LISTEN_FDS/LISTEN_PID) when there is one.
   bool allowSocketActivation = true;
+  // Open connections of one peer uid; more are closed as they arrive, so one user cannot take
+  // every descriptor.
+  size_t connectionsPerUid = 256;
+  // Reply bytes waiting for one client that does not read them; past this that client is cut off.
+  size_t replyBytesPerConnection = 4 * 1024 * 1024;
+  // Reply bytes waiting for all clients together; past this the connections with the largest
+  // backlogs are cut off, so that many slow readers cannot exhaust the service's memory.
+  size_t replyBytesTotal = 64 * 1024 * 1024;
+  // Descriptors kept free for the service itself (store, settings, logs): new connections are
+  // closed at once when accepting them would leave fewer.
+  size_t reservedDescriptors = 64;
 };
 
 class UnixClientConnection;
@@ -69,6 +81,12 @@ class UnixServiceListener final : public ServiceListener {
   protocol::RequestLimits RequestLimits() const;
   // Requests refused for being over a request limit.
   uint64_t LimitRefusals() const { return limitRefusals_.load(std::memory_order_relaxed); }
+  // Connections closed on arrival: over the per-uid limit, or into the descriptor reserve.
+  uint64_t ConnectionRefusals() const {
+    return connectionRefusals_.load(std::memory_order_relaxed);
+  }
+  // Connections cut off for their reply backlog (their own, or the largest over the total).
+  uint64_t BacklogCutoffs() const { return backlogCutoffs_.load(std::memory_order_relaxed); }
   // killService requests refused for the peer's uid.
   uint64_t KillRefusals() const { return killRefusals_.load(std::memory_order_relaxed); }
   // Times a connection found the gate closed.
@@ -88,6 +106,12 @@ class UnixServiceListener final : public ServiceListener {
   friend class UnixClientConnection;
   void StartAccept();
   void Forget(const std::shared_ptr<UnixClientConnection>& connection);
+  // Why a connection from `uid` may not be kept, or nothing when it may. I/O thread.
+  std::optional<std::string> RefusalOf(uint32_t uid);
+  // Counts one refused connection or failed accept, with at most one log line per second.
+  void NoteRefusal(const std::string& why);
+  // Cuts off the connections with the largest reply backlogs until the total fits. I/O thread.
+  void ShedLargestBacklogs();
 
   UnixListenerOptions options_;
   asio::io_context io_;
@@ -104,6 +128,12 @@ class UnixServiceListener final : public ServiceListener {
   std::atomic<uint64_t> reporterIDsPerMessage_{
       protocol::RequestLimits::kDefaultReporterIDsPerMessage};
   std::atomic<uint64_t> limitRefusals_{0};
+  std::atomic<uint64_t> connectionRefusals_{0};
+  std::atomic<uint64_t> backlogCutoffs_{0};
+  size_t descriptorLimit_ = 0;         // RLIMIT_NOFILE at Open()
+  size_t totalPendingReplyBytes_ = 0;  // I/O thread
+  uint64_t refusalsSinceLog_ = 0;      // I/O thread
+  std::chrono::steady_clock::time_point lastRefusalLog_{};
   bool socketActivated_ = false;
   bool boundPath_ = false;
   mutable std::mutex connectionsMutex_;
