@@ -16,6 +16,8 @@ packages=(
   libedit-dev
   # private D-Bus daemon for the orientation tests; PipeWire for the counters exporter
   dbus-daemon libpipewire-0.3-dev pipewire
+  # systemd-analyze, which checks the packaged units
+  systemd
 )
 
 missing=()
