@@ -11,10 +11,27 @@
 #include <cstring>
 #include <ctime>
 #include <filesystem>
+#include <thread>
 #include <vector>
 
 namespace tavrin {
 namespace {
+
+// Tries of one batch while another process holds the write lock (each try already waits the busy
+// timeout), and the first pause between them, doubled each time.
+constexpr int kMaxWriteAttempts = 5;
+constexpr auto kFirstRetryDelay = std::chrono::milliseconds(50);
+
+bool IsBusy(int rc) {
+  const int primary = rc & 0xff;
+  return primary == SQLITE_BUSY || primary == SQLITE_LOCKED;
+}
+
+bool NeedsReopen(int rc) {
+  const int primary = rc & 0xff;
+  return primary == SQLITE_READONLY || primary == SQLITE_IOERR || primary == SQLITE_CANTOPEN ||
+         rc == SQLITE_MISUSE;  // no connection: an earlier reopen failed
+}
 
 constexpr const char* kSchema = R"sql(
 CREATE TABLE IF NOT EXISTS sessions(row INTEGER PRIMARY KEY, reporter_id INTEGER,
@@ -380,9 +397,7 @@ void SqliteStore::WriterLoop() {
   }
 }
 
-void SqliteStore::WriteBatch(std::deque<Queued>& batch) {
-  const uint64_t lastSeq = batch.back().seq;
-  const size_t count = batch.size();
+int SqliteStore::TryWriteBatch(const std::deque<Queued>& batch) {
   int rc = db_ ? sqlite3_exec(db_, "BEGIN IMMEDIATE", nullptr, nullptr, nullptr) : SQLITE_MISUSE;
   if (rc == SQLITE_OK) {
     for (const Queued& queued : batch) {
@@ -390,6 +405,40 @@ void SqliteStore::WriteBatch(std::deque<Queued>& batch) {
       if (rc != SQLITE_OK) break;
     }
     if (rc == SQLITE_OK) rc = sqlite3_exec(db_, "COMMIT", nullptr, nullptr, nullptr);
+  }
+  if (rc != SQLITE_OK && db_ && !sqlite3_get_autocommit(db_)) {
+    sqlite3_exec(db_, "ROLLBACK", nullptr, nullptr, nullptr);
+  }
+  return rc;
+}
+
+void SqliteStore::WriteBatch(std::deque<Queued>& batch) {
+  const uint64_t lastSeq = batch.back().seq;
+  const size_t count = batch.size();
+  int rc = TryWriteBatch(batch);
+  // Another process holding the write lock past the busy timeout is a passing condition: the
+  // batch waits for it, backing off, rather than being dropped. Meanwhile the queue fills and its
+  // bound, not this wait, decides what is lost.
+  auto backoff = kFirstRetryDelay;
+  for (int attempt = 1; attempt < kMaxWriteAttempts && IsBusy(rc); ++attempt) {
+    std::this_thread::sleep_for(backoff);
+    backoff *= 2;
+    rc = TryWriteBatch(batch);
+  }
+  // A file that turned read-only or a connection that lost its file (remounted, moved, I/O
+  // errors) may write again through a new connection: reopen once per batch, then retry.
+  if (rc != SQLITE_OK && NeedsReopen(rc)) {
+    std::string reason;
+    const int64_t rowsBefore = lastSessionRow_;  // the numbering was read at the first open
+    CloseDatabase();
+    const int reopened = OpenDatabase(&reason);
+    lastSessionRow_ = rowsBefore;
+    if (reopened == SQLITE_OK) {
+      rc = TryWriteBatch(batch);
+    } else {
+      CloseDatabase();
+      rc = reopened;
+    }
   }
   batch.clear();
   if (rc == SQLITE_OK) {
@@ -403,9 +452,6 @@ void SqliteStore::WriteBatch(std::deque<Queued>& batch) {
     }
   } else {
     const std::string reason = SqliteError(db_, rc);
-    if (db_ && !sqlite3_get_autocommit(db_)) {
-      sqlite3_exec(db_, "ROLLBACK", nullptr, nullptr, nullptr);
-    }
     SetWriteFailing(reason);
     drops_.Dropped(count, fmt::format("writing to the store failed: {}", reason));
   }

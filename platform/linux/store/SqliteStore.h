@@ -39,8 +39,13 @@
 //    it is never deleted or overwritten. It is renamed, with its -wal and -shm files, to
 //    "tavrin.db.corrupt-<YYYYmmddTHHMMSS>" (UTC; ".N" appended if that name is taken) and a fresh
 //    store is started; one error line names both paths. If the rename fails the store stays down.
-//  - A write fails (a full disk, SQLITE_FULL; I/O errors): the batch is rolled back and its
-//    records are counted as dropped; the store reports itself not up until a later batch commits.
+//  - Another process holds the write lock past the busy timeout (SQLITE_BUSY): the batch is
+//    tried again, up to 5 times with a doubling pause, before anything is dropped.
+//  - The file turns read-only, or the connection loses it (remount, I/O errors): the database is
+//    reopened and the batch tried once more, for every batch until it writes again.
+//  - A write still fails (a full disk, SQLITE_FULL; the cases above persisting): the batch is
+//    rolled back and its records are counted as dropped; the store reports itself not up until a
+//    later batch commits, without a restart.
 
 #include <atomic>
 #include <condition_variable>
@@ -132,6 +137,8 @@ class SqliteStore final : public ReportingBackend {
 
   void WriterLoop();
   void WriteBatch(std::deque<Queued>& batch);
+  // One transaction of the whole batch, rolled back on failure; the SQLite result code.
+  int TryWriteBatch(const std::deque<Queued>& batch);
   int WriteRecord(const ReportRecord& record);
   void AnswerFlushes();
   void SetWriteFailing(const std::string& reason);

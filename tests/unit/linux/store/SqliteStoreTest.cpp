@@ -438,6 +438,23 @@ TEST_F(SqliteStoreTest, FullDiskDropsTheBatchTakesTheStoreDownAndItRecoversWhenS
   EXPECT_EQ(reader.Number("SELECT COUNT(*) FROM analytics_events WHERE name = 'small'"), 1);
 }
 
+// Another process holding the write lock past the busy timeout (tavrinctl, sqlite3) used to cost
+// a whole batch; the writer now waits it out with backoff and drops nothing.
+TEST_F(SqliteStoreTest, WriteLockHeldPastTheBusyTimeoutDelaysTheBatchWithoutDroppingIt) {
+  SqliteStoreOptions options = Options();
+  options.busyTimeout = std::chrono::milliseconds(20);
+  SqliteStore store(options);
+  ASSERT_TRUE(store.IsUp());
+  Reader other(DbPath());
+  ASSERT_EQ(other.Exec("BEGIN IMMEDIATE"), SQLITE_OK);
+  for (int i = 0; i < 10; ++i) ASSERT_TRUE(store.Append(Analytics("waiting", {})));
+  std::this_thread::sleep_for(std::chrono::milliseconds(150));  // several busy timeouts
+  ASSERT_EQ(other.Exec("COMMIT"), SQLITE_OK);
+  EXPECT_FALSE(FlushAndWait(store).error);
+  EXPECT_EQ(store.DroppedRecords(), 0u);
+  EXPECT_EQ(other.Number("SELECT COUNT(*) FROM analytics_events"), 10);
+}
+
 // ---- SIGKILL -----------------------------------------------------------------------------------
 
 constexpr const char* kChildDirVariable = "TAVRIN_STORE_CHILD_DIR";
