@@ -263,8 +263,15 @@ int main(int argc, char** argv) {
   }
   // Clients that send faster than the store commits are slowed down through their sockets rather
   // than have their records dropped.
-  listener.SetReadGate(
-      [&] { return dispatcher.QueuedItems() < kMaxQueuedWorkItems && !reporting.Congested(); });
+  listener.SetReadGate([&] {
+    const uint64_t queued = dispatcher.QueuedItems();
+    const double backlog = reporting.BacklogShare();
+    // Far behind, everyone waits; behind, only those who send more than their share, so that
+    // a client making round trips keeps getting answers while another floods.
+    if (queued >= 2 * kMaxQueuedWorkItems || backlog >= 0.75) return ReadGate::kAllWait;
+    if (queued >= kMaxQueuedWorkItems || backlog >= 0.5) return ReadGate::kHeavySendersWait;
+    return ReadGate::kOpen;
+  });
 
   asio::signal_set stopSignals(listener.Io(), SIGTERM, SIGINT);
   stopSignals.async_wait([&](const asio::error_code& waitError, int signal) {

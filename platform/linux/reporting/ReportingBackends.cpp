@@ -277,12 +277,17 @@ void BackendReportingService::ApplyDefaults(const Dictionary& defaults) {
   SetAnalyticsPolicy(enabled, std::move(prefixes));
 }
 
-bool BackendReportingService::Congested() const {
+bool BackendReportingService::Congested() const { return BacklogShare() >= 0.5; }
+
+double BackendReportingService::BacklogShare() const {
+  double share = 0;
   for (const auto& backend : backends_) {
     const size_t capacity = backend->BacklogCapacity();
-    if (capacity > 0 && backend->Backlog() * 2 >= capacity) return true;
+    if (capacity > 0) {
+      share = std::max(share, static_cast<double>(backend->Backlog()) / double(capacity));
+    }
   }
-  return false;
+  return share;
 }
 
 BackendList BackendReportingService::UpBackends() const {

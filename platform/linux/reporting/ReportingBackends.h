@@ -126,9 +126,11 @@ class BackendReportingService final : public TelvoroService,
   // Events turned away by the analytics policy.
   uint64_t AnalyticsFiltered() const { return analyticsFiltered_.load(); }
 
-  // True while some back-end's queue is at least half full: the service then stops reading
+  // True while some back-end's queue is at least half full: the service then reads fewer
   // requests until it drains, so that clients are slowed down instead of losing records.
   bool Congested() const;
+  // The fullest bounded back-end queue, as a share of its capacity (0 when none is bounded).
+  double BacklogShare() const;
 
   // What discovery lists now: the names of the back-ends that are up; nothing when none is.
   BackendList UpBackends() const;

@@ -10,6 +10,7 @@
 #include <algorithm>
 #include <array>
 #include <cerrno>
+#include <cmath>
 #include <deque>
 #include <filesystem>
 #include <system_error>
@@ -28,6 +29,11 @@ constexpr size_t kReadChunk = 16 * 1024;
 constexpr int kListenBacklog = 128;
 // Pause after a failed accept (EMFILE and the like) before trying again.
 constexpr auto kAcceptRetryDelay = std::chrono::milliseconds(100);
+// `value` faded over `elapsed` with the listener's traffic memory.
+double Decayed(double value, std::chrono::steady_clock::duration elapsed) {
+  const double seconds = std::chrono::duration<double>(elapsed).count();
+  return value * std::exp(-seconds / UnixServiceListener::kTrafficMemorySeconds);
+}
 // Refused connections and failed accepts come in crowds: one line per interval, with the count.
 constexpr auto kRefusalLogInterval = std::chrono::seconds(1);
 
@@ -142,7 +148,7 @@ class UnixClientConnection final : public ClientConnection,
   // closed, leaving the rest in the reader.
   void HandleFrames() {
     for (;;) {
-      if (!listener_.MayRead()) {
+      if (!listener_.MayRead(RecentTraffic(0))) {
         listener_.readGateStalls_.fetch_add(1, std::memory_order_relaxed);
         gateTimer_.expires_after(UnixServiceListener::kReadGatePause);
         gateTimer_.async_wait([self = shared_from_this()](const asio::error_code& error) {
@@ -158,9 +164,21 @@ class UnixClientConnection final : public ClientConnection,
         End(/*abnormal=*/true, "bad frame length");
         return;
       }
-      if (!HandleFrame(reader_.Body())) return;
+      const auto body = reader_.Body();
+      RecentTraffic(static_cast<double>(body.size() + protocol::kFrameHeaderSize));
+      if (!HandleFrame(body)) return;
     }
     Read();
+  }
+
+  // This connection's recent bytes, decayed to now, after adding `bytes`; the listener's total
+  // is kept in step, so that the two compare.
+  double RecentTraffic(double bytes) {
+    const auto now = std::chrono::steady_clock::now();
+    recentTraffic_ = Decayed(recentTraffic_, now - trafficStamp_) + bytes;
+    trafficStamp_ = now;
+    if (bytes > 0) listener_.AddTraffic(bytes);
+    return recentTraffic_;
   }
 
   // False when the frame ended the connection.
@@ -276,6 +294,8 @@ class UnixClientConnection final : public ClientConnection,
   Socket socket_;
   protocol::FrameReader reader_;
   asio::steady_timer gateTimer_;
+  double recentTraffic_ = 0;
+  std::chrono::steady_clock::time_point trafficStamp_{};
   std::array<uint8_t, kReadChunk> buffer_{};
   int32_t pid_ = 0;
   uint32_t uid_ = 0;
@@ -372,6 +392,25 @@ void UnixServiceListener::Stop() {
     for (const auto& connection : open) connection->Close();
     io_.stop();
   });
+}
+
+bool UnixServiceListener::MayRead(double connectionRate) {
+  const ReadGate gate = readGate_ ? readGate_() : ReadGate::kOpen;
+  if (gate == ReadGate::kOpen) return true;
+  if (gate == ReadGate::kAllWait) return false;
+  size_t connections;
+  {
+    std::lock_guard lock(connectionsMutex_);
+    connections = connections_.size();
+  }
+  return connectionRate * static_cast<double>(connections) <= AddTraffic(0);
+}
+
+double UnixServiceListener::AddTraffic(double bytes) {
+  const auto now = std::chrono::steady_clock::now();
+  recentTraffic_ = Decayed(recentTraffic_, now - trafficStamp_) + bytes;
+  trafficStamp_ = now;
+  return recentTraffic_;
 }
 
 void UnixServiceListener::SetKillUids(std::vector<uint32_t> uids) {

@@ -43,6 +43,16 @@ struct UnixListenerOptions {
 
 class UnixClientConnection;
 
+// What the read gate says about reading the next request.
+enum class ReadGate {
+  kOpen,
+  // The service falls behind: connections that send more than their share (their recent bytes
+  // above the mean of all connections) wait; the others, round trips among them, go on.
+  kHeavySendersWait,
+  // The service is far behind: every connection waits.
+  kAllWait,
+};
+
 // The service's listening socket: a unix-domain stream socket speaking the framed MessagePack
 // protocol. One I/O thread — the one that calls Resume() — accepts connections, reads and decodes
 // requests, calls the exported object and writes replies; replies may be produced on any thread.
@@ -66,10 +76,12 @@ class UnixServiceListener final : public ServiceListener {
   const std::string& SocketPath() const { return options_.socketPath; }
 
   void SetDelegate(ServiceListenerDelegate* delegate) override;
-  // Asked before each request is decoded, on the I/O thread; while it answers false, connections
-  // leave their requests unread (clients see their sockets fill up and slow down) and ask again
-  // after kReadGatePause. Set before Resume().
-  void SetReadGate(std::function<bool()> mayRead) { readGate_ = std::move(mayRead); }
+  // Asked before each request is decoded, on the I/O thread; a connection that must wait leaves
+  // its requests unread (its client sees the socket fill up and slows down) and asks again after
+  // kReadGatePause. Set before Resume().
+  void SetReadGate(std::function<ReadGate()> gate) { readGate_ = std::move(gate); }
+  // How fast recent traffic fades from a connection's share: bytes of the last few seconds count.
+  static constexpr double kTrafficMemorySeconds = 1.0;
   // Short enough to add little latency once the gate opens, long enough not to spin the thread.
   static constexpr auto kReadGatePause = std::chrono::milliseconds(1);
   // Besides root and the service's own uid, the peers whose killService is honoured; anyone else
@@ -116,10 +128,15 @@ class UnixServiceListener final : public ServiceListener {
   UnixListenerOptions options_;
   asio::io_context io_;
   asio::local::stream_protocol::acceptor acceptor_;
-  bool MayRead() const { return !readGate_ || readGate_(); }
+  // Whether a connection whose recent traffic is `connectionRate` may read now. I/O thread.
+  bool MayRead(double connectionRate);
+  // Adds `bytes` read now to the listener's recent traffic and returns it decayed to now.
+  double AddTraffic(double bytes);
 
   ServiceListenerDelegate* delegate_ = nullptr;
-  std::function<bool()> readGate_;
+  std::function<ReadGate()> readGate_;
+  double recentTraffic_ = 0;  // I/O thread: decayed bytes of all connections
+  std::chrono::steady_clock::time_point trafficStamp_{};
   std::atomic<uint64_t> readGateStalls_{0};
   mutable std::mutex killUidsMutex_;
   std::vector<uint32_t> killUids_;  // guarded by killUidsMutex_

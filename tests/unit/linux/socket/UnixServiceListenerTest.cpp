@@ -72,7 +72,7 @@ TEST(UnixServiceListenerTest, ClosedReadGateHoldsRequestsBackAndLosesNoneWhenItO
   ExportingDelegate delegate(object);
   listener.SetDelegate(&delegate);
   std::atomic<bool> open{false};
-  listener.SetReadGate([&] { return open.load(); });
+  listener.SetReadGate([&] { return open.load() ? ReadGate::kOpen : ReadGate::kAllWait; });
   std::thread io([&] { listener.Resume(); });
 
   constexpr int kMessages = 2000;
@@ -103,6 +103,49 @@ TEST(UnixServiceListenerTest, ClosedReadGateHoldsRequestsBackAndLosesNoneWhenItO
     auto reply = client.Read();
     ASSERT_TRUE(reply);
     EXPECT_EQ(reply->call, 7u);
+  }
+  listener.Stop();
+  io.join();
+  std::filesystem::remove_all(directory);
+}
+
+// While the service is behind, a client that floods waits and one that makes round trips does
+// not: with every connection paused, the round trips would stall until the flood drained.
+TEST(UnixServiceListenerTest, BehindOnlyTheHeavySenderWaitsAndRoundTripsGoOn) {
+  testing::FakeLogSystem log;
+  const std::string directory = testing::MakeTempDirectory("tavrin-listener-");
+  UnixServiceListener listener(UnixListenerOptions{directory + "/reporting.sock"});
+  listener.Open();
+  auto object = std::make_shared<RecordingObject>();
+  ExportingDelegate delegate(object);
+  listener.SetDelegate(&delegate);
+  std::atomic<bool> behind{false};
+  listener.SetReadGate([&] { return behind ? ReadGate::kHeavySendersWait : ReadGate::kOpen; });
+  std::thread io([&] { listener.Resume(); });
+  {
+    testing::TestClient flooder(listener.SocketPath());
+    testing::TestClient asker(listener.SocketPath());
+    const Dictionary payload{{"filler", std::string(512, 'x')}};
+    for (int i = 0; i < 200; ++i) flooder.SendNoReply(protocol::SendMessage{payload, 1, 0, {}});
+    ASSERT_TRUE(testing::WaitUntil([&] { return object->Categories().size() == 200; }));
+    behind = true;
+    std::atomic<bool> stop{false};
+    std::thread flood([&] {
+      while (!stop && flooder.SendNoReply(protocol::SendMessage{payload, 1, 0, {}})) {
+      }
+    });
+    uint64_t answered = 0;
+    for (uint64_t call = 1; call <= 50; ++call) {
+      asker.Send(call, protocol::GetAllReporters{});
+      if (!asker.Read(std::chrono::seconds(5))) break;
+      ++answered;
+    }
+    const uint64_t stalls = listener.ReadGateStalls();
+    stop = true;
+    behind = false;  // lets a send blocked on a full socket finish
+    flood.join();
+    EXPECT_EQ(answered, 50u) << "round trips stalled behind the flood";
+    EXPECT_GT(stalls, 0u) << "the flooder never waited";
   }
   listener.Stop();
   io.join();
