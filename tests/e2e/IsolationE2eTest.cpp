@@ -67,6 +67,8 @@ TEST_F(IsolationE2eTest, FilesAreClosedToOtherUsersAndTheSocketToOtherGroups) {
   OpenPathTo(service);
   EXPECT_EQ(Mode(service.SocketPath()), 0660u);
   EXPECT_EQ(Mode(service.root() + "/lib"), 0750u);
+  // The store opens after the socket is listening.
+  EXPECT_TRUE(testing::WaitUntil([&] { return Mode(service.DatabasePath()) != 0xFFFFu; }));
   EXPECT_EQ(Mode(service.DatabasePath()), 0640u);
 
   const std::string socketPath = service.SocketPath();
