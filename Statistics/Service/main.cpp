@@ -86,6 +86,7 @@ struct ListenerSettings {
   tavrin::protocol::RequestLimits limits;
   std::vector<uint32_t> killUids;  // besides root and the service's own uid
   // Read once, at start.
+  uint64_t frameBytes = tavrin::protocol::kDefaultFrameLimit;
   uint64_t connectionsPerUid = tavrin::UnixListenerOptions{}.connectionsPerUid;
   uint64_t replyBytesPerConnection = tavrin::UnixListenerOptions{}.replyBytesPerConnection;
   uint64_t replyBytesTotal = tavrin::UnixListenerOptions{}.replyBytesTotal;
@@ -114,6 +115,8 @@ ListenerSettings ReadListenerSettings(const tavrin::Dictionary& defaults) {
             settings.limits.entriesPerFrame);
   readCount("reporter_ids_per_message", RequestLimits::kMinReporterIDsPerMessage,
             settings.limits.reporterIDsPerMessage);
+  readCount("frame_bytes", 64 * 1024, settings.frameBytes);
+  settings.frameBytes = std::min<uint64_t>(settings.frameBytes, UINT32_MAX);
   readCount("connections_per_uid", 8, settings.connectionsPerUid);
   readCount("reply_bytes_per_connection", 64 * 1024, settings.replyBytesPerConnection);
   readCount("reply_bytes_total", 1024 * 1024, settings.replyBytesTotal);
@@ -199,6 +202,7 @@ int main(int argc, char** argv) {
 
   const ListenerSettings startSettings = ReadListenerSettings(defaults.Read());
   UnixListenerOptions listenerOptions{options.socket, socketMode};
+  listenerOptions.frameLimit = static_cast<uint32_t>(startSettings.frameBytes);
   listenerOptions.connectionsPerUid = startSettings.connectionsPerUid;
   listenerOptions.replyBytesPerConnection = startSettings.replyBytesPerConnection;
   listenerOptions.replyBytesTotal = startSettings.replyBytesTotal;

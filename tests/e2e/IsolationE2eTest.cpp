@@ -169,6 +169,22 @@ TEST(IsolationLimitsE2eTest, WideFramesAndLongReporterListsAreRefusedWithoutStal
   EXPECT_EQ(service.LogCount("refused request from pid"), 2u) << service.Log();
 }
 
+// The frame limit is a setting: a frame over it ends the connection, one under it is answered.
+TEST(IsolationLimitsE2eTest, FrameLimitComesFromTheSettings) {
+  TavrindProcess service;
+  testing::WriteFileAtomically(service.DefaultsPath(), "[limits]\nframe_bytes = 70000\n");
+  ASSERT_TRUE(service.Start()) << service.Log();
+  auto sendOfSize = [&](size_t text) {
+    TestClient client(service.SocketPath());
+    client.Send(
+        1, protocol::SendMessage{Dictionary{{"t", std::string(text, 'x')}}, 1, 0, std::nullopt});
+    return client.Read(std::chrono::seconds(2)).has_value();
+  };
+  EXPECT_TRUE(sendOfSize(69'000));
+  EXPECT_FALSE(sendOfSize(71'000));
+  EXPECT_TRUE(service.WaitForLog("outside 1..70000")) << service.Log();
+}
+
 // Peak resident memory of a process, from /proc.
 size_t PeakRssBytes(pid_t pid) {
   std::ifstream status("/proc/" + std::to_string(pid) + "/status");
