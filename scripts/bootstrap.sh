@@ -12,8 +12,8 @@ packages=(
   # libraries of the service
   libasio-dev libspdlog-dev libfmt-dev libsystemd-dev systemtap-sdt-dev libtomlplusplus-dev
   nlohmann-json3-dev libsqlite3-dev sqlite3 librdkafka-dev libsdbus-c++-dev libcli11-dev
-  # line editing and history for tavrinctl's shell
-  libedit-dev
+  # line editing and history for tavrinctl's shell; the real-time send's lock-free queue
+  libedit-dev libreaderwriterqueue-dev
   # private D-Bus daemon for the orientation tests; PipeWire for the counters exporter
   dbus-daemon libpipewire-0.3-dev pipewire
   # systemd-analyze, which checks the packaged units

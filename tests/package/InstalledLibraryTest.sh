@@ -22,7 +22,8 @@ cp -r "$source_dir/docs/example" "$work/example"
 cmake -S "$work/example" -B "$work/example/build" -G Ninja -DCMAKE_PREFIX_PATH="$work/prefix" \
   >/dev/null
 cmake --build "$work/example/build" >/dev/null
-PKG_CONFIG_PATH="$libdir/pkgconfig" make -s -C "$work/example" report_xruns >/dev/null
+PKG_CONFIG_PATH="$libdir/pkgconfig" make -s -C "$work/example" report_xruns render_callback \
+  >/dev/null
 
 "$build_dir/tavrind" --root "$work/root" >"$work/tavrind.log" 2>&1 &
 service=$!
@@ -36,10 +37,20 @@ for program in "$work/example/build/report_xruns" "$work/example/report_xruns"; 
   case "$output" in "reported 4 messages as reporter "*) ;; *) exit 1 ;; esac
 done
 
+# The C example: every report of its 20 buffers reaches the service.
+for program in "$work/example/build/render_callback" "$work/example/render_callback"; do
+  output=$(LD_LIBRARY_PATH="$libdir" "$program" "$socket")
+  echo "$output"
+  [ "$output" = "rendered 20 buffers, 20 reports sent, 0 dropped" ] || exit 1
+done
+
 kill -TERM "$service"
 wait "$service"
 service=
 rows=$(sqlite3 "$work/root/lib/tavrin.db" \
   "SELECT count(*) FROM session_messages WHERE category = 2 AND type = 1")
 [ "$rows" = 8 ] || { echo "expected 8 rows from the two runs, found $rows"; exit 1; }
+rendered=$(sqlite3 "$work/root/lib/tavrin.db" \
+  "SELECT count(*) FROM session_messages WHERE category = 2 AND type = 3")
+[ "$rendered" = 40 ] || { echo "expected 40 rows from the C example, found $rendered"; exit 1; }
 echo "installed package: CMake and pkg-config builds ran; $rows rows in the store"
