@@ -30,6 +30,13 @@ using testing::TestClient;
 
 constexpr uid_t kOtherUid = 65534;  // nobody
 
+// Timing bounds are for the optimised build; the sanitizer builds run about ten times slower.
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+constexpr std::chrono::seconds kSlowBuild{10};
+#else
+constexpr std::chrono::seconds kSlowBuild{1};
+#endif
+
 unsigned Mode(const std::string& path) {
   struct stat info {};
   return ::stat(path.c_str(), &info) == 0 ? (info.st_mode & 07777) : 0xFFFFu;
@@ -164,8 +171,8 @@ TEST(IsolationLimitsE2eTest, WideFramesAndLongReporterListsAreRefusedWithoutStal
     EXPECT_EQ(refusal->value.value("domain", ""), protocol::kLimitsErrorDomain);
     EXPECT_EQ(refusal->value.value("code", 0), static_cast<int64_t>(code));
   }
-  EXPECT_LT(std::chrono::steady_clock::now() - started, std::chrono::seconds(1));
-  EXPECT_LT(worstRoundTrip, std::chrono::milliseconds(50));
+  EXPECT_LT(std::chrono::steady_clock::now() - started, 1 * kSlowBuild);
+  EXPECT_LT(worstRoundTrip, std::chrono::milliseconds(50) * kSlowBuild.count());
   EXPECT_EQ(service.LogCount("refused request from pid"), 2u) << service.Log();
 }
 
@@ -240,35 +247,40 @@ TEST(IsolationLimitsE2eTest, ConnectionCrowdsAreCutAtThePerUidLimitAndTheDescrip
 }
 
 // Clients that send requests and never read their replies once took the service to 2.8 GB and
-// SIGABRT. Each backlog is bounded, and so is their total: the largest backlogs are cut off.
+// SIGABRT. Each backlog is bounded, and so is their total: the largest backlogs are cut off. The
+// total is lowered here to 1 MiB so that 200 silent clients overrun it
+// with a fraction of the work the defaults would need. Each asks for about 360 KB of replies,
+// more than its socket's kernel buffer takes, so backlogs build up in the service.
 TEST(IsolationLimitsE2eTest, ManyClientsThatNeverReadCannotExhaustTheService) {
   TavrindProcess service;
-  testing::WriteFileAtomically(service.DefaultsPath(), "[limits]\nconnections_per_uid = 1000\n");
+  testing::WriteFileAtomically(
+      service.DefaultsPath(),
+      "[limits]\nconnections_per_uid = 1000\nreply_bytes_total = 1048576\n");
   ASSERT_TRUE(service.Start()) << service.Log();
   TestClient owner(service.SocketPath());
-  for (int64_t id = 1; id <= 2000; ++id) owner.SendNoReply(protocol::CreateReportingSession{id});
+  // Reporter IDs of nine bytes each: every reply below lists 2,000 of them, about 18 KB.
+  for (int64_t id = 1; id <= 2000; ++id) {
+    owner.SendNoReply(protocol::CreateReportingSession{(int64_t{1} << 40) + id});
+  }
   owner.Send(1, protocol::GetAllReporters{});
-  ASSERT_TRUE(owner.Read()) << service.Log();  // every reply now lists 2,000 reporters
+  ASSERT_TRUE(owner.Read()) << service.Log();
 
   std::vector<std::unique_ptr<TestClient>> silent;
-  for (int i = 0; i < 400; ++i) {
+  for (int i = 0; i < 200; ++i) {
     silent.push_back(std::make_unique<TestClient>(service.SocketPath()));
-    for (uint64_t call = 1; call <= 100; ++call) {
+    for (uint64_t call = 1; call <= 20; ++call) {
       silent.back()->Send(call, protocol::GetAllReporters{});
     }
   }
   TestClient newcomer(service.SocketPath());
   const auto started = std::chrono::steady_clock::now();
   newcomer.Send(1, protocol::GetAllReporters{});
-  auto reply = newcomer.Read();
+  auto reply = newcomer.Read(std::chrono::seconds(60));
   ASSERT_TRUE(reply) << service.Log();
   EXPECT_EQ(reply->status, protocol::Status::kOk);
-  EXPECT_LT(std::chrono::steady_clock::now() - started, std::chrono::seconds(5));
+  EXPECT_LT(std::chrono::steady_clock::now() - started, 5 * kSlowBuild);
   EXPECT_LT(PeakRssBytes(service.pid()), size_t{512} << 20);
-  EXPECT_GT(
-      service.LogCount("bytes of replies not read") + service.LogCount("the largest reply backlog"),
-      0u)
-      << "no backlog was ever cut off";
+  EXPECT_GT(service.LogCount("the largest reply backlog"), 0u) << "the total was never enforced";
 }
 
 // Settings fail closed: a file that does not parse never turns reporting back on.
