@@ -13,8 +13,6 @@ namespace tavrin {
 // thread priority where the implementation has one.
 enum class QualityOfService { kUserInteractive, kUserInitiated, kDefault, kUtility, kBackground };
 
-std::string_view QualityOfServiceName(QualityOfService qos);
-
 using Work = std::function<void()>;
 
 // A queue of work items. Work never runs on the caller's stack: Async returns at once.

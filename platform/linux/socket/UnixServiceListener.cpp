@@ -434,11 +434,6 @@ bool UnixServiceListener::MayKill(uint32_t uid) const {
   return std::find(killUids_.begin(), killUids_.end(), uid) != killUids_.end();
 }
 
-size_t UnixServiceListener::ConnectionCount() const {
-  std::lock_guard lock(connectionsMutex_);
-  return connections_.size();
-}
-
 void UnixServiceListener::StartAccept() {
   acceptor_.async_accept([this](const asio::error_code& error, Socket socket) {
     if (error == asio::error::operation_aborted) return;

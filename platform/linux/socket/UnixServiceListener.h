@@ -111,9 +111,6 @@ class UnixServiceListener final : public ServiceListener {
   // The I/O loop, for other watchers that want to run on the listener's thread.
   asio::io_context& Io() { return io_; }
 
-  // Connections open now (for tests and status lines).
-  size_t ConnectionCount() const;
-
  private:
   friend class UnixClientConnection;
   void StartAccept();
