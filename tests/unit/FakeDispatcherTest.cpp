@@ -186,40 +186,5 @@ TEST(FakeDispatcherTest, RearmedOrCancelledTimerNeverRunsEarlierWork) {
   EXPECT_EQ(dispatcher.TimerDelays().size(), 6u);
 }
 
-TEST(FakeDispatcherTest, WorkOfferedAfterTheDispatcherIsGoneIsDropped) {
-  SerialQueuePtr queue;
-  int runs = 0;
-  {
-    FakeDispatcher dispatcher;
-    queue = dispatcher.CreateSerialQueue("q", QualityOfService::kDefault);
-    queue->Async([&] { ++runs; });
-  }
-  queue->Async([&] { ++runs; });
-  queue->Suspend();
-  queue->Resume();
-  EXPECT_EQ(runs, 0);
-}
-
-TEST(FakeClockAndRandomTest, MoveOnlyAsToldAndCheckTheirContracts) {
-  FakeClock clock;
-  EXPECT_EQ(std::chrono::duration_cast<seconds>(clock.WallNow().time_since_epoch()).count(),
-            1794806865);  // 2026-11-16 05:27:45 UTC
-  const SteadyTime before = clock.Now();
-  clock.Advance(seconds(59));
-  EXPECT_EQ(clock.Now() - before, seconds(59));
-  EXPECT_NONFATAL_FAILURE(clock.Advance(seconds(-1)), "negative");
-  EXPECT_EQ(clock.Now() - before, seconds(59));
-
-  FakeRandom random(7);
-  random.Script({3, 0});
-  EXPECT_EQ(random.UniformBelow(10), 3u);
-  EXPECT_EQ(random.UniformBelow(5), 0u);
-  EXPECT_EQ(random.UniformBelow(100), 7u);
-  EXPECT_EQ(random.Bounds(), (std::vector<uint64_t>{10, 5, 100}));
-  random.Script({9});
-  EXPECT_NONFATAL_FAILURE(EXPECT_EQ(random.UniformBelow(4), 3u), "scripted 9");
-  EXPECT_NONFATAL_FAILURE(random.UniformBelow(0), "bound must be positive");
-}
-
 }  // namespace
 }  // namespace tavrin::testing

@@ -34,18 +34,6 @@ std::string ReadFile(const std::string& path) {
 
 // --- Names and the writer ---
 
-TEST(CounterWriterTest, SanitizedNamesAreSafeVisibleFileNames) {
-  EXPECT_EQ(CounterWriter::SanitizeName("alsa_output.pci-0000_00_1f.3.analog-stereo"),
-            "alsa_output.pci-0000_00_1f.3.analog-stereo");
-  EXPECT_EQ(CounterWriter::SanitizeName("Firefox: Audio/Video"), "Firefox__Audio_Video");
-  EXPECT_EQ(CounterWriter::SanitizeName(".."), "_.");
-  EXPECT_EQ(CounterWriter::SanitizeName(".hidden"), "_hidden");
-  EXPECT_EQ(CounterWriter::SanitizeName(""), "unnamed");
-  EXPECT_EQ(CounterWriter::SanitizeName("h\xc3\xa9llo\n"), "h__llo_");
-  EXPECT_EQ(CounterWriter::SanitizeName(std::string(500, 'x')).size(),
-            CounterWriter::kMaxNameBytes);
-}
-
 TEST(CounterWriterTest, WritesReplaceAtomicallyAndTheServiceReadsThem) {
   TempCountersTree tree;
   CounterWriter writer(tree.root());
@@ -151,17 +139,6 @@ TEST(ProfilerCountersTest, SumsMaximaIncompleteCyclesAndXruns) {
                                                {"Dummy-Driver/cycles", 3},
                                                {"Dummy-Driver/wakeup_ns_total", 160},
                                            }));
-}
-
-TEST(ProfilerCountersTest, NodesBeyondTheCapAreCountedAsDropped) {
-  ProfilerCounters counters;
-  for (size_t i = 0; i < ProfilerCounters::kMaxNodes + 3; ++i) {
-    ProfileCycle cycle;
-    cycle.driver = Node("stream-" + std::to_string(i), 1, 2, 3);
-    counters.Add(cycle);
-  }
-  EXPECT_EQ(counters.nodeCount(), ProfilerCounters::kMaxNodes);
-  EXPECT_EQ(counters.droppedNodes(), 3u);
 }
 
 // --- Decoding profiler pods ---

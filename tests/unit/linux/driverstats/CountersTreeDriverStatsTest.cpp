@@ -200,24 +200,6 @@ TEST_F(CountersTreeDriverStatsTest, NamesThatWouldLeaveTheRootMatchNothing) {
   }
 }
 
-TEST_F(CountersTreeDriverStatsTest, DotfilesSpecialFilesAndDeeperLevelsAreNotChannels) {
-  tree.write("G/real", 1);
-  tree.write("G/.real.tmp", 99);  // an exporter's temporary file
-  tree.write("G/.hidden/c", 99);  // a hidden subgroup
-  tree.write("G/S/c", 2);
-  tree.write("G/S/too/deep", 99);
-  tree.write("loose", 99);  // directly under the root: no group
-  ASSERT_EQ(::mkfifo(tree.path("G/fifo").c_str(), 0644), 0);
-
-  OptionalError error;
-  auto channels = service.CopyChannelsInGroup(std::nullopt, std::nullopt, 0, &error);
-  ASSERT_TRUE(channels);
-  EXPECT_FALSE(error);
-  EXPECT_EQ(Rows(*channels),
-            (std::vector<ChannelRow>{{"G", "", "real", "G/real"}, {"G", "S", "c", "G/S/c"}}));
-  EXPECT_GE(service.drops().ignoredEntries, 3u);  // fifo, too/, loose
-}
-
 TEST_F(CountersTreeDriverStatsTest, LinksInsideTheRootAreFollowedLinksOutAreIgnored) {
   tree.write("PipeWire/alsa_output.card0/xruns", 12);
   tree.link("PipeWire/alsa_output.card0", "Speaker");                   // group alias, relative
@@ -247,17 +229,6 @@ TEST_F(CountersTreeDriverStatsTest, LinksInsideTheRootAreFollowedLinksOutAreIgno
   DriverChannels subscribed;
   const auto handle = Subscribe("Speaker", std::nullopt, &subscribed);
   EXPECT_EQ(Sample(handle, subscribed), (std::map<std::string, int64_t>{{"xruns", 12}}));
-}
-
-TEST_F(CountersTreeDriverStatsTest, ChannelRetargetedOutOfTheRootAfterSubscribingIsNotRead) {
-  tree.write("G/c", 1);
-  DriverChannels subscribed;
-  const auto handle = Subscribe("G", std::nullopt, &subscribed);
-  std::ofstream(tree.outside() + "/secret") << "1234\n";
-  tree.remove("G/c");
-  tree.link(tree.outside() + "/secret", "G/c");
-  EXPECT_TRUE(Sample(handle, subscribed).empty());
-  EXPECT_EQ(log.Count("G/c: the link leads out of the counters tree", LogLevel::kError), 1u);
 }
 
 TEST_F(CountersTreeDriverStatsTest, EverySampleReadsTheFileAfreshAfterAtomicReplacement) {
@@ -317,26 +288,6 @@ TEST_F(CountersTreeDriverStatsTest, RootRemovedAfterSubscribingIsAnErrorOfCreate
   EXPECT_EQ(service.CreateSamples(handle, subscribed, &error), std::nullopt);
   ASSERT_TRUE(error);
   EXPECT_EQ(error->code, ENOENT);
-}
-
-TEST_F(CountersTreeDriverStatsTest, HandlesAndDescriptionsNotIssuedHereAreRejected) {
-  tree.write("G/a", 1);
-  DriverChannels subscribed;
-  const auto handle = Subscribe("G", std::nullopt, &subscribed);
-  OptionalError error;
-  EXPECT_EQ(service.CreateSamples(0, subscribed, &error), std::nullopt);
-  EXPECT_EQ(error->code, EINVAL);
-  error.reset();
-  EXPECT_EQ(service.CreateSamples(handle + 1000, subscribed, &error), std::nullopt);
-  EXPECT_EQ(error->code, EINVAL);
-  error.reset();
-  EXPECT_EQ(service.CreateSamples(handle, Value{{"nope", 1}}, &error), std::nullopt);
-  EXPECT_EQ(error->code, EINVAL);
-
-  DriverChannels none;
-  EXPECT_EQ(service.CreateSubscription(Value::array(), &none, 0), 0u);
-  EXPECT_EQ(service.ChannelCount(none), 0);
-  EXPECT_EQ(service.ChannelCount(Value("not a dictionary")), 0);
 }
 
 TEST_F(CountersTreeDriverStatsTest, TamperedChannelPathsNeverReadOutsideTheRoot) {
@@ -419,51 +370,6 @@ TEST_F(CountersTreeDriverStatsTest, DeltaRejectsMalformedSetsAndSkipsOverflow) {
   EXPECT_EQ(Values(service, *delta), (std::map<std::string, int64_t>{{"b", 2}}));
   EXPECT_EQ(service.drops().overflowedDeltas, 1u);
   EXPECT_EQ(log.Count("does not fit 64 bits", LogLevel::kError), 1u);
-}
-
-TEST_F(CountersTreeDriverStatsTest, IterationStopsWhenTheVisitorSaysSoAndSkipsNonSamples) {
-  const DriverSampleSet set{{"samples",
-                             {{{"name", "a"}, {"value", 1}},
-                              {{"value", 2}},
-                              {{"name", "junk"}, {"value", "x"}},
-                              {{"name", "c"}, {"value", 3}},
-                              {{"name", "d"}, {"value", 4}}}}};
-  std::vector<std::pair<std::optional<std::string>, int64_t>> seen;
-  service.IterateSamples(set, [&](const DriverSample& sample) {
-    seen.emplace_back(service.SampleChannelName(sample), service.SampleIntegerValue(sample));
-    return seen.size() == 3 ? 1 : 0;
-  });
-  EXPECT_EQ(seen, (std::vector<std::pair<std::optional<std::string>, int64_t>>{
-                      {"a", 1}, {std::nullopt, 2}, {"c", 3}}));
-  int calls = 0;
-  service.IterateSamples(Value("nothing"), [&](const DriverSample&) { return ++calls, 0; });
-  EXPECT_EQ(calls, 0);
-}
-
-TEST_F(CountersTreeDriverStatsTest, QueriesAreCappedAndTheCapIsReported) {
-  for (size_t i = 0; i <= CountersTreeDriverStats::kMaxChannelsPerQuery; ++i) {
-    tree.write("Big/c" + std::to_string(i), "1");
-  }
-  OptionalError error;
-  auto channels = service.CopyChannelsInGroup("Big", std::nullopt, 0, &error);
-  ASSERT_TRUE(channels);
-  EXPECT_EQ(size_t(service.ChannelCount(*channels)), CountersTreeDriverStats::kMaxChannelsPerQuery);
-  EXPECT_EQ(service.drops().truncatedQueries, 1u);
-  EXPECT_EQ(log.Count("only the first 4096 are used", LogLevel::kError), 1u);
-}
-
-TEST_F(CountersTreeDriverStatsTest, UnlistableSubgroupGivesTheRestAndTheFirstError) {
-  if (::geteuid() == 0) GTEST_SKIP() << "root reads any directory";
-  tree.write("G/a", 1);
-  tree.write("G/Locked/b", 2);
-  ASSERT_EQ(::chmod(tree.path("G/Locked").c_str(), 0), 0);
-  OptionalError error;
-  auto channels = service.CopyChannelsInGroup("G", std::nullopt, 0, &error);
-  ::chmod(tree.path("G/Locked").c_str(), 0755);
-  ASSERT_TRUE(channels);
-  EXPECT_EQ(service.ChannelCount(*channels), 1);
-  ASSERT_TRUE(error);
-  EXPECT_EQ(error->code, EACCES);
 }
 
 // Writers replace files by rename while the service samples from several threads: every sample

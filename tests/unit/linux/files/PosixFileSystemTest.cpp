@@ -148,31 +148,6 @@ TEST_F(PosixFileSystemTest, ReadersSeeTheOldOrTheWholeNewFile) {
   EXPECT_GT(reads.load(), 0);
 }
 
-TEST_F(PosixFileSystemTest, WriteBelowARegularFileFailsCleanly) {
-  { std::ofstream(dir_ / "plain") << "x"; }
-  const OptionalError error =
-      fileSystem_.WriteFileAtomically((dir_ / "plain" / "file.json").string(), "data");
-  ASSERT_TRUE(error.has_value());
-  EXPECT_EQ(error->domain, kPosixErrorDomain);
-  EXPECT_EQ(error->code, ENOTDIR);
-  EXPECT_NE(error->description.find(std::strerror(ENOTDIR)), std::string::npos);
-  EXPECT_EQ(Entries(dir_), std::vector<std::string>{"plain"});
-  EXPECT_EQ(Contents(dir_ / "plain"), "x");
-}
-
-TEST_F(PosixFileSystemTest, FailedRenameRemovesTheTemporaryFile) {
-  // A non-empty directory where the file should go: the temporary is written, the rename fails.
-  const fs::path target = dir_ / "taken";
-  fs::create_directory(target);
-  { std::ofstream(target / "inside") << "keep"; }
-  const OptionalError error = fileSystem_.WriteFileAtomically(target.string(), "data");
-  ASSERT_TRUE(error.has_value());
-  EXPECT_EQ(error->code, EISDIR);
-  EXPECT_NE(error->description.find(target.string()), std::string::npos) << error->description;
-  EXPECT_EQ(Entries(dir_), std::vector<std::string>{"taken"});
-  EXPECT_EQ(Contents(target / "inside"), "keep");
-}
-
 TEST_F(PosixFileSystemTest, FailedWriteRemovesTheTemporaryAndKeepsTheOldFile) {
   // A file-size limit makes write() fail half way, for root too. Set in a child so the limit
   // cannot touch anything else in this process.

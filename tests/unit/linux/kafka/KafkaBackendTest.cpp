@@ -345,28 +345,5 @@ TEST_F(KafkaBackendTest, ShutdownWithTheBrokerDownGivesUpAfterItsBoundAndCountsT
   EXPECT_EQ(backend.DroppedRecords(), 5u);
 }
 
-TEST_F(KafkaBackendTest, ConcurrentProducersLoseNothing) {
-  KafkaProducerBackend backend(Options());
-  constexpr int kThreads = 3;
-  constexpr int kPerThread = 400;
-  std::vector<std::thread> producers;
-  for (int t = 0; t < kThreads; ++t) {
-    producers.emplace_back([&, t] {
-      for (int i = 0; i < kPerThread; ++i) {
-        EXPECT_TRUE(backend.Append(std::make_shared<const ReportRecord>(
-            SessionMessageRecord{t, t, 1, 1, {{"i", i}}, 0.0})));
-      }
-    });
-  }
-  for (auto& producer : producers) producer.join();
-  EXPECT_FALSE(FlushAndWait(backend).error);
-  EXPECT_EQ(backend.Stats().committed, uint64_t(kThreads * kPerThread));
-  std::map<std::string, int> perKey;
-  for (const auto& consumed : Consume(Topic("session_messages"), kThreads * kPerThread)) {
-    ++perKey[consumed.key.value_or("none")];
-  }
-  EXPECT_EQ(perKey, (std::map<std::string, int>{{"0", 400}, {"1", 400}, {"2", 400}}));
-}
-
 }  // namespace
 }  // namespace tavrin

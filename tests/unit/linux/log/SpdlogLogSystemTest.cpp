@@ -114,30 +114,6 @@ class SpdlogLogSystemTest : public ::testing::Test {
   SpdlogLogSystem system_{defaults_, sink_};
 };
 
-TEST_F(SpdlogLogSystemTest, RegistrationKeepsWhatItWasGivenAndNamesTheLogger) {
-  LogHandle handle = RegisterServerScope();
-  ASSERT_NE(handle, nullptr);
-  const auto* scope = dynamic_cast<SpdlogLogSystem::Scope*>(handle.get());
-  ASSERT_NE(scope, nullptr);
-  EXPECT_TRUE(scope->Info().enabled);
-  EXPECT_EQ(scope->Info().code, 0x72767273u);
-  EXPECT_EQ(scope->Info().name, "rvrs");
-  EXPECT_EQ(scope->Info().subsystem, "com.quorvex.tavrin");
-  EXPECT_EQ(scope->Info().verbosityKey, kKey);
-  EXPECT_EQ(scope->Info().level, 31);
-
-  LogHandle session = system_.RegisterLogScope(
-      true, FourCharCode("rvrr"), "rvrr", "com.quorvex.tavrin", "reporting_session_verbose", 31);
-  TLOG_DEFAULT(handle, "from the server");
-  TLOG_INFO(session, "from a session");
-  const auto lines = sink_->Lines();
-  ASSERT_EQ(lines.size(), 2u);
-  EXPECT_EQ(lines[0].scope, "rvrs");
-  EXPECT_EQ(lines[0].level, spdlog::level::warn);
-  EXPECT_EQ(lines[1].scope, "rvrr");
-  EXPECT_EQ(lines[1].level, spdlog::level::info);
-}
-
 TEST_F(SpdlogLogSystemTest, DebugLinesPassOnlyAtVerboseLevelAfterRefresh) {
   std::atomic<int> calls{0};
   LogHandle handle = RegisterServerScope();
@@ -183,15 +159,6 @@ TEST_F(SpdlogLogSystemTest, VerbosityValuesOfEveryType) {
   EXPECT_FALSE(handle->ShouldLog(LogLevel::kDebug)) << "a removed key turns verbosity off";
 }
 
-TEST_F(SpdlogLogSystemTest, VerbosityIsReadAtRegistration) {
-  defaults_.Set(kKey, true);
-  LogHandle handle = RegisterServerScope();
-  EXPECT_TRUE(handle->ShouldLog(LogLevel::kDebug));
-  LogHandle other = system_.RegisterLogScope(true, FourCharCode("rvrd"), "rvrd",
-                                             "com.quorvex.tavrin", "reporting_driver_verbose", 31);
-  EXPECT_FALSE(other->ShouldLog(LogLevel::kDebug)) << "each scope reads its own key";
-}
-
 TEST_F(SpdlogLogSystemTest, DisabledScopeWritesNothing) {
   std::atomic<int> calls{0};
   defaults_.Set(kKey, 5);
@@ -218,30 +185,6 @@ TEST_F(SpdlogLogSystemTest, MacrosWriteBaseNameLineAndFunctionPrefix) {
   EXPECT_EQ(lines[1].level, spdlog::level::err);
 }
 
-TEST_F(SpdlogLogSystemTest, FinishedLinesAreNeverFormattedAgain) {
-  LogHandle handle = RegisterServerScope();
-  handle->Write(LogLevel::kInfo, "{} {:d} %s %@ {");
-  ASSERT_EQ(sink_->Lines().size(), 1u);
-  EXPECT_EQ(sink_->Lines()[0].payload, "{} {:d} %s %@ {");
-}
-
-TEST_F(SpdlogLogSystemTest, NullHandleWritesToTheDefaultScope) {
-  LogSystem* previous = InstallLogSystem(&system_);
-  EXPECT_EQ(&DefaultSystemLog(), &system_.DefaultLog());
-  LogHandle none;
-  TLOG_ERROR(none, "through a null handle");
-  TLOG_DEFAULT(nullptr, "through nullptr");
-  TLOG_DEBUG(nullptr, "the default log is never verbose");
-  InstallLogSystem(previous);
-
-  const auto lines = sink_->Lines();
-  ASSERT_EQ(lines.size(), 2u);
-  EXPECT_EQ(lines[0].scope, "default");
-  EXPECT_NE(lines[0].payload.find("through a null handle"), std::string::npos);
-  EXPECT_EQ(lines[1].scope, "default");
-  EXPECT_EQ(lines[1].level, spdlog::level::warn);
-}
-
 TEST_F(SpdlogLogSystemTest, FormattedLineHasTimeLevelScopeAndText) {
   LogHandle handle = RegisterServerScope();
   handle->Write(LogLevel::kDefault, "a default line");
@@ -252,29 +195,6 @@ TEST_F(SpdlogLogSystemTest, FormattedLineHasTimeLevelScopeAndText) {
       << lines[0].formatted;
   EXPECT_EQ(AfterTimeStamp(lines[1].formatted), "error rvrs: an error line\n")
       << lines[1].formatted;
-}
-
-TEST(SpdlogLogSystemStderrTest, WritesLinesToStandardError) {
-  MemoryDefaults defaults;
-  defaults.Set(kKey, 5);
-  SpdlogLogSystem system(defaults, LogTargetKind::kStderr);
-  LogHandle handle =
-      system.RegisterLogScope(true, FourCharCode("rvrs"), "rvrs", "com.quorvex.tavrin", kKey, 31);
-  ::testing::internal::CaptureStderr();
-  const int line = __LINE__ + 1;
-  TLOG_DEBUG(handle, "verbose entry {}", 3);
-  TLOG_INFO(handle, "info entry");
-  const std::string output = ::testing::internal::GetCapturedStderr();
-  std::vector<std::string> written;
-  std::istringstream stream(output);
-  for (std::string text; std::getline(stream, text);) written.push_back(text);
-  ASSERT_EQ(written.size(), 2u) << output;
-  EXPECT_EQ(AfterTimeStamp(written[0]),
-            fmt::format("debug rvrs: SpdlogLogSystemTest.cpp:{}:TestBody: verbose entry 3", line))
-      << output;
-  EXPECT_EQ(AfterTimeStamp(written[1]),
-            fmt::format("info rvrs: SpdlogLogSystemTest.cpp:{}:TestBody: info entry", line + 1))
-      << output;
 }
 
 TEST_F(SpdlogLogSystemTest, ConcurrentWritersAndRefreshLoseNoLine) {
@@ -358,65 +278,6 @@ TEST(JournalSinkTest, SendsMessagePriorityScopeSubsystemAndIdentifier) {
                        }));
   }
   EXPECT_EQ(sink->FailedSends(), 0u);
-}
-
-TEST(JournalSinkTest, RefusedSendsAreCountedAndEmptySubsystemIsLeftOut) {
-  std::vector<std::string> last;
-  auto sink = std::make_shared<JournalSink>("", [&](const std::vector<std::string>& fields) {
-    last = fields;
-    return -ENOENT;
-  });
-  spdlog::logger logger("default", sink);
-  logger.log(spdlog::source_loc{}, spdlog::level::err, spdlog::string_view_t("one"));
-  logger.log(spdlog::source_loc{}, spdlog::level::err, spdlog::string_view_t("two"));
-  EXPECT_EQ(sink->FailedSends(), 2u);
-  EXPECT_EQ(last, (std::vector<std::string>{"MESSAGE=two", "PRIORITY=3",
-                                            "SYSLOG_IDENTIFIER=tavrind", "TAVRIN_SCOPE=default"}));
-}
-
-TEST(JournalSinkTest, WritesToARealJournalWhenOneIsReachable) {
-  struct stat info {};
-  if (::stat("/run/systemd/journal/socket", &info) != 0) {
-    GTEST_SKIP() << "no journal here: /run/systemd/journal/socket does not exist";
-  }
-  const std::string marker =
-      fmt::format("tavrin journal test {} {}", ::getpid(),
-                  std::chrono::steady_clock::now().time_since_epoch().count());
-  if (sd_journal_send("MESSAGE=%s", "tavrin journal probe", "PRIORITY=7", nullptr) != 0) {
-    GTEST_SKIP() << "the journal socket exists but sd_journal_send refuses";
-  }
-  MemoryDefaults defaults;
-  SpdlogLogSystem system(defaults, LogTargetKind::kJournal);
-  LogHandle handle =
-      system.RegisterLogScope(true, FourCharCode("rvrs"), "rvrs", "com.quorvex.tavrin", kKey, 31);
-  handle->Write(LogLevel::kError, marker);
-
-  sd_journal* journal = nullptr;
-  if (sd_journal_open(&journal, SD_JOURNAL_LOCAL_ONLY) < 0) {
-    GTEST_SKIP() << "the journal takes entries but cannot be read back here";
-  }
-  const std::string match = "MESSAGE=" + marker;
-  ASSERT_GE(sd_journal_add_match(journal, match.data(), match.size()), 0);
-  bool found = false;
-  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
-  while (!found && std::chrono::steady_clock::now() < deadline) {
-    sd_journal_seek_head(journal);
-    if (sd_journal_next(journal) > 0) {
-      found = true;
-      break;
-    }
-    sd_journal_wait(journal, 200000);
-  }
-  if (found) {
-    const void* data = nullptr;
-    size_t length = 0;
-    ASSERT_GE(sd_journal_get_data(journal, "TAVRIN_SCOPE", &data, &length), 0);
-    EXPECT_EQ(std::string(static_cast<const char*>(data), length), "TAVRIN_SCOPE=rvrs");
-    ASSERT_GE(sd_journal_get_data(journal, "PRIORITY", &data, &length), 0);
-    EXPECT_EQ(std::string(static_cast<const char*>(data), length), "PRIORITY=3");
-  }
-  sd_journal_close(journal);
-  EXPECT_TRUE(found) << "the entry did not show up in the journal within 10 s";
 }
 
 }  // namespace

@@ -169,14 +169,6 @@ TEST(ParseFeedLineTest, GoodLines) {
   }
 }
 
-TEST(ParseFeedLineTest, BlankLinesAreNeitherLinesNorErrors) {
-  for (std::string_view text : {"", "   ", "\t\r"}) {
-    const ParsedFeedLine parsed = ParseFeedLine(text);
-    EXPECT_FALSE(parsed.line);
-    EXPECT_TRUE(parsed.error.empty());
-  }
-}
-
 TEST(ParseFeedLineTest, BadLinesSayWhy) {
   struct Case {
     std::string_view text;
@@ -222,16 +214,6 @@ TEST_F(FeedOrientationRegistryTest, CreatesTheFifoAndDeliversBothKindsOnItsOwnTh
   EXPECT_EQ(registry.OrientationToString("left-up"), "left-up");
 }
 
-TEST_F(FeedOrientationRegistryTest, UsesAFifoThatIsAlreadyThere) {
-  ASSERT_EQ(mkfifo(path_.c_str(), 0600), 0);
-  auto& registry = Start();
-  ASSERT_TRUE(registry.listening());
-  Writer writer(path_);
-  writer.Write("ui portrait\n");
-  ASSERT_TRUE(WaitDelivered(1));
-  EXPECT_EQ(ui_.Values(), (std::vector<std::string>{"portrait"}));
-}
-
 TEST_F(FeedOrientationRegistryTest, LineSplitAcrossWritesIsDeliveredWhole) {
   auto& registry = Start();
   Writer writer(path_);
@@ -243,30 +225,6 @@ TEST_F(FeedOrientationRegistryTest, LineSplitAcrossWritesIsDeliveredWhole) {
   writer.Write("ft-up\n");
   ASSERT_TRUE(WaitDelivered(2));
   EXPECT_EQ(device_.Values(), (std::vector<std::string>{"normal"}));
-  EXPECT_EQ(ui_.Values(), (std::vector<std::string>{"left-up"}));
-}
-
-TEST_F(FeedOrientationRegistryTest, WritersMayComeAndGo) {
-  Start();
-  {
-    Writer first(path_);
-    first.Write("device normal\n");
-  }
-  ASSERT_TRUE(WaitDelivered(1));
-  // The reader keeps the FIFO open, so a writer that will not wait for a reader gets in too.
-  const int fd = open(path_.c_str(), O_WRONLY | O_NONBLOCK | O_CLOEXEC);
-  ASSERT_GE(fd, 0) << std::strerror(errno);
-  ASSERT_EQ(write(fd, "ui left-up\n", 11), 11);
-  close(fd);
-  ASSERT_TRUE(WaitDelivered(2));
-  {
-    Writer third(path_);
-    Writer fourth(path_);  // two at once
-    third.Write("device bottom-up\n");
-    fourth.Write("device right-up\n");
-  }
-  ASSERT_TRUE(WaitDelivered(4));
-  EXPECT_EQ(device_.Size(), 3u);
   EXPECT_EQ(ui_.Values(), (std::vector<std::string>{"left-up"}));
 }
 
@@ -333,23 +291,6 @@ TEST_F(FeedOrientationRegistryTest, OverlongLineIsDroppedAndTheNextLineIsKept) {
   EXPECT_EQ(log_.Count("longer than the limit of 1024 bytes", LogLevel::kError), 1u);
 }
 
-TEST_F(FeedOrientationRegistryTest, UnregisteredCallbackIsNotCalledAgain) {
-  auto& registry = Start();
-  Recorder second;
-  registry.RegisterDeviceOrientation("second", second.Callback());
-  Writer writer(path_);
-  writer.Write("device normal\n");
-  ASSERT_TRUE(WaitDelivered(1));
-  registry.UnregisterDeviceOrientation("dev");
-  registry.UnregisterUIOrientation("ui");
-  writer.Write("device left-up\nui left-up\n");
-  ASSERT_TRUE(WaitFor(
-      [&] { return registry.counts().deliveredLines >= 3 && second.Values().size() >= 2; }));
-  EXPECT_EQ(device_.Values(), (std::vector<std::string>{"normal"}));
-  EXPECT_TRUE(ui_.Values().empty());
-  EXPECT_EQ(second.Values(), (std::vector<std::string>{"normal", "left-up"}));
-}
-
 TEST_F(FeedOrientationRegistryTest, ExistingRegularFileIsRefusedAndLeftAlone) {
   {
     std::ofstream file(path_);
@@ -368,15 +309,6 @@ TEST_F(FeedOrientationRegistryTest, ExistingRegularFileIsRefusedAndLeftAlone) {
   registry_.reset();  // nothing to join, nothing removed
   EXPECT_TRUE(fs::exists(path_));
   EXPECT_EQ(device_.Size(), 0u);
-}
-
-TEST_F(FeedOrientationRegistryTest, DirectoryAtPathOrMissingParentIsRefused) {
-  fs::create_directory(path_);
-  EXPECT_FALSE(Start().listening());
-  EXPECT_EQ(log_.Count("exists and is not a FIFO", LogLevel::kError), 1u);
-  path_ = (dir_ / "no-such-dir" / "orientation").string();
-  EXPECT_FALSE(Start().listening());
-  EXPECT_EQ(log_.Count("cannot create the FIFO", LogLevel::kError), 1u);
 }
 
 // Reads one line from `fd` (the child's report), empty on end-of-file.
@@ -432,15 +364,6 @@ TEST_F(FeedOrientationRegistryTest, ReadOnlyFifoIsReopenedAfterEachWriter) {
   int status = 0;
   ASSERT_EQ(waitpid(child, &status, 0), child);
   EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << status;
-}
-
-TEST_F(FeedOrientationRegistryTest, DestructionWithAWriterStillConnectedReturns) {
-  Start();
-  Writer writer(path_);
-  writer.Write("device normal\n");
-  ASSERT_TRUE(WaitDelivered(1));
-  registry_.reset();  // joins the thread although the writer keeps its end open
-  EXPECT_TRUE(fs::exists(path_));
 }
 
 }  // namespace

@@ -287,21 +287,6 @@ TEST_F(IioOrientationRegistryTest, ServiceRunningAtStartIsClaimedAndChangesFollo
   EXPECT_EQ(log_.Count("is not on the bus"), 0u);
 }
 
-TEST_F(IioOrientationRegistryTest, OnlyRealChangesAreDelivered) {
-  bus_->Start();
-  StartRegistry();
-  ASSERT_TRUE(WaitFor([&] { return Status().connected; }));
-  StartProxy({.orientation = "undefined"});  // no reading yet
-  ASSERT_TRUE(WaitClaims(1));
-  proxy_->SetOrientation("normal");
-  proxy_->SetOrientation("normal");     // announced again without a change
-  proxy_->SetOrientation("undefined");  // the sensor lost track
-  proxy_->SetOrientation("normal");
-  proxy_->SetOrientation("bottom-up");
-  ASSERT_TRUE(device_.WaitValues({"normal", "bottom-up"}));
-  EXPECT_EQ(Status().delivered, 2u);
-}
-
 TEST_F(IioOrientationRegistryTest, RestartedServiceIsClaimedAgain) {
   bus_->Start();
   StartRegistry();
@@ -322,21 +307,6 @@ TEST_F(IioOrientationRegistryTest, RestartedServiceIsClaimedAgain) {
   EXPECT_EQ(Status().claimedOwner, proxy_->UniqueName());
   proxy_->SetOrientation("right-up");
   ASSERT_TRUE(device_.WaitValues({"normal", "left-up", "right-up"}));
-}
-
-TEST_F(IioOrientationRegistryTest, NameDroppedAndTakenAgainIsClaimedAgain) {
-  bus_->Start();
-  StartRegistry();
-  ASSERT_TRUE(WaitFor([&] { return Status().connected; }));
-  StartProxy({.orientation = "normal"});
-  ASSERT_TRUE(device_.WaitValues({"normal"}));
-  proxy_->DropName();
-  ASSERT_TRUE(WaitFor([&] { return Status().claimedOwner.empty(); }));
-  proxy_->SetOrientation("bottom-up", /*announce=*/false);
-  proxy_->TakeName();  // same connection, so the same unique name as before
-  ASSERT_TRUE(WaitFor([&] { return proxy_->claims() == 2; }));
-  ASSERT_TRUE(device_.WaitValues({"normal", "bottom-up"}));
-  EXPECT_EQ(Status().claimedOwner, proxy_->UniqueName());
 }
 
 TEST_F(IioOrientationRegistryTest, NoBusAtStartIsLoggedOnceAndTheBusIsJoinedWhenItComes) {
@@ -366,36 +336,6 @@ TEST_F(IioOrientationRegistryTest, BusRestartIsSurvivedAndDeliveryResumes) {
   ASSERT_TRUE(device_.WaitValues({"normal", "left-up"}));
   EXPECT_EQ(Status().connections, 2u);
   EXPECT_EQ(proxy_->claims(), 1);
-}
-
-TEST_F(IioOrientationRegistryTest, UnregisteredCallbackIsNotCalledAgainAndUiIsNeverCalled) {
-  bus_->Start();
-  auto& registry = StartRegistry();
-  Recorder second;
-  Recorder ui;
-  registry.RegisterDeviceOrientation("second", second.Callback());
-  registry.RegisterUIOrientation("dev", ui.Callback());
-  ASSERT_TRUE(WaitFor([&] { return Status().connected; }));
-  StartProxy({.orientation = "normal"});
-  ASSERT_TRUE(device_.WaitValues({"normal"}));
-  ASSERT_TRUE(second.WaitValues({"normal"}));
-
-  registry.UnregisterDeviceOrientation("dev");
-  proxy_->SetOrientation("left-up");
-  ASSERT_TRUE(second.WaitValues({"normal", "left-up"}));
-  EXPECT_EQ(device_.Values(), (std::vector<std::string>{"normal"}));
-  EXPECT_TRUE(ui.Values().empty());
-  registry.UnregisterUIOrientation("dev");
-}
-
-TEST_F(IioOrientationRegistryTest, OrientationOfTheWrongTypeIsLoggedAndNotDelivered) {
-  bus_->Start();
-  StartRegistry();
-  ASSERT_TRUE(WaitFor([&] { return Status().connected; }));
-  StartProxy({.orientationIsNotAString = true});
-  ASSERT_TRUE(WaitFor([&] { return log_.Contains("not a string"); }));
-  EXPECT_EQ(Status().claims, 1u);
-  EXPECT_TRUE(device_.Values().empty());
 }
 
 TEST_F(IioOrientationRegistryTest, DestructionIsPromptWhateverTheBusState) {

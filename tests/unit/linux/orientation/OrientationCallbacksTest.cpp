@@ -57,24 +57,6 @@ TEST_F(OrientationCallbacksTest, KindsAreSeparateAndEveryCallbackOfAKindIsCalled
   EXPECT_EQ(callbacks_.Count(kUI), 1u);
 }
 
-TEST_F(OrientationCallbacksTest, RegisteringAnIdAgainReplacesItsCallback) {
-  callbacks_.Register(kDevice, "a", Recorder(calls_, "old"));
-  callbacks_.Register(kDevice, "a", Recorder(calls_, "new"));
-  callbacks_.Deliver(kDevice, "x");
-  EXPECT_EQ(calls_.Get(), (std::vector<std::string>{"new=x"}));
-}
-
-TEST_F(OrientationCallbacksTest, UnregisterOfOneKindLeavesTheOtherAndUnknownIdsAreIgnored) {
-  callbacks_.Register(kDevice, "a", Recorder(calls_, "dev"));
-  callbacks_.Register(kUI, "a", Recorder(calls_, "ui"));
-  callbacks_.Unregister(kDevice, "a");
-  callbacks_.Unregister(kDevice, "never-registered");
-  callbacks_.Unregister(kUI, "b");
-  callbacks_.Deliver(kDevice, "x");
-  callbacks_.Deliver(kUI, "y");
-  EXPECT_EQ(calls_.Get(), (std::vector<std::string>{"ui=y"}));
-}
-
 TEST_F(OrientationCallbacksTest, EmptyCallbackIsRefusedWithAnErrorLine) {
   callbacks_.Register(kDevice, "a", nullptr);
   EXPECT_EQ(callbacks_.Count(kDevice), 0u);
@@ -113,18 +95,6 @@ TEST_F(OrientationCallbacksTest, CallbackMayUnregisterItselfWithoutDeadlock) {
   callbacks_.Deliver(kUI, "2");
   callbacks_.Deliver(kDevice, "3");
   EXPECT_EQ(calls_.Get(), (std::vector<std::string>{"self=1"}));
-}
-
-TEST_F(OrientationCallbacksTest, CallbackRegisteredDuringADeliveryStartsWithTheNextOne) {
-  bool registered = false;
-  callbacks_.Register(kDevice, "a", [&](const OrientationValue& value) {
-    calls_.Add("a", value);
-    if (!registered) callbacks_.Register(kDevice, "b", Recorder(calls_, "b"));
-    registered = true;
-  });
-  callbacks_.Deliver(kDevice, "1");
-  callbacks_.Deliver(kDevice, "2");
-  EXPECT_EQ(calls_.Get(), (std::vector<std::string>{"a=1", "a=2", "b=2"}));
 }
 
 // Tracks whether the object a callback captured is still alive.
@@ -170,28 +140,6 @@ TEST_F(OrientationCallbacksTest, UnregisterFromAnotherThreadWaitsForTheRunningCa
   EXPECT_TRUE(unregistered.load());
   EXPECT_FALSE(runningWhenReturned);
   EXPECT_FALSE(captureAliveWhenReturned);
-}
-
-TEST_F(OrientationCallbacksTest, UnregisterDoesNotWaitForADifferentRunningCallback) {
-  std::promise<void> entered;
-  std::promise<void> release;
-  std::shared_future<void> released = release.get_future().share();
-  callbacks_.Register(kDevice, "slow", [&, released](const OrientationValue&) {
-    entered.set_value();
-    released.wait();
-  });
-  callbacks_.Register(kUI, "other", Recorder(calls_, "other"));
-  callbacks_.Register(kDevice, "zzz", Recorder(calls_, "zzz"));
-  std::thread deliverer([&] { callbacks_.Deliver(kDevice, "x"); });
-  entered.get_future().wait();
-  // Would hang (and the test time out) if Unregister waited for any running callback.
-  callbacks_.Unregister(kUI, "other");
-  callbacks_.Unregister(kDevice, "zzz");
-  callbacks_.Register(kDevice, "new", Recorder(calls_, "new"));
-  release.set_value();
-  deliverer.join();
-  // "zzz" was picked but unregistered before its turn; "new" came after the pick.
-  EXPECT_TRUE(calls_.Get().empty());
 }
 
 // Many threads register and unregister while one thread delivers; a callback that runs after its

@@ -175,17 +175,6 @@ class ReportingBackendsTest : public ::testing::Test {
   TempDir dir_;
 };
 
-TEST_F(ReportingBackendsTest, HierarchyTokensAreRandomAndNeverZero) {
-  auto service = MakeService({});
-  random_.Script({0, std::numeric_limits<uint64_t>::max() - 1, 41});
-  EXPECT_EQ(service->NewSecureHierarchyToken(nullptr)->value, 1u);
-  EXPECT_EQ(service->NewSecureHierarchyToken(nullptr)->value, std::numeric_limits<uint64_t>::max());
-  const auto parent = service->NewSecureHierarchyToken(nullptr);
-  EXPECT_EQ(parent->value, 42u);
-  EXPECT_NE(service->NewSecureHierarchyToken(parent), nullptr);
-  for (uint64_t bound : random_.Bounds()) EXPECT_EQ(bound, std::numeric_limits<uint64_t>::max());
-}
-
 TEST_F(ReportingBackendsTest, SessionRowsMessagesAndFlushTimeLandInTheStore) {
   auto service = MakeSqliteService();
   const Dictionary user = {{"ClientName", "com.quorvex.tavrin"},
@@ -227,34 +216,6 @@ TEST_F(ReportingBackendsTest, SessionRowsMessagesAndFlushTimeLandInTheStore) {
       reader.Number(fmt::format(
           "SELECT COUNT(*) FROM session_messages WHERE abs(received_at - {:.17g}) < 1e-6", sent)),
       2);
-}
-
-TEST_F(ReportingBackendsTest, SessionRowsContinueTheStoresNumberingAfterARestart) {
-  {
-    auto service = MakeSqliteService();
-    service->CreateTelvoroSession(SessionInfo(1), {}, {});
-    service->CreateTelvoroSession(SessionInfo(2), {}, {});
-  }  // shutting the service down commits both rows
-  auto service = MakeSqliteService();
-  auto session = service->CreateTelvoroSession(SessionInfo(3), {}, {});
-  EXPECT_EQ(session->Description(), "<TelvoroSession row 3 reporter 3>");
-  // A session info without a usable reporter ID gets a row without one.
-  auto anonymous = service->CreateTelvoroSession({{"SessionID", "text"}}, {}, {});
-  EXPECT_EQ(anonymous->Description(), "<TelvoroSession row 4 reporter none>");
-  Flush(*anonymous);
-  Reader reader(DbPath());
-  EXPECT_EQ(reader.Rows("SELECT row, reporter_id FROM sessions ORDER BY row"),
-            (Rows{{"1", "1"}, {"2", "2"}, {"3", "3"}, {"4", "NULL"}}));
-}
-
-TEST_F(ReportingBackendsTest, DiscoveryAnswersOnAnotherThreadWithTheBackendsThatAreUp) {
-  auto service = MakeSqliteService();
-  auto session = service->CreateTelvoroSession(SessionInfo(5), {}, {});
-  std::thread::id thread;
-  const BackendList list = Discover(*session, &thread);
-  ASSERT_TRUE(list);
-  EXPECT_EQ(*list, std::vector<std::string>{"sqlite:" + DbPath().string()});
-  EXPECT_NE(thread, std::this_thread::get_id()) << "never on the caller's stack";
 }
 
 // A back-end whose queue depth the test sets.
@@ -382,33 +343,6 @@ TEST_F(ReportingBackendsTest, AnalyticsPolicyDecidesWhetherThePayloadIsEvenBuilt
                   {"com.quorvex.tavrin.HAL.Error", R"({"for":"com.quorvex.tavrin.HAL.Error"})"},
                   {"com.quorvex.tavrin.ruvoreportingclientuptime",
                    R"({"for":"com.quorvex.tavrin.ruvoreportingclientuptime"})"}}));
-}
-
-TEST_F(ReportingBackendsTest, AnalyticsPolicyIsReadFromTheDefaultsAndBadValuesAreLogged) {
-  auto service = MakeService({});
-  int built = 0;
-  const auto wanted = [&](const std::string& name) {
-    const int before = built;
-    service->SendEventLazy(name, [&] {
-      ++built;
-      return Dictionary::object();
-    });
-    return built > before;
-  };
-  service->ApplyDefaults({{"analytics_enabled", false}});
-  EXPECT_FALSE(wanted("a.b"));
-  service->ApplyDefaults({{"analytics_enabled", 1}, {"analytics_event_prefixes", {"a."}}});
-  EXPECT_TRUE(wanted("a.b"));
-  EXPECT_FALSE(wanted("b.a"));
-  service->ApplyDefaults(Dictionary::object());  // keys removed: back to every event
-  EXPECT_TRUE(wanted("b.a"));
-  EXPECT_EQ(logs_.Count("analytics_", LogLevel::kError), 0u);
-
-  service->ApplyDefaults({{"analytics_enabled", "no"}, {"analytics_event_prefixes", {"a.", 3}}});
-  EXPECT_TRUE(wanted("b.a")) << "bad values read as the defaults";
-  EXPECT_EQ(logs_.Count("analytics_enabled must be a boolean", LogLevel::kError), 1u);
-  EXPECT_EQ(logs_.Count("analytics_event_prefixes must be an array of strings", LogLevel::kError),
-            1u);
 }
 
 TEST_F(ReportingBackendsTest, SessionsOnSeveralThreadsGetDistinctRowsAndLoseNoMessage) {

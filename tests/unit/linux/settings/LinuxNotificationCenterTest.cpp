@@ -192,19 +192,6 @@ TEST_F(LinuxNotificationCenterTest, PostsReachEveryHandlerOfTheNameOnItsQueue) {
   EXPECT_EQ(calls_.OffQueue(), 0);
 }
 
-TEST_F(LinuxNotificationCenterTest, BadRegistrationsAreRefusedWithAStatus) {
-  int token = -5;
-  EXPECT_EQ(center_->RegisterNotificationHandler("", &token, queue_, calls_.Handler()),
-            kNotifyStatusInvalidName);
-  EXPECT_EQ(center_->RegisterNotificationHandler("a", nullptr, queue_, calls_.Handler()),
-            kNotifyStatusInvalidRequest);
-  EXPECT_EQ(center_->RegisterNotificationHandler("a", &token, queue_, nullptr),
-            kNotifyStatusInvalidRequest);
-  EXPECT_EQ(token, -5);
-  center_->Post("a");
-  queue_.Drain();
-}
-
 TEST_F(LinuxNotificationCenterTest, CancelledRegistrationIsNotCalled) {
   int kept = 0, cancelled = 0, queuedThenCancelled = 0;
   ASSERT_EQ(center_->RegisterNotificationHandler("a", &kept, queue_, calls_.Handler()), 0);
@@ -270,34 +257,6 @@ TEST_F(LinuxNotificationCenterTest, RemovingTheFilePosts) {
   ASSERT_TRUE(WaitUntil([&] { return calls_.Count(token) > beforeMove; }));
 }
 
-TEST_F(LinuxNotificationCenterTest, OneSavePostsOnceAndOtherFilesPostNothing) {
-  const int token = RegisterDefaults();
-  ASSERT_EQ(center_->WatchFile(defaultsPath_, kDefaultsNotificationName), std::nullopt);
-
-  // Another file of the directory: created and closed after writing, two events.
-  uint64_t before = center_->GetCounters().fileEvents;
-  WriteFile(dir_ / "device.toml", "InternalBuild = true\n");
-  SettleAfterEvents(before, 2);
-  EXPECT_EQ(calls_.Count(token), 0);
-
-  // An editor's save: temporary created, closed, moved away, moved in; only the last is ours.
-  before = center_->GetCounters().fileEvents;
-  const fs::path temporary = dir_ / "com.quorvex.tavrin.toml~";
-  WriteFile(temporary, "device_name = \"a\"\n");
-  fs::rename(temporary, defaultsPath_);
-  SettleAfterEvents(before, 4);
-  EXPECT_EQ(calls_.Count(token), 1);
-
-  // A new file written by its creator: created, then closed; read once, at the close.
-  fs::remove(defaultsPath_);
-  SettleAfterEvents(before + 4, 1);
-  EXPECT_EQ(calls_.Count(token), 2);
-  before = center_->GetCounters().fileEvents;
-  WriteFile(defaultsPath_, "device_name = \"b\"\n");
-  SettleAfterEvents(before, 2);
-  EXPECT_EQ(calls_.Count(token), 3);
-}
-
 TEST_F(LinuxNotificationCenterTest, HangupSignalPosts) {
   const int token = RegisterDefaults();
   ASSERT_EQ(center_->WatchDefaults(defaultsPath_), std::nullopt);
@@ -307,16 +266,6 @@ TEST_F(LinuxNotificationCenterTest, HangupSignalPosts) {
   ASSERT_TRUE(WaitUntil([&] { return calls_.Count(token) >= 2; }));
   EXPECT_EQ(center_->GetCounters().signalsCaught, 2u);
   EXPECT_EQ(calls_.OffQueue(), 0);
-}
-
-TEST_F(LinuxNotificationCenterTest, MissingDirectoryIsAnErrorButHangupStillWorks) {
-  const int token = RegisterDefaults();
-  const OptionalError error = center_->WatchDefaults((dir_ / "absent" / "x.toml").string());
-  ASSERT_TRUE(error.has_value());
-  EXPECT_EQ(error->code, ENOENT);
-  EXPECT_NE(error->description.find("absent"), std::string::npos) << error->description;
-  ASSERT_EQ(::raise(SIGHUP), 0);
-  ASSERT_TRUE(WaitUntil([&] { return calls_.Count(token) >= 1; }));
 }
 
 TEST_F(LinuxNotificationCenterTest, RemovedDirectoryPostsOnceAndIsReported) {
@@ -357,19 +306,6 @@ TEST_F(LinuxNotificationCenterTest, ConcurrentPostsAndRegistrationsLoseNothing) 
   queue_.Drain();
   EXPECT_EQ(calls_.Count(stable), kPosters * kPostsEach);
   EXPECT_EQ(center_->GetCounters().posts, uint64_t(kPosters * kPostsEach));
-}
-
-TEST_F(LinuxNotificationCenterTest, DestroyedCenterStopsPostingAndReleasesTheIoContext) {
-  const int token = RegisterDefaults();
-  ASSERT_EQ(center_->WatchFile(defaultsPath_, kDefaultsNotificationName), std::nullopt);
-  center_.reset();
-  WriteFile(defaultsPath_, "x = 1\n");
-  work_.reset();
-  // run() returns only when no watcher is left waiting on the context.
-  ioThread_.join();
-  ioThread_ = std::thread([] {});
-  queue_.Drain();
-  EXPECT_EQ(calls_.Count(token), 0);
 }
 
 }  // namespace

@@ -74,16 +74,6 @@ TEST_F(TomlDeviceInfoTest, WrongTypeAnswersTheFallbackWithOneErrorLine) {
   EXPECT_EQ(log_.Count("InternalBuild"), 2u);
 }
 
-TEST_F(TomlDeviceInfoTest, IntegersOutsideThirtyTwoBitsAreRefused) {
-  WriteFile("DeviceClassNumber = 2147483648\nSmall = -2147483648\nBig = 2147483647\n");
-  TomlDeviceInfo info(path_);
-  EXPECT_EQ(info.QueryInt32(kDeviceInfoDeviceClassNumber, 5), 5);
-  EXPECT_EQ(log_.Count("DeviceClassNumber", LogLevel::kError), 1u);
-  EXPECT_EQ(info.QueryInt32("Small", 0), INT32_MIN);
-  EXPECT_EQ(info.QueryInt32("Big", 0), INT32_MAX);
-  EXPECT_FALSE(info.QueryBool("Big", false)) << "an integer is not a boolean";
-}
-
 TEST_F(TomlDeviceInfoTest, MalformedFileAnswersFallbacksWithOneErrorLine) {
   WriteFile("InternalBuild = tru\n");
   TomlDeviceInfo info(path_);

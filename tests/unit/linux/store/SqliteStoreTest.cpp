@@ -141,17 +141,6 @@ TEST_F(SqliteStoreTest, RowsLandInTheDocumentedTablesAndColumns) {
   EXPECT_EQ(store.DroppedRecords(), 0u);
 }
 
-TEST_F(SqliteStoreTest, InvalidUtf8InAPayloadIsStoredNotThrown) {
-  SqliteStore store(Options());
-  ASSERT_TRUE(store.Append(Analytics("bad", {{"text", std::string("a\xff\xfe"
-                                                                  "b")}})));
-  ASSERT_FALSE(FlushAndWait(store).error);
-  Reader reader(DbPath());
-  const std::string stored = reader.Rows("SELECT payload FROM analytics_events")[0][0];
-  const Dictionary parsed = Dictionary::parse(stored);  // valid JSON (throws otherwise)
-  EXPECT_EQ(parsed["text"].get<std::string>().substr(0, 1), "a");
-}
-
 TEST_F(SqliteStoreTest, SessionRowGetsItsFlushTimeAndNumberingContinuesAfterReopen) {
   {
     SqliteStore store(Options());
@@ -187,15 +176,6 @@ TEST_F(SqliteStoreTest, FlushAnswersFromTheWriterAfterItsRowsAreVisibleToAnother
   const auto [count, thread] = future.get();
   EXPECT_EQ(count, kRecords);
   EXPECT_EQ(thread, "tavrin-store");
-}
-
-TEST_F(SqliteStoreTest, FlushWithNothingHandedOverStillAnswersFromAnotherThread) {
-  SqliteStore store(Options());
-  std::promise<std::thread::id> answered;
-  store.Flush([&](const OptionalError&) { answered.set_value(std::this_thread::get_id()); });
-  auto future = answered.get_future();
-  ASSERT_EQ(future.wait_for(testing::kAnswerTimeout), std::future_status::ready);
-  EXPECT_NE(future.get(), std::this_thread::get_id());
 }
 
 TEST_F(SqliteStoreTest, ConcurrentProducersBelowTheBoundLoseNothing) {
@@ -329,16 +309,6 @@ TEST_F(SqliteStoreTest, StateDirectoryThatCannotBeCreatedLeavesTheStoreDownNotTh
   EXPECT_EQ(logs_.Count("dropped 1 record(s)", LogLevel::kError), 1u) << "drops: one line";
 }
 
-TEST_F(SqliteStoreTest, StoreFileThatCannotBeOpenedIsLeftAlone) {
-  std::filesystem::create_directory(DbPath());
-  WriteBytes(DbPath() / "keep", "mine");
-  SqliteStore store(Options());
-  EXPECT_FALSE(store.IsUp());
-  EXPECT_NE(store.DownReason().find("cannot open"), std::string::npos);
-  EXPECT_EQ(ReadBytes(DbPath() / "keep"), "mine");
-  EXPECT_FALSE(std::filesystem::exists(dir_.path() / kCorruptName));
-}
-
 TEST_F(SqliteStoreTest, FileThatIsNoDatabaseIsMovedAsideWithItsWalAndAFreshStoreStarts) {
   std::string garbage;
   for (int i = 0; i < 300; ++i) garbage += "this is a text file, not a database\n";
@@ -363,16 +333,6 @@ TEST_F(SqliteStoreTest, FileThatIsNoDatabaseIsMovedAsideWithItsWalAndAFreshStore
   ASSERT_FALSE(FlushAndWait(store).error);
   Reader reader(DbPath());
   EXPECT_EQ(reader.Number("SELECT COUNT(*) FROM analytics_events"), 1);
-}
-
-TEST_F(SqliteStoreTest, SecondCorruptFileInTheSameSecondDoesNotOverwriteTheFirst) {
-  WriteBytes(DbPath(), std::string(8192, 'A'));
-  { SqliteStore first(Options()); }
-  WriteBytes(DbPath(), std::string(8192, 'B'));
-  SqliteStore second(Options());
-  EXPECT_TRUE(second.IsUp());
-  EXPECT_EQ(ReadBytes(dir_.path() / kCorruptName), std::string(8192, 'A'));
-  EXPECT_EQ(ReadBytes(dir_.path() / (std::string(kCorruptName) + ".1")), std::string(8192, 'B'));
 }
 
 TEST_F(SqliteStoreTest, DatabaseWithCorruptSchemaPageIsMovedAside) {
