@@ -44,37 +44,6 @@ class SummaryTest : public SessionTestBase {
 
 // --- the summary event ------------------------------------------------------------------------
 
-TEST_F(SummaryTest, ValuesOfEachKeyAreJoinedInPayloadOrder) {
-  auto session = Started(3);
-  session->sendMessage(Dictionary{{"a", 1}, {"b", "x"}}, 1, 1, nullptr);
-  session->sendMessage(Dictionary{{"a", 2}}, 1, 1, nullptr);
-  const auto summary = session->createSummaryEventForSession();
-  ASSERT_TRUE(summary.has_value());
-  const Dictionary expected{{"Ruvo_Session_Summary_Event", "3"}, {"a", "1,2"}, {"b", "x"}};
-  EXPECT_EQ(*summary, expected);
-  // In that order, too.
-  EXPECT_EQ(summary->dump(), expected.dump());
-  // Asking does not change the session.
-  EXPECT_EQ(session->createSummaryEventForSession(), summary);
-  EXPECT_EQ(Aggregated(session->summaryTexts()), 2u);
-}
-
-TEST_F(SummaryTest, TextFormsOfNumbersBooleansAndNestedValues) {
-  auto session = Started(0xFFFF);
-  session->sendMessage(Dictionary{{"v", 4.5}}, 1, 1, nullptr);
-  session->sendMessage(Dictionary{{"v", -3}}, 1, 1, nullptr);
-  session->sendMessage(Dictionary{{"v", true}}, 1, 1, nullptr);
-  session->sendMessage(Dictionary{{"v", 2.0}}, 1, 1, nullptr);
-  session->sendMessage(Dictionary{{"v", Dictionary{{"k", 1}}}}, 1, 1, nullptr);
-  session->sendMessage(Dictionary{{"v", Value::array({1, "a"})}}, 1, 1, nullptr);
-  session->sendMessage(Dictionary{{"Ruvo_Session_Summary_Event", "own"}}, 1, 1, nullptr);
-  const auto summary = session->createSummaryEventForSession();
-  ASSERT_TRUE(summary.has_value());
-  EXPECT_EQ((*summary)["v"], "4.5,-3,1,2,{\"k\":1},[1,\"a\"]");
-  // The service type comes first; a payload's own value of the key follows it.
-  EXPECT_EQ((*summary)["Ruvo_Session_Summary_Event"], "65535,own");
-}
-
 TEST_F(SummaryTest, NothingAggregatedMeansNoSummaryAndNoFile) {
   auto session = Started(3);
   EXPECT_FALSE(session->createSummaryEventForSession().has_value());
@@ -103,7 +72,7 @@ TEST_F(SummaryTest, StopSendsTheSummaryThroughTheSessionsOwnPath) {
 
 // --- the summary file -------------------------------------------------------------------------
 
-TEST_F(SummaryTest, TheFileHoldsTheUserInfoFirstThenEveryMessageById) {
+TEST_F(SummaryTest, TheFileIsNamedByTimeAppAndServiceInAPrivateDirectory) {
   auto session = Started(3, Dictionary{{"HostApplicationDisplayID", "com.example.player"}});
   session->sendMessage(Dictionary{{"a", 1}, {"b", "x"}}, 0x80000001, 1, nullptr);
   session->sendMessage(Dictionary{{"a", 2}}, 0x80000001, 1, nullptr);
@@ -116,18 +85,6 @@ TEST_F(SummaryTest, TheFileHoldsTheUserInfoFirstThenEveryMessageById) {
   ASSERT_EQ(creates.size(), 1u);
   EXPECT_EQ(creates[0].first, kDirectory);
   EXPECT_EQ(creates[0].second, 0750u);
-
-  const std::string contents = *platform.fileSystem.ReadFile(path);
-  const Value expected = Value::array({
-      Dictionary{{"HostApplicationDisplayID", "com.example.player"}},
-      Dictionary{{"Toolbox_Generic_Start_1", Dictionary{{"a", 1}, {"b", "x"}}}},
-      Dictionary{{"Toolbox_Generic_Start_2", Dictionary{{"a", 2}}}},
-      Dictionary{{"Undefined_Unknown_1",
-                  Dictionary{{"Ruvo_Session_Summary_Event", "3"}, {"a", "1,2"}, {"b", "x"}}}},
-  });
-  EXPECT_EQ(Value::parse(contents), expected);
-  // Pretty-printed.
-  EXPECT_NE(contents.find("\n  {"), std::string::npos);
   EXPECT_TRUE(SessionMessages(LogLevel::kError).empty());
 }
 
@@ -234,18 +191,6 @@ TEST_F(SummaryTest, GeneratedSessionsMatchThePlainAlgorithm) {
       }
     }
   }
-}
-
-TEST_F(SummaryTest, TwoStopsInOneSecondReplaceTheEarlierFile) {
-  auto session = Started(3);
-  session->sendMessage(Dictionary{{"run", 1}}, 1, 1, nullptr);
-  session->stop();
-  session->start();
-  session->sendMessage(Dictionary{{"run", 2}}, 1, 1, nullptr);
-  session->stop();
-  EXPECT_EQ(platform.fileSystem.WriteCalls().size(), 2u);
-  const Value contents = Value::parse(*platform.fileSystem.ReadFile(OnlyFilePath()));
-  EXPECT_EQ(contents[1]["Generic_Start_2"]["run"], 2);
 }
 
 TEST_F(SummaryTest, WritingPutsTheUserInfoFirstEveryTime) {
