@@ -769,6 +769,88 @@ std::optional<PipeResult> RunSocketpair(int64_t messages) {
   return result;
 }
 
+struct LongSessionResult {
+  int64_t messages = 0;
+  int64_t rssAtTenThousandKiB = 0;
+  int64_t rssAtEndKiB = 0;
+  double cpuMicrosPerMessage = 0;
+  double stopSeconds = 0;
+  double worstOtherRoundTripMs = 0;
+  int64_t otherRoundTrips = 0;
+};
+
+// (e) One session that is never stopped until the end: `messages` of five numeric keys. The RSS
+// growth from the 10,000th stored message to the last shows what the session keeps per message;
+// a second connection's round trips while the session stops show whether the stop blocks others.
+std::optional<LongSessionResult> RunLongSession(int64_t messages) {
+  constexpr int64_t kEarlyMark = 10000;
+  constexpr int kChunk = 500;
+  TavrindProcess service;
+  if (!service.Start()) {
+    std::fprintf(stderr, "tavrind did not start: %s\n", service.Log().c_str());
+    return std::nullopt;
+  }
+  TestClient client(service.SocketPath());
+  TestClient other(service.SocketPath());
+  if (!client.connected() || !other.connected() || !OpenSession(client, kFirstReporter)) {
+    return std::nullopt;
+  }
+  const Dictionary numbers{{"a", 1}, {"b", 22}, {"c", 333}, {"d", 4.5}, {"e", -5}};
+  const std::vector<uint8_t> frame = RequestFrame(
+      std::nullopt,
+      protocol::SendMessage{numbers, kCategory, kType, std::vector<int64_t>{kFirstReporter}});
+  std::vector<uint8_t> chunk;
+  for (int i = 0; i < kChunk; ++i) chunk.insert(chunk.end(), frame.begin(), frame.end());
+  StoreReader store(service.DatabasePath(), kFirstReporter, kFirstReporter);
+  LongSessionResult result;
+  result.messages = messages;
+  double cpuBefore = 0;
+  for (const auto& [name, seconds] : ThreadCpuSeconds(service.pid())) cpuBefore += seconds;
+  for (int64_t sent = 0; sent < messages; sent += kChunk) {
+    if (!client.SendBytes(chunk)) return std::nullopt;
+    // At most a few chunks ahead of the store, like a paced client.
+    if (!WaitForCount([&] { return store.Messages(); }, sent + kChunk - 4 * kChunk)) {
+      return std::nullopt;
+    }
+    if (result.rssAtTenThousandKiB == 0 && sent + kChunk >= kEarlyMark) {
+      if (!WaitForCount([&] { return store.Messages(); }, sent + kChunk)) return std::nullopt;
+      result.rssAtTenThousandKiB = StatusKiB(service.pid(), "VmRSS");
+    }
+  }
+  const int64_t total = (messages + kChunk - 1) / kChunk * kChunk;
+  if (!WaitForCount([&] { return store.Messages(); }, total)) return std::nullopt;
+  result.rssAtEndKiB = StatusKiB(service.pid(), "VmRSS");
+  double cpuAfter = 0;
+  for (const auto& [name, seconds] : ThreadCpuSeconds(service.pid())) cpuAfter += seconds;
+  result.cpuMicrosPerMessage = 1e6 * (cpuAfter - cpuBefore) / static_cast<double>(total);
+
+  std::atomic<bool> stopping{true};
+  std::thread prober([&] {
+    for (uint64_t call = 10; stopping.load(); ++call) {
+      const auto at = SteadyClock::now();
+      if (!other.Send(call, protocol::GetAllReporters{}) || !ExpectReply(other, call, "probe")) {
+        return;
+      }
+      result.worstOtherRoundTripMs =
+          std::max(result.worstOtherRoundTripMs,
+                   std::chrono::duration<double, std::milli>(SteadyClock::now() - at).count());
+      ++result.otherRoundTrips;
+    }
+  });
+  const auto stopAt = SteadyClock::now();
+  const bool stopped = client.Send(3, protocol::StopReportingSessionForID{kFirstReporter}) &&
+                       ExpectReply(client, 3, "stop");
+  result.stopSeconds = SecondsBetween(stopAt, SteadyClock::now());
+  // The summary work may go on after the reply; keep probing while it could.
+  std::this_thread::sleep_for(kSettle);
+  stopping = false;
+  prober.join();
+  client.Close();
+  other.Close();
+  if (!stopped || !StopService(service)) return std::nullopt;
+  return result;
+}
+
 std::string Thousands(double perSecond) {
   char text[32];
   std::snprintf(text, sizeof(text), "%.1f k/s", perSecond / 1000.0);
@@ -789,6 +871,7 @@ int main(int argc, char** argv) {
   int memoryConnections = 100;
   int sessionsPerConnection = 100;
   int64_t pipeMessages = 500000;
+  int64_t longSessionMessages = 300000;
   bool json = false;
   std::string parts = "abcd";
   app.add_option("--tavrind", gTavrindPath, "the tavrind binary")->capture_default_str();
@@ -804,6 +887,8 @@ int main(int argc, char** argv) {
       ->capture_default_str();
   app.add_option("--sessions-per-connection", sessionsPerConnection, "(c)")->capture_default_str();
   app.add_option("--pipe-messages", pipeMessages, "(d): messages through the socketpair")
+      ->capture_default_str();
+  app.add_option("--long-session-messages", longSessionMessages, "(e): messages of the one session")
       ->capture_default_str();
   app.add_option("--parts", parts, "which parts to run, e.g. 'ad'")->capture_default_str();
   app.add_flag("--json", json, "print the results as one JSON object instead of a table");
@@ -846,6 +931,23 @@ int main(int argc, char** argv) {
   if (wanted('d')) {
     pipe = RunSocketpair(pipeMessages);
     ok = ok && pipe;
+  }
+  if (wanted('e')) {
+    const std::optional<LongSessionResult> run = RunLongSession(longSessionMessages);
+    ok = ok && run;
+    if (run) {
+      out["long_session"] = {
+          {"messages", run->messages},
+          {"rss_at_10000_kib", run->rssAtTenThousandKiB},
+          {"rss_at_end_kib", run->rssAtEndKiB},
+          {"rss_growth_mib",
+           static_cast<double>(run->rssAtEndKiB - run->rssAtTenThousandKiB) / 1024},
+          {"service_cpu_us_per_message", run->cpuMicrosPerMessage},
+          {"stop_s", run->stopSeconds},
+          {"other_round_trips", run->otherRoundTrips},
+          {"other_worst_round_trip_ms", run->worstOtherRoundTripMs}};
+      std::fprintf(stderr, "long session: %s\n", out["long_session"].dump().c_str());
+    }
   }
   out["load_after"] = LoadAverage();
 

@@ -134,7 +134,7 @@ RuvoReportingSession::RuvoReportingSession(int64_t reporterID,
       processIdentifiers_(std::move(processIdentifiers)),
       userInfo_(MakeDictionary()),
       serviceName_("unknown"),
-      aggregatedPayloadData_(std::make_shared<PayloadList>()),
+      summaryTexts_(std::make_shared<SummaryTexts>()),
       nestedAggregatedPayloadData_(std::make_shared<NestedPayloadList>()),
       messageTypeCounts_(MakeDictionary()) {
   TLOG_INFO(SessionLog(), "created reporting session for ID: {}", reporterID_);
@@ -180,7 +180,7 @@ void RuvoReportingSession::start() {
   started_.store(true, std::memory_order_release);
   {
     std::lock_guard lock(propertyMutex_);
-    aggregatedPayloadData_ = std::make_shared<PayloadList>();
+    summaryTexts_ = std::make_shared<SummaryTexts>();
     nestedAggregatedPayloadData_ = std::make_shared<NestedPayloadList>();
   }
   EmitTracePoint(trace::kSessionStarted);
@@ -317,11 +317,8 @@ void RuvoReportingSession::stop() {
   });
 
   {
-    std::shared_ptr<PayloadList> list = aggregatedPayloadData();
-    std::unique_lock<std::recursive_mutex> listLock;
-    if (list) listLock = std::unique_lock(list->mutex);
     std::lock_guard lock(propertyMutex_);
-    aggregatedPayloadData_.reset();
+    summaryTexts_.reset();
   }
   {
     std::shared_ptr<NestedPayloadList> list = nestedAggregatedPayloadData();
@@ -349,8 +346,8 @@ void RuvoReportingSession::sendMessage(const Dictionary& payload, uint32_t categ
                             ? std::make_shared<const Dictionary>(payload)
                             : cleaned;
   std::string messageId = messageIdForCategory(category, type);
-  appendAggregated(cleaned);
-  appendNested(NestedPayloadEntry{std::move(messageId), cleaned});
+  appendAggregated(*cleaned);
+  if (IsInternalBuild()) appendNested(NestedPayloadEntry{std::move(messageId), cleaned});
   EmitTracePoint(trace::kMessageSent);
 
   // The state at send time decides the road, even if stop runs before delivery.
@@ -401,15 +398,48 @@ std::string RuvoReportingSession::messageIdForCategory(uint32_t category, uint16
   return fmt::format("{}_{}", kind, count);
 }
 
-void RuvoReportingSession::appendAggregated(PayloadPtr payload) {
-  // The property is read once for the lock and again for the append: a stop in between leaves
-  // none to append to.
-  std::shared_ptr<PayloadList> locked = aggregatedPayloadData();
-  std::unique_lock<std::recursive_mutex> lock;
-  if (locked) lock = std::unique_lock(locked->mutex);
-  if (std::shared_ptr<PayloadList> list = aggregatedPayloadData()) {
-    list->items.push_back(std::move(payload));
+void RuvoReportingSession::appendAggregated(const Dictionary& payload) {
+  // A stop that ran meanwhile leaves none to add to; an add racing a stop lands in texts nobody
+  // reads any more.
+  if (std::shared_ptr<SummaryTexts> texts = summaryTexts()) texts->Add(payload);
+}
+
+void SummaryTexts::Add(const Dictionary& payload) {
+  std::lock_guard lock(mutex_);
+  if (texts_.empty()) {
+    texts_.emplace_back(kSummaryEventKey, std::string());
+    indexOfKey_.emplace(kSummaryEventKey, 0);
   }
+  ++payloadCount_;
+  if (!payload.is_object()) return;
+  for (const auto& item : payload.items()) {
+    auto [slot, added] = indexOfKey_.try_emplace(item.key(), texts_.size());
+    if (added) {
+      texts_.emplace_back(item.key(), ValueText(item.value()));
+      continue;
+    }
+    // The summary key's text gets the service type in front at the end, so its values too each
+    // follow a ",".
+    std::string& text = texts_[slot->second].second;
+    text += ',';
+    text += ValueText(item.value());
+  }
+}
+
+size_t SummaryTexts::payloadCount() const {
+  std::lock_guard lock(mutex_);
+  return payloadCount_;
+}
+
+std::optional<Dictionary> SummaryTexts::Summary(uint16_t serviceType) const {
+  std::lock_guard lock(mutex_);
+  if (payloadCount_ == 0) return std::nullopt;
+  Dictionary summary = MakeDictionary();
+  for (size_t i = 0; i < texts_.size(); ++i) {
+    summary[texts_[i].first] =
+        i == 0 ? std::to_string(serviceType) + texts_[i].second : texts_[i].second;
+  }
+  return summary;
 }
 
 void RuvoReportingSession::appendNested(NestedPayloadEntry entry) {
@@ -422,36 +452,9 @@ void RuvoReportingSession::appendNested(NestedPayloadEntry entry) {
 }
 
 std::optional<Dictionary> RuvoReportingSession::createSummaryEventForSession() {
-  std::shared_ptr<PayloadList> list = aggregatedPayloadData();
-  if (!list) return std::nullopt;
-
-  // Key -> the text forms of its values in payload order; the service type comes first.
-  Dictionary collector = MakeDictionary();
-  collector[kSummaryEventKey] = Value::array({std::to_string(serviceType())});
-  {
-    std::lock_guard lock(list->mutex);
-    if (list->items.empty()) return std::nullopt;
-    for (const PayloadPtr& payload : list->items) {
-      if (!payload || !payload->is_object()) continue;
-      for (const auto& item : payload->items()) {
-        Value& values = collector[item.key()];
-        if (values.is_null()) values = Value::array();
-        values.push_back(ValueText(item.value()));
-      }
-    }
-  }
-
-  Dictionary summary = MakeDictionary();
-  for (const auto& item : collector.items()) {
-    std::string joined;
-    const Value& texts = item.value();
-    for (size_t i = 0; i < texts.size(); ++i) {
-      if (i > 0) joined += ',';
-      joined += texts[i].get_ref<const std::string&>();
-    }
-    summary[item.key()] = std::move(joined);
-  }
-  return summary;
+  std::shared_ptr<SummaryTexts> texts = summaryTexts();
+  if (!texts) return std::nullopt;
+  return texts->Summary(serviceType());
 }
 
 void RuvoReportingSession::writeSummaryJson() {
@@ -556,7 +559,7 @@ void RuvoReportingSession::orientationChanged(OrientationKind kind,
   Dictionary record = MakeDictionary();
   record[device ? "device_orientation" : "ui_orientation"] = text;
   record[device ? "device_orientation_time" : "ui_orientation_time"] = time;
-  appendAggregated(std::make_shared<const Dictionary>(std::move(record)));
+  appendAggregated(record);
 }
 
 void RuvoReportingSession::sendSingleMessage(const Dictionary& payload, uint32_t category,
@@ -652,9 +655,9 @@ std::optional<SteadyTime> RuvoReportingSession::startDate() const {
   return startDate_;
 }
 
-std::shared_ptr<PayloadList> RuvoReportingSession::aggregatedPayloadData() const {
+std::shared_ptr<SummaryTexts> RuvoReportingSession::summaryTexts() const {
   std::lock_guard lock(propertyMutex_);
-  return aggregatedPayloadData_;
+  return summaryTexts_;
 }
 
 std::shared_ptr<NestedPayloadList> RuvoReportingSession::nestedAggregatedPayloadData() const {

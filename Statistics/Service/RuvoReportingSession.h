@@ -7,6 +7,8 @@
 #include <mutex>
 #include <optional>
 #include <string>
+#include <unordered_map>
+#include <utility>
 #include <vector>
 
 #include "base/Dictionary.h"
@@ -47,8 +49,25 @@ struct LockedList {
     return items;
   }
 };
-using PayloadList = LockedList<PayloadPtr>;
 using NestedPayloadList = LockedList<NestedPayloadEntry>;
+
+// The summary event's texts, built as messages arrive so that a session's memory grows with its
+// distinct keys and their texts, not with copies of every payload: per key, the text forms of its
+// values joined with ",", keys in the order first seen, the summary key first.
+class SummaryTexts {
+ public:
+  void Add(const Dictionary& payload);
+  // Payloads added so far (an empty one counts).
+  size_t payloadCount() const;
+  // The summary event, the summary key's text led by `serviceType`; none when nothing was added.
+  std::optional<Dictionary> Summary(uint16_t serviceType) const;
+
+ private:
+  mutable std::mutex mutex_;
+  size_t payloadCount_ = 0;                                 // guarded by mutex_
+  std::vector<std::pair<std::string, std::string>> texts_;  // guarded by mutex_
+  std::unordered_map<std::string, size_t> indexOfKey_;      // guarded by mutex_
+};
 
 // One reporting session of one client, named by its reporter ID. It owns the real-time reporting
 // session (TelvoroSession) through which its messages reach the back-ends, gives every message a
@@ -146,8 +165,9 @@ class RuvoReportingSession : public std::enable_shared_from_this<RuvoReportingSe
   uint16_t serviceType() const { return serviceType_.load(std::memory_order_acquire); }
   std::optional<std::string> orientationCallbackID() const;
   std::optional<SteadyTime> startDate() const;
-  // The lists, or null while the session is stopped. Lock a list's own mutex to read it.
-  std::shared_ptr<PayloadList> aggregatedPayloadData() const;
+  // The aggregation, or null while the session is stopped. The nested list is kept only on
+  // internal builds, the only ones that write it; lock its own mutex to read it.
+  std::shared_ptr<SummaryTexts> summaryTexts() const;
   std::shared_ptr<NestedPayloadList> nestedAggregatedPayloadData() const;
   TelvoroSessionPtr telvoroSession() const;
   TelvoroTokenPtr telvoroAgentToken() const;
@@ -178,7 +198,7 @@ class RuvoReportingSession : public std::enable_shared_from_this<RuvoReportingSe
                uint16_t type, bool startedAtSend);
   void registerOrientationCallbacks();
   void orientationChanged(OrientationKind kind, const OrientationValue& orientation);
-  void appendAggregated(PayloadPtr payload);
+  void appendAggregated(const Dictionary& payload);
   void appendNested(NestedPayloadEntry entry);
   void setTelvoroSession(TelvoroSessionPtr session);
 
@@ -197,7 +217,7 @@ class RuvoReportingSession : public std::enable_shared_from_this<RuvoReportingSe
   std::optional<std::string> serviceName_;
   std::optional<std::string> orientationCallbackID_;
   std::optional<SteadyTime> startDate_;
-  std::shared_ptr<PayloadList> aggregatedPayloadData_;
+  std::shared_ptr<SummaryTexts> summaryTexts_;
   std::shared_ptr<NestedPayloadList> nestedAggregatedPayloadData_;
   TelvoroSessionPtr telvoroSession_;
   TelvoroTokenPtr telvoroAgentToken_;

@@ -78,12 +78,9 @@ class SessionTestBase : public ::testing::Test {
     return count;
   }
 
-  // The payloads of a list, or nothing when the list is gone.
-  static std::vector<Dictionary> Payloads(const std::shared_ptr<PayloadList>& list) {
-    std::vector<Dictionary> payloads;
-    if (!list) return payloads;
-    for (const auto& payload : list->Snapshot()) payloads.push_back(*payload);
-    return payloads;
+  // Payloads aggregated, none when the aggregation is gone.
+  static size_t Aggregated(const std::shared_ptr<SummaryTexts>& texts) {
+    return texts ? texts->payloadCount() : 0;
   }
   static std::vector<Value> Entries(const std::shared_ptr<NestedPayloadList>& list) {
     std::vector<Value> entries;

@@ -79,13 +79,13 @@ TEST_F(OrientationTest, TimesAreRoundedToWholeMilliseconds) {
   platform.clock.Advance(microseconds(500));  // 2.0009 s: rounded, not cut off
   platform.orientation.FireDevice("face-up");
 
-  const auto records = Payloads(session->aggregatedPayloadData());
-  ASSERT_EQ(records.size(), 3u);
-  EXPECT_EQ(records[0],
-            (Dictionary{{"ui_orientation", "landscape-left"}, {"ui_orientation_time", 0.013}}));
-  EXPECT_EQ(records[1],
-            (Dictionary{{"device_orientation", "portrait"}, {"device_orientation_time", 2.0}}));
-  EXPECT_EQ(records[2]["device_orientation_time"].get<double>(), 2.001);
+  EXPECT_EQ(Aggregated(session->summaryTexts()), 3u);
+  const Dictionary summary{{"Ruvo_Session_Summary_Event", "2"},
+                           {"ui_orientation", "landscape-left"},
+                           {"ui_orientation_time", "0.013"},
+                           {"device_orientation", "portrait,face-up"},
+                           {"device_orientation_time", "2,2.001"}};
+  EXPECT_EQ(session->createSummaryEventForSession()->dump(), summary.dump());
   // Records are not messages: not counted, not in the nested list.
   EXPECT_EQ(session->messageTypeCounts(), Dictionary::object());
   EXPECT_TRUE(Entries(session->nestedAggregatedPayloadData()).empty());
@@ -133,7 +133,7 @@ TEST_F(OrientationTest, ATypeChangedBeforeStopLeavesTheCallbacksRegistered) {
   session.reset();
   EXPECT_FALSE(weak.expired());
   EXPECT_EQ(platform.orientation.FireDevice("portrait"), 1u);
-  EXPECT_EQ(weak.lock()->aggregatedPayloadData(), nullptr);
+  EXPECT_EQ(weak.lock()->summaryTexts(), nullptr);
   EXPECT_EQ(CountMessage("deallocing this session 42"), 0u);
 }
 
@@ -144,7 +144,7 @@ TEST_F(OrientationTest, ASessionReleasedWithoutStopStaysRegistered) {
   EXPECT_FALSE(weak.expired());
   EXPECT_EQ(platform.orientation.RegisteredCount(Kind::kDevice), 1u);
   platform.orientation.FireUI("portrait");
-  EXPECT_EQ(Payloads(weak.lock()->aggregatedPayloadData()).size(), 1u);
+  EXPECT_EQ(Aggregated(weak.lock()->summaryTexts()), 1u);
 }
 
 TEST_F(OrientationTest, StopOfANeverStartedSessionUnregistersNothing) {
@@ -162,7 +162,7 @@ TEST_F(OrientationTest, RestartRegistersAgainWithANewStartDate) {
   EXPECT_TRUE(platform.orientation.IsRegistered(Kind::kDevice, kCallbackID));
   platform.clock.Advance(milliseconds(1));
   platform.orientation.FireDevice("portrait");
-  EXPECT_EQ(Payloads(session->aggregatedPayloadData())[0]["device_orientation_time"], 0.001);
+  EXPECT_EQ((*session->createSummaryEventForSession())["device_orientation_time"], "0.001");
   session->stop();
 }
 

