@@ -5,6 +5,7 @@
 
 #include <atomic>
 #include <filesystem>
+#include <functional>
 #include <mutex>
 #include <thread>
 #include <vector>
@@ -63,21 +64,37 @@ class ExportingDelegate final : public ServiceListenerDelegate {
   std::shared_ptr<RecordingObject> object_;
 };
 
-TEST(UnixServiceListenerTest, ClosedReadGateHoldsRequestsBackAndLosesNoneWhenItOpens) {
-  testing::FakeLogSystem log;
-  const std::string directory = testing::MakeTempDirectory("tavrin-listener-");
-  UnixServiceListener listener(UnixListenerOptions{directory + "/reporting.sock"});
-  listener.Open();
-  auto object = std::make_shared<RecordingObject>();
-  ExportingDelegate delegate(object);
-  listener.SetDelegate(&delegate);
+// A listener on a real socket whose connections export one RecordingObject, its I/O loop on a
+// thread of its own; the read gate is the test's to set before Run().
+class UnixServiceListenerTest : public ::testing::Test {
+ protected:
+  void Run(std::function<ReadGate()> gate) {
+    listener_.Open();
+    listener_.SetDelegate(&delegate_);
+    listener_.SetReadGate(std::move(gate));
+    io_ = std::thread([this] { listener_.Resume(); });
+  }
+  void TearDown() override {
+    listener_.Stop();
+    if (io_.joinable()) io_.join();
+    std::filesystem::remove_all(directory_);
+  }
+
+  testing::FakeLogSystem log_;
+  const std::string directory_ = testing::MakeTempDirectory("tavrin-listener-");
+  UnixServiceListener listener_{UnixListenerOptions{directory_ + "/reporting.sock"}};
+  std::shared_ptr<RecordingObject> object_ = std::make_shared<RecordingObject>();
+  ExportingDelegate delegate_{object_};
+  std::thread io_;
+};
+
+TEST_F(UnixServiceListenerTest, ClosedReadGateHoldsRequestsBackAndLosesNoneWhenItOpens) {
   std::atomic<bool> open{false};
-  listener.SetReadGate([&] { return open.load() ? ReadGate::kOpen : ReadGate::kAllWait; });
-  std::thread io([&] { listener.Resume(); });
+  Run([&] { return open.load() ? ReadGate::kOpen : ReadGate::kAllWait; });
 
   constexpr int kMessages = 2000;
   {
-    testing::TestClient client(listener.SocketPath());
+    testing::TestClient client(listener_.SocketPath());
     ASSERT_TRUE(client.connected());
     std::thread sender([&] {
       for (int i = 0; i < kMessages; ++i) {
@@ -85,14 +102,14 @@ TEST(UnixServiceListenerTest, ClosedReadGateHoldsRequestsBackAndLosesNoneWhenItO
             protocol::SendMessage{Dictionary{{"i", i}}, static_cast<uint32_t>(i), 0, std::nullopt});
       }
     });
-    ASSERT_TRUE(testing::WaitUntil([&] { return listener.ReadGateStalls() > 3; }));
-    EXPECT_TRUE(object->Categories().empty());
+    ASSERT_TRUE(testing::WaitUntil([&] { return listener_.ReadGateStalls() > 3; }));
+    EXPECT_TRUE(object_->Categories().empty());
 
     open = true;
     sender.join();
-    ASSERT_TRUE(testing::WaitUntil([&] { return object->Categories().size() == kMessages; }))
-        << object->Categories().size();
-    const auto categories = object->Categories();
+    ASSERT_TRUE(testing::WaitUntil([&] { return object_->Categories().size() == kMessages; }))
+        << object_->Categories().size();
+    const auto categories = object_->Categories();
     for (int i = 0; i < kMessages; ++i) ASSERT_EQ(categories[i], static_cast<uint32_t>(i));
 
     // A reply still comes through once the gate is open again after a pause.
@@ -104,30 +121,19 @@ TEST(UnixServiceListenerTest, ClosedReadGateHoldsRequestsBackAndLosesNoneWhenItO
     ASSERT_TRUE(reply);
     EXPECT_EQ(reply->call, 7u);
   }
-  listener.Stop();
-  io.join();
-  std::filesystem::remove_all(directory);
 }
 
 // While the service is behind, a client that floods waits and one that makes round trips does
 // not: with every connection paused, the round trips would stall until the flood drained.
-TEST(UnixServiceListenerTest, BehindOnlyTheHeavySenderWaitsAndRoundTripsGoOn) {
-  testing::FakeLogSystem log;
-  const std::string directory = testing::MakeTempDirectory("tavrin-listener-");
-  UnixServiceListener listener(UnixListenerOptions{directory + "/reporting.sock"});
-  listener.Open();
-  auto object = std::make_shared<RecordingObject>();
-  ExportingDelegate delegate(object);
-  listener.SetDelegate(&delegate);
+TEST_F(UnixServiceListenerTest, BehindOnlyTheHeavySenderWaitsAndRoundTripsGoOn) {
   std::atomic<bool> behind{false};
-  listener.SetReadGate([&] { return behind ? ReadGate::kHeavySendersWait : ReadGate::kOpen; });
-  std::thread io([&] { listener.Resume(); });
+  Run([&] { return behind ? ReadGate::kHeavySendersWait : ReadGate::kOpen; });
   {
-    testing::TestClient flooder(listener.SocketPath());
-    testing::TestClient asker(listener.SocketPath());
+    testing::TestClient flooder(listener_.SocketPath());
+    testing::TestClient asker(listener_.SocketPath());
     const Dictionary payload{{"filler", std::string(512, 'x')}};
     for (int i = 0; i < 200; ++i) flooder.SendNoReply(protocol::SendMessage{payload, 1, 0, {}});
-    ASSERT_TRUE(testing::WaitUntil([&] { return object->Categories().size() == 200; }));
+    ASSERT_TRUE(testing::WaitUntil([&] { return object_->Categories().size() == 200; }));
     behind = true;
     std::atomic<bool> stop{false};
     std::thread flood([&] {
@@ -140,16 +146,13 @@ TEST(UnixServiceListenerTest, BehindOnlyTheHeavySenderWaitsAndRoundTripsGoOn) {
       if (!asker.Read(std::chrono::seconds(5))) break;
       ++answered;
     }
-    const uint64_t stalls = listener.ReadGateStalls();
+    const uint64_t stalls = listener_.ReadGateStalls();
     stop = true;
     behind = false;  // lets a send blocked on a full socket finish
     flood.join();
     EXPECT_EQ(answered, 50u) << "round trips stalled behind the flood";
     EXPECT_GT(stalls, 0u) << "the flooder never waited";
   }
-  listener.Stop();
-  io.join();
-  std::filesystem::remove_all(directory);
 }
 
 }  // namespace
