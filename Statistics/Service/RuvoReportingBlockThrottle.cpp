@@ -147,6 +147,10 @@ std::string RuvoReportingBlockThrottle::buildMessageKey(const Dictionary& messag
     append(name);
     if (excluded.contains(name)) {
       append(kExcludedValueText);
+    } else if (value->is_structured()) {
+      // Equal dictionaries built in different orders are the same message: nested keys are
+      // sorted at every depth (nlohmann::json keeps its keys in a sorted map).
+      append(nlohmann::json::parse(value->dump()).dump());
     } else {
       append(ValueText(*value));
     }
