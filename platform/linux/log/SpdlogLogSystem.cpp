@@ -98,13 +98,13 @@ SpdlogLogSystem::SpdlogLogSystem(DefaultsDomain& defaults, LogTargetKind target)
     sharedSink_ = std::make_shared<spdlog::sinks::stderr_sink_mt>();
     sharedSink_->set_formatter(MakeLogLineFormatter());
   }
-  defaultScope_ = MakeScope(ScopeInfo{true, 0, kDefaultScopeName, "", "", 0});
+  defaultScope_ = MakeScope(ScopeInfo{true, 0, kDefaultScopeName, "", kDefaultLogVerbosityKey, 0});
 }
 
 SpdlogLogSystem::SpdlogLogSystem(DefaultsDomain& defaults, spdlog::sink_ptr sink)
     : defaults_(defaults), target_(LogTargetKind::kStderr), sharedSink_(std::move(sink)) {
   sharedSink_->set_formatter(MakeLogLineFormatter());
-  defaultScope_ = MakeScope(ScopeInfo{true, 0, kDefaultScopeName, "", "", 0});
+  defaultScope_ = MakeScope(ScopeInfo{true, 0, kDefaultScopeName, "", kDefaultLogVerbosityKey, 0});
 }
 
 SpdlogLogSystem::~SpdlogLogSystem() = default;
@@ -153,7 +153,7 @@ void SpdlogLogSystem::Refresh() {
       if (auto scope = weak.lock()) live.push_back(std::move(scope));
     }
   }
-  if (live.empty()) return;
+  live.push_back(defaultScope_);
   // Read outside the lock: a defaults domain that fails to parse logs through this system.
   const Dictionary settings = defaults_.Read();
   for (const auto& scope : live) {

@@ -32,6 +32,9 @@ enum class LogTargetKind { kStderr, kJournal };
 class SpdlogLogSystem final : public LogSystem {
  public:
   static constexpr const char* kDefaultScopeName = "default";
+  // The defaults key that switches the default log's debug lines (components without a scope of
+  // their own, such as the block throttle, write there), like the scopes' own keys.
+  static constexpr const char* kDefaultLogVerbosityKey = "default_log_verbose";
 
   // `defaults` must outlive this object and every scope it hands out.
   SpdlogLogSystem(DefaultsDomain& defaults, LogTargetKind target);

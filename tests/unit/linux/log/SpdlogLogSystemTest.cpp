@@ -139,6 +139,21 @@ TEST_F(SpdlogLogSystemTest, DebugLinesPassOnlyAtVerboseLevelAfterRefresh) {
   EXPECT_NE(sink_->Lines()[0].payload.find("now heard counted"), std::string::npos);
 }
 
+// Components without a scope of their own (the block throttle) write to the default log: its
+// debug lines too can be switched on, by their own key.
+TEST_F(SpdlogLogSystemTest, DefaultLogDebugLinesFollowTheirOwnKey) {
+  LogScope& log = system_.DefaultLog();
+  EXPECT_FALSE(log.ShouldLog(LogLevel::kDebug));
+  defaults_.Set(SpdlogLogSystem::kDefaultLogVerbosityKey, 5);
+  system_.Refresh();
+  TLOG_DEBUG(log, "heard");
+  ASSERT_EQ(sink_->Lines().size(), 1u);
+  EXPECT_NE(sink_->Lines()[0].payload.find("heard"), std::string::npos);
+  defaults_.Set(SpdlogLogSystem::kDefaultLogVerbosityKey, 0);
+  system_.Refresh();
+  EXPECT_FALSE(log.ShouldLog(LogLevel::kDebug));
+}
+
 TEST_F(SpdlogLogSystemTest, VerbosityValuesOfEveryType) {
   LogHandle handle = RegisterServerScope();
   auto verboseAfter = [&](Value value) {
