@@ -138,26 +138,18 @@ TEST(TavrinctlDefaultsTest, ValuesAreTypedLikeTomlAndEverythingElseIsAString) {
 
 TEST(TavrinctlDefaultsTest, EditsKeepCommentsOrderTheOtherKeysAndTheTopLevelTable) {
   const std::string text =
-      "# tavrin settings\n"
-      "device_name = \"kitchen\"  # shown in summaries\n"
-      "prefixes = [\n  \"a\",\n]\n"
-      "\n# last\n"
-      "verbose = 5\n";
+      "# settings\nname = \"k\"  # shown\nlist = [\n  1,\n]\n\n# last\nv = 5\n";
   const struct {
     std::string before, key, value, after;
     bool found;
   } sets[] = {
-      {text, "device_name", "'hall'",
-       "# tavrin settings\ndevice_name = 'hall'  # shown in summaries\nprefixes = [\n  \"a\",\n]"
-       "\n\n# last\nverbose = 5\n",
+      {text, "name", "'h'", "# settings\nname = 'h'  # shown\nlist = [\n  1,\n]\n\n# last\nv = 5\n",
        true},
       // A value over several lines is replaced whole.
-      {text, "prefixes", "[\"c\"]",
-       "# tavrin settings\ndevice_name = \"kitchen\"  # shown in summaries\nprefixes = [\"c\"]\n"
-       "\n# last\nverbose = 5\n",
+      {text, "list", "[2]", "# settings\nname = \"k\"  # shown\nlist = [2]\n\n# last\nv = 5\n",
        true},
       // New keys go after the last top-level setting, never under a [table]...
-      {text, "disable_reporting", "true", text + "disable_reporting = true\n", false},
+      {text, "c", "true", text + "c = true\n", false},
       {"a = 1\n\n[extra]\nb = 2\n", "c", "true", "a = 1\nc = true\n\n[extra]\nb = 2\n", false},
       // ... and without one after the leading comments, before the first table.
       {"# header\n\n[extra]\nb = 2\n", "c", "true", "# header\n\nc = true\n[extra]\nb = 2\n",
