@@ -252,50 +252,33 @@ constexpr const char* kPwLink = "/usr/bin/pw-link";
 
 // A daemon without sound hardware: the dummy driver clocks a test source linked to a null sink.
 constexpr const char* kDaemonConfig = R"(
-context.properties = {
-    support.dbus = false
-    core.daemon = true
-    core.name = pipewire-0
-    mem.allow-mlock = false
-    default.clock.rate = 48000
-    default.clock.quantum = 1024
-}
-context.spa-libs = {
-    audio.convert.* = audioconvert/libspa-audioconvert
-    support.*       = support/libspa-support
-    audiotestsrc    = audiotestsrc/libspa-audiotestsrc
-}
-context.modules = [
-    { name = libpipewire-module-protocol-native }
-    { name = libpipewire-module-profiler }
-    { name = libpipewire-module-metadata }
-    { name = libpipewire-module-spa-node-factory }
-    { name = libpipewire-module-client-node }
-    { name = libpipewire-module-access args = { } }
-    { name = libpipewire-module-adapter }
-    { name = libpipewire-module-link-factory }
-]
+context.properties = { support.dbus = false core.daemon = true core.name = pipewire-0
+  mem.allow-mlock = false default.clock.rate = 48000 default.clock.quantum = 1024 }
+context.spa-libs = { audio.convert.* = audioconvert/libspa-audioconvert
+  support.* = support/libspa-support audiotestsrc = audiotestsrc/libspa-audiotestsrc }
+context.modules = [ { name = libpipewire-module-protocol-native }
+  { name = libpipewire-module-profiler } { name = libpipewire-module-metadata }
+  { name = libpipewire-module-spa-node-factory } { name = libpipewire-module-client-node }
+  { name = libpipewire-module-access args = { } } { name = libpipewire-module-adapter }
+  { name = libpipewire-module-link-factory } ]
 context.objects = [
-    { factory = spa-node-factory
-      args = { factory.name = support.node.driver node.name = Dummy-Driver
-               node.group = pipewire.dummy priority.driver = 20000 } }
-    { factory = adapter
-      args = { factory.name = support.null-audio-sink node.name = "test sink"
-               media.class = Audio/Sink audio.position = [ FL FR ] node.group = pipewire.dummy
-               adapter.auto-port-config = { mode = dsp monitor = false control = false
-                                            position = preserve } } }
-    { factory = adapter
-      args = { factory.name = audiotestsrc node.name = test-source media.class = Audio/Source
-               audio.position = [ FL FR ] node.group = pipewire.dummy
-               adapter.auto-port-config = { mode = dsp monitor = false control = false
-                                            position = preserve } } }
+  { factory = spa-node-factory args = { factory.name = support.node.driver
+      node.name = Dummy-Driver node.group = pipewire.dummy priority.driver = 20000 } }
+  { factory = adapter args = { factory.name = support.null-audio-sink node.name = "test sink"
+      media.class = Audio/Sink audio.position = [ FL FR ] node.group = pipewire.dummy
+      adapter.auto-port-config = { mode = dsp monitor = false control = false
+                                   position = preserve } } }
+  { factory = adapter args = { factory.name = audiotestsrc node.name = test-source
+      media.class = Audio/Source audio.position = [ FL FR ] node.group = pipewire.dummy
+      adapter.auto-port-config = { mode = dsp monitor = false control = false
+                                   position = preserve } } }
 ]
 )";
 
-// Polls `done` every 50 ms for up to `timeout` (generous: the machine is shared and loaded).
+// Polls `done` every 50 ms for up to 30 s (generous: the machine is shared and loaded).
 template <typename Predicate>
-bool Eventually(Predicate done, std::chrono::seconds timeout = std::chrono::seconds(30)) {
-  const auto deadline = std::chrono::steady_clock::now() + timeout;
+bool Eventually(Predicate done) {
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(30);
   while (std::chrono::steady_clock::now() < deadline) {
     if (done()) return true;
     std::this_thread::sleep_for(std::chrono::milliseconds(50));
