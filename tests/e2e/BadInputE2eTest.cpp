@@ -1,7 +1,5 @@
 #include <gtest/gtest.h>
 
-#include <csignal>
-
 #include "tests/support/TavrindProcess.h"
 
 namespace tavrin {
@@ -22,7 +20,8 @@ std::vector<uint8_t> RawRequest(uint64_t call, const Value& op, std::vector<Valu
 }
 
 // One service for every case: each case also checks that a bystander client's session is
-// untouched by what the bad client did.
+// untouched by what the bad client did. Which request gets which code is the codec's unit tests'
+// business; here the running service answers them, survives them and keeps the others served.
 class BadInputE2eTest : public ::testing::Test {
  protected:
   static void SetUpTestSuite() {
@@ -47,21 +46,6 @@ class BadInputE2eTest : public ::testing::Test {
     EXPECT_EQ(reply->value["reporterID"], 4242);
   }
 
-  // Expects a status 2 reply for `call` with `code`, and that the connection still serves.
-  static void ExpectRejected(TestClient& client, uint64_t call, RejectCode code) {
-    auto reply = client.Read();
-    ASSERT_TRUE(reply) << service->Log();
-    EXPECT_EQ(reply->call, call);
-    EXPECT_EQ(reply->status, Status::kRejected);
-    EXPECT_EQ(reply->value["domain"], "com.quorvex.tavrin.protocol");
-    EXPECT_EQ(reply->value["code"], static_cast<int64_t>(code));
-    EXPECT_TRUE(reply->value["reason"].is_string());
-    client.Send(call + 1000, protocol::GetAllReporters{});
-    auto next = client.Read();
-    ASSERT_TRUE(next) << "connection no longer serves after a rejected request";
-    EXPECT_EQ(next->call, call + 1000);
-  }
-
   static TavrindProcess* service;
   static TestClient* bystander;
 };
@@ -70,79 +54,55 @@ TavrindProcess* BadInputE2eTest::service = nullptr;
 TestClient* BadInputE2eTest::bystander = nullptr;
 
 TEST_F(BadInputE2eTest, RequestsThatAreUnderstoodBadlyAreAnsweredAndTheConnectionStays) {
-  TestClient client(service->SocketPath());
-  client.SendBody(RawRequest(1, 12, {}));
-  ExpectRejected(client, 1, RejectCode::kUnknownOp);
-  client.SendBody(RawRequest(2, 1, {}));
-  ExpectRejected(client, 2, RejectCode::kWrongArgumentCount);
-  client.SendBody(RawRequest(3, 1, {"seven"}));
-  ExpectRejected(client, 3, RejectCode::kWrongArgumentType);
-  client.SendBody(RawRequest(4, 2, {70000, 7}));
-  ExpectRejected(client, 4, RejectCode::kIntegerOutOfRange);
-  client.SendBody(RawRequest(5, 1, {uint64_t{1} << 63}));
-  ExpectRejected(client, 5, RejectCode::kIntegerOutOfRange);
-  client.SendBody(RawRequest(6, 6, {Value::binary({1, 2, 3}), 1, 0, nullptr}));
-  ExpectRejected(client, 6, RejectCode::kUnsupportedType);
-  client.SendBody(RawRequest(7, 4, {Value::array({1}), 7}));
-  ExpectRejected(client, 7, RejectCode::kWrongArgumentType);
-}
-
-TEST_F(BadInputE2eTest, NestingDeeperThanTheLimitIsRejectedWithoutHarm) {
-  TestClient client(service->SocketPath());
-  // [8, 6, {"a": [[[...]]]}, 1, 0, nil] nested 70 deep inside the message.
-  std::vector<uint8_t> body{0x96, 0x08, 0x06, 0x81, 0xa1, 'a'};
-  for (int i = 0; i < 70; ++i) body.push_back(0x91);
-  body.push_back(0x01);
-  body.insert(body.end(), {0x01, 0x00, 0xc0});
-  client.SendBody(body);
-  ExpectRejected(client, 8, RejectCode::kTooDeep);
-
-  // A deep value sized to overflow a recursive parser's stack.
-  std::vector<uint8_t> deep{0x93, 0x09, 0x01};  // [9, 1, <deep>]
-  for (int i = 0; i < 200000; ++i) deep.push_back(0x91);
+  // A deep value sized to overflow a recursive parser's stack: [6, 1, [[[...1]]]].
+  std::vector<uint8_t> deep{0x93, 0x06, 0x01};
+  deep.insert(deep.end(), 200000, 0x91);
   deep.push_back(0x01);
-  client.SendBody(deep);
-  ExpectRejected(client, 9, RejectCode::kTooDeep);
+  const struct {
+    std::vector<uint8_t> body;
+    RejectCode code;
+  } cases[] = {
+      {RawRequest(1, 12, {}), RejectCode::kUnknownOp},
+      {RawRequest(2, 1, {}), RejectCode::kWrongArgumentCount},
+      {RawRequest(3, 1, {"seven"}), RejectCode::kWrongArgumentType},
+      {RawRequest(4, 2, {70000, 7}), RejectCode::kIntegerOutOfRange},
+      {RawRequest(5, 6, {Value::binary({1, 2, 3}), 1, 0, nullptr}), RejectCode::kUnsupportedType},
+      {deep, RejectCode::kTooDeep},
+  };
+  TestClient client(service->SocketPath());
+  // A nil call runs its operation and answers nothing, so the first reply is the first case's.
+  client.SendNoReply(protocol::CreateReportingSession{55});
+  for (uint64_t call = 1; call <= std::size(cases); ++call) {
+    client.SendBody(cases[call - 1].body);
+    auto reply = client.Read();
+    ASSERT_TRUE(reply) << "case " << call << "\n" << service->Log();
+    EXPECT_EQ(reply->call, call);
+    EXPECT_EQ(reply->status, Status::kRejected) << call;
+    EXPECT_EQ(reply->value["domain"], "com.quorvex.tavrin.protocol") << call;
+    EXPECT_EQ(reply->value["code"], static_cast<int64_t>(cases[call - 1].code)) << call;
+  }
+  client.Send(100, protocol::ReporterIDValid{55});
+  auto reply = client.Read();
+  ASSERT_TRUE(reply) << "connection no longer serves after rejected requests";
+  EXPECT_EQ(reply->call, 100u);
+  EXPECT_EQ(reply->value["reporterID"], 55);
 }
 
-TEST_F(BadInputE2eTest, UndecodableFramesCloseOnlyThatConnection) {
-  {
+TEST_F(BadInputE2eTest, UndecodableFramesAndBadLengthsCloseOnlyThatConnection) {
+  std::vector<uint8_t> trailing = RawRequest(2, 10, {});
+  trailing.push_back(0x00);  // a byte after the request, inside its frame
+  const std::vector<std::vector<uint8_t>> streams = {
+      protocol::EncodeFrame(std::vector<uint8_t>{0xc1}),  // a never-used MessagePack byte
+      protocol::EncodeFrame(MsgPack(Value::object({{"not", "an array"}}))),
+      protocol::EncodeFrame(MsgPack(Value::array({-1, 10}))),  // call must be unsigned or nil
+      protocol::EncodeFrame(trailing),
+      {0, 0, 0, 0},
+      {0x00, 0x20, 0x00, 0x00},  // 2 MiB, over the 1 MiB limit
+  };
+  for (const auto& bytes : streams) {
     TestClient client(service->SocketPath());
-    client.SendBody({0xc1});  // never-used MessagePack byte
-    EXPECT_TRUE(client.WaitForClose());
-  }
-  {
-    TestClient client(service->SocketPath());
-    client.SendBody(MsgPack(Value::object({{"not", "an array"}})));
-    EXPECT_TRUE(client.WaitForClose());
-  }
-  {
-    TestClient client(service->SocketPath());
-    client.SendBody(RawRequest(1, 10, {}));
-    auto ok = client.Read();
-    ASSERT_TRUE(ok);
-    std::vector<uint8_t> trailing = RawRequest(2, 10, {});
-    trailing.push_back(0x00);
-    client.SendBody(trailing);
-    EXPECT_TRUE(client.WaitForClose());
-  }
-  {
-    TestClient client(service->SocketPath());
-    client.SendBody(MsgPack(Value::array({-1, 10})));  // call must be unsigned or nil
-    EXPECT_TRUE(client.WaitForClose());
-  }
-}
-
-TEST_F(BadInputE2eTest, BadFrameLengthsCloseTheConnection) {
-  {
-    TestClient client(service->SocketPath());
-    client.SendBytes({0, 0, 0, 0});
-    EXPECT_TRUE(client.WaitForClose());
-  }
-  {
-    TestClient client(service->SocketPath());
-    client.SendBytes({0x00, 0x20, 0x00, 0x00});  // 2 MiB, over the 1 MiB limit
-    EXPECT_TRUE(client.WaitForClose());
+    client.SendBytes(bytes);
+    EXPECT_TRUE(client.WaitForClose()) << "stream of " << bytes.size() << " bytes";
   }
 }
 
@@ -165,16 +125,6 @@ TEST_F(BadInputE2eTest, FrameCutOffByADisconnectInterruptsTheConnection) {
   }
   EXPECT_TRUE(service->WaitForLog("InvalidationHandler: connection exited", invalidations + 2));
   EXPECT_EQ(service->LogCount("InterruptionHandler: connection exited"), before + 1);
-}
-
-TEST_F(BadInputE2eTest, NilCallRunsTheOperationAndAnswersNothing) {
-  TestClient client(service->SocketPath());
-  client.SendNoReply(protocol::CreateReportingSession{55});
-  client.Send(2, protocol::ReporterIDValid{55});
-  auto reply = client.Read();
-  ASSERT_TRUE(reply);
-  EXPECT_EQ(reply->call, 2u);  // nothing came for the nil call
-  EXPECT_EQ(reply->value["reporterID"], 55);
 }
 
 }  // namespace

@@ -1,15 +1,15 @@
 // tavrinctl as its users run it: the real binary, through /bin/sh, against the real tavrind.
+// Every operation is exercised through the client library's own e2e suite; here only what the
+// tool adds: reading stdin, the exit statuses, the store and summary readers, the defaults edits
+// the service picks up, and the shell.
 
 #include <gtest/gtest.h>
 
 #ifdef TAVRINCTL_PATH
 
-#include <fcntl.h>
-#include <sys/socket.h>
-#include <sys/un.h>
 #include <sys/wait.h>
-#include <unistd.h>
 
+#include <csignal>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
@@ -39,14 +39,7 @@ struct Outcome {
 
 std::string ReadAll(const std::string& path) {
   std::ifstream in(path, std::ios::binary);
-  std::stringstream text;
-  text << in.rdbuf();
-  return text.str();
-}
-
-void WriteFile(const std::string& path, const std::string& text) {
-  std::filesystem::create_directories(std::filesystem::path(path).parent_path());
-  std::ofstream(path, std::ios::binary) << text;
+  return {std::istreambuf_iterator<char>(in), {}};
 }
 
 std::string Quote(const std::string& text) {
@@ -55,45 +48,23 @@ std::string Quote(const std::string& text) {
   return quoted + "'";
 }
 
-// Runs `command` with /bin/sh -c, stdout and stderr captured, in an environment without the
-// variables that would point tavrinctl elsewhere. Killed when it outlives the e2e time-out.
+// Runs `command` with /bin/sh -c, stdin empty, stdout and stderr captured, in an environment
+// without the variables that would point tavrinctl elsewhere; killed when it outlives the e2e
+// time-out.
 Outcome Sh(const std::string& command) {
   const std::string directory = testing::MakeTempDirectory("tavrinctl-run-");
-  const std::string outPath = directory + "/out";
-  const std::string errPath = directory + "/err";
-  const pid_t child = ::fork();
-  if (child == 0) {
-    const int out = ::open(outPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
-    const int err = ::open(errPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
-    const int none = ::open("/dev/null", O_RDONLY);
-    ::dup2(none, STDIN_FILENO);
-    ::dup2(out, STDOUT_FILENO);
-    ::dup2(err, STDERR_FILENO);
-    ::unsetenv("TAVRIN_SOCKET");
-    ::unsetenv("TAVRIN_ROOT");
-    ::unsetenv("TAVRIN_DEFAULTS");
-    ::execl("/bin/sh", "sh", "-c", command.c_str(), static_cast<char*>(nullptr));
-    ::_exit(127);
-  }
-  Outcome run;
-  int status = 0;
-  const bool exited = WaitUntil([&] { return ::waitpid(child, &status, WNOHANG) == child; });
-  if (!exited) {
-    ::kill(child, SIGKILL);
-    ::waitpid(child, &status, 0);
-    ADD_FAILURE() << "did not finish in time: " << command;
-  }
-  run.status = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
-  run.out = ReadAll(outPath);
-  run.err = ReadAll(errPath);
+  const int status = std::system(
+      ("env -u TAVRIN_SOCKET -u TAVRIN_ROOT -u TAVRIN_DEFAULTS timeout -s KILL 20 /bin/sh -c " +
+       Quote(command) + " </dev/null >" + directory + "/out 2>" + directory + "/err")
+          .c_str());
+  Outcome run{WIFEXITED(status) ? WEXITSTATUS(status) : -1, ReadAll(directory + "/out"),
+              ReadAll(directory + "/err")};
+  EXPECT_NE(run.status, 128 + SIGKILL) << "did not finish in time: " << command;
   // A sanitizer's report may come with the very exit status a test expects.
   for (const char* report : {"Sanitizer", "runtime error:"}) {
-    if (run.err.find(report) != std::string::npos) {
-      ADD_FAILURE() << "sanitizer report from: " << command << "\n" << run.err;
-    }
+    if (run.err.find(report) != std::string::npos) ADD_FAILURE() << command << "\n" << run.err;
   }
-  std::error_code ignored;
-  std::filesystem::remove_all(directory, ignored);
+  std::filesystem::remove_all(directory);
   return run;
 }
 
@@ -116,83 +87,56 @@ std::string Describe(const Outcome& run) {
   return "status " + std::to_string(run.status) + "\nstdout:\n" + run.out + "stderr:\n" + run.err;
 }
 
-// A root whose device is an internal build, so stopped sessions leave summary files.
-std::string InternalBuildRoot() {
-  const std::string root = testing::MakeTempDirectory("tavrin-e2e-");
-  WriteFile(root + "/etc/device.toml", "InternalBuild = true\n");
-  return root;
-}
-
 size_t RowCount(const TavrindProcess& service, const std::string& where) {
   return QueryStore(service.DatabasePath(), "SELECT 1 FROM session_messages WHERE " + where).size();
 }
 
 TEST(TavrinctlE2eTest, RecordFromAHereDocumentLeavesRowsAndASummaryThatEventsAndSummariesShow) {
-  TavrindProcess service({}, InternalBuildRoot());
+  // An internal build's device, so the stopped session leaves a summary file.
+  const std::string root = testing::MakeTempDirectory("tavrin-e2e-");
+  testing::WriteFileAtomically(root + "/etc/device.toml", "InternalBuild = true\n");
+  TavrindProcess service({}, root);
   ASSERT_TRUE(service.Start()) << service.Log();
-  const std::string ctl = Ctl(service.root());
+  const std::string ctl = Ctl(root);
 
   // Blank lines are skipped, not errors.
   const Outcome record = Sh(ctl +
                             " --json record --service-type haptics --category 2 --type 1 "
                             "--configuration '{\"HostApplicationDisplayID\": \"player\"}' <<'EOF'\n"
-                            "{\"level\": 3}\n"
-                            "\n"
-                            "   \n"
-                            "{\"level\": 5, \"route\": \"speaker\"}\n"
-                            "EOF\n");
+                            "{\"level\": 3}\n\n   \n{\"level\": 5, \"route\": \"speaker\"}\nEOF\n");
   ASSERT_EQ(record.status, 0) << Describe(record);
   const Json result = Json::parse(record.out);
   EXPECT_EQ(result["sent"], 2);
   EXPECT_EQ(result["stopped"], true);
-  const int64_t reporter = result["reporterID"].get<int64_t>();
-  ASSERT_NE(reporter, 0);
-  const std::string id = std::to_string(reporter);
+  const std::string id = std::to_string(result["reporterID"].get<int64_t>());
+  ASSERT_NE(id, "0");
 
   // The store commits on its own thread after the answers: two messages and the summary event.
   ASSERT_TRUE(WaitUntil([&] { return RowCount(service, "reporter_id = " + id) >= 3; }))
       << service.Log();
-
   const Outcome events = Sh(ctl + " events --json --table session_messages --reporter " + id);
   ASSERT_EQ(events.status, 0) << Describe(events);
   const std::vector<Json> rows = JsonLines(events.out);
   ASSERT_EQ(rows.size(), 3u) << events.out;
-  EXPECT_EQ(rows[0]["table"], "session_messages");
-  EXPECT_EQ(rows[0]["reporter_id"], reporter);
   EXPECT_EQ(rows[0]["category"], 2);
   EXPECT_EQ(rows[0]["type"], 1);
   // Payloads are objects in the output, not JSON text inside a string.
   EXPECT_EQ(rows[0]["payload"], Json({{"level", 3}}));
   EXPECT_EQ(rows[1]["payload"], Json({{"level", 5}, {"route", "speaker"}}));
   EXPECT_EQ(rows[2]["payload"]["level"], "3,5");
-  EXPECT_LE(rows[0]["received_at"].get<double>(), rows[2]["received_at"].get<double>());
 
-  // The most recent one, and the session row under the same reporter.
-  const Outcome latest = Sh(ctl + " --json events --reporter " + id + " --limit 1");
-  ASSERT_EQ(latest.status, 0) << Describe(latest);
-  EXPECT_EQ(JsonLines(latest.out).size(), 1u) << latest.out;
-  const Outcome sessions = Sh(ctl + " --json events --table sessions --reporter " + id);
-  ASSERT_EQ(JsonLines(sessions.out).size(), 1u) << Describe(sessions);
-  EXPECT_EQ(JsonLines(sessions.out)[0]["user_info"]["HostApplicationDisplayID"], "player");
-
-  const Outcome list = Sh(ctl + " --json summaries");
-  ASSERT_EQ(list.status, 0) << Describe(list);
-  const std::vector<Json> files = JsonLines(list.out);
-  ASSERT_EQ(files.size(), 1u) << list.out;
+  const std::vector<Json> files = JsonLines(Sh(ctl + " --json summaries").out);
+  ASSERT_EQ(files.size(), 1u);
   const std::string name = files[0]["name"];
   EXPECT_NE(name.find("-tavrin-player-haptics.json"), std::string::npos) << name;
-  EXPECT_GT(files[0]["size"].get<int64_t>(), 0);
-
   const Outcome show = Sh(ctl + " summaries show latest");
   ASSERT_EQ(show.status, 0) << Describe(show);
   const Json summary = Json::parse(show.out);
-  ASSERT_TRUE(summary.is_array()) << show.out;
-  ASSERT_GE(summary.size(), 3u);
-  EXPECT_EQ(summary[0]["HostApplicationDisplayID"], "player");
+  ASSERT_TRUE(summary.is_array() && summary.size() >= 3u) << show.out;
+  EXPECT_EQ(summary[0]["HostApplicationDisplayID"], "player");  // the user info comes first
   EXPECT_EQ(summary[1]["Record_Start_1"], Json({{"level", 3}}));
   EXPECT_EQ(Sh(ctl + " summaries show " + Quote(name)).out, show.out);
-  const Outcome missing = Sh(ctl + " summaries show nothing.json");
-  EXPECT_EQ(missing.status, 1) << Describe(missing);
+  EXPECT_EQ(Sh(ctl + " summaries show nothing.json").status, 1);
 }
 
 TEST(TavrinctlE2eTest, ABadLineEndsTheRecordingWithItsNumberAndTheSessionStillStops) {
@@ -200,16 +144,11 @@ TEST(TavrinctlE2eTest, ABadLineEndsTheRecordingWithItsNumberAndTheSessionStillSt
   ASSERT_TRUE(service.Start()) << service.Log();
   const std::string ctl = Ctl(service.root());
 
-  const Outcome record = Sh(ctl +
-                            " record --reporter 4242 <<'EOF'\n"
-                            "{\"ok\": 1}\n"
-                            "not json\n"
-                            "{\"never\": 1}\n"
-                            "EOF\n");
+  const Outcome record =
+      Sh(ctl + " record --reporter 4242 <<'EOF'\n{\"ok\": 1}\nnot json\n{\"never\": 1}\nEOF\n");
   EXPECT_EQ(record.status, 1) << Describe(record);
   EXPECT_NE(record.err.find("stdin line 2 is not JSON"), std::string::npos) << record.err;
   EXPECT_NE(record.out.find("sent 1 message "), std::string::npos) << record.out;
-  EXPECT_NE(record.out.find("stopped 4242"), std::string::npos) << record.out;
   // The stop sent the summary event, with the one message sent before the bad line.
   ASSERT_TRUE(WaitUntil([&] {
     return RowCount(service, "reporter_id = 4242 AND category = 65535") == 1;
@@ -219,47 +158,26 @@ TEST(TavrinctlE2eTest, ABadLineEndsTheRecordingWithItsNumberAndTheSessionStillSt
                              "ORDER BY row"),
             (std::vector<std::string>{"{\"ok\":1}",
                                       "{\"Ruvo_Session_Summary_Event\":\"65535\",\"ok\":\"1\"}"}));
-  EXPECT_TRUE(service.WaitForLog("stopping 4242")) << service.Log();
 
   // Valid JSON that is not an object is refused the same way.
-  const Outcome array = Sh(ctl + " --json record <<'EOF'\n[1, 2]\nEOF\n");
+  const Outcome array = Sh(ctl + " record <<'EOF'\n[1, 2]\nEOF\n");
   EXPECT_EQ(array.status, 1) << Describe(array);
-  EXPECT_NE(array.err.find("stdin line 1 is a JSON array, not an object"), std::string::npos)
-      << array.err;
-  const Json result = Json::parse(array.out);
-  EXPECT_EQ(result["sent"], 0);
-  EXPECT_EQ(result["stopped"], true);
-  EXPECT_TRUE(result.contains("error"));
+  EXPECT_NE(array.err.find("stdin line 1 is a JSON array, not an object"), std::string::npos);
 }
 
 TEST(TavrinctlE2eTest, WithoutAServiceTheStatusAndMessageSayWhatToDo) {
   const std::string root = testing::MakeTempDirectory("tavrinctl-root-");
-  const std::string socket = root + "/run/reporting.sock";
   const std::string ctl = Ctl(root);
-
   Outcome run = Sh(ctl + " reporters");
   EXPECT_EQ(run.status, 3) << Describe(run);
-  EXPECT_NE(run.err.find("no service at " + socket + " (the socket does not exist)"),
-            std::string::npos)
+  EXPECT_NE(
+      run.err.find("no service at " + root + "/run/reporting.sock (the socket does not exist)"),
+      std::string::npos)
       << run.err;
   EXPECT_NE(run.err.find("./scripts/run.sh"), std::string::npos) << run.err;
-
   // record gives up before reading its input.
   run = Sh(ctl + " record <<'EOF'\n{\"a\": 1}\nEOF\n");
   EXPECT_EQ(run.status, 3) << Describe(run);
-
-  // A socket left behind by a service that is gone.
-  std::filesystem::create_directories(root + "/run");
-  const int fd = ::socket(AF_UNIX, SOCK_STREAM, 0);
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  std::snprintf(address.sun_path, sizeof(address.sun_path), "%s", socket.c_str());
-  ASSERT_EQ(::bind(fd, reinterpret_cast<sockaddr*>(&address), sizeof(address)), 0);
-  ::close(fd);
-  run = Sh(ctl + " --json valid 1");
-  EXPECT_EQ(run.status, 3) << Describe(run);
-  EXPECT_NE(run.err.find("nothing accepts connections on it"), std::string::npos) << run.err;
-  EXPECT_TRUE(run.out.empty()) << run.out;
 
   // Usage errors are found before connecting, whatever the service's state.
   for (const char* usage : {" send '{\"a\":'", " send '{}' --to x", " get-type twelve",
@@ -279,34 +197,23 @@ TEST(TavrinctlE2eTest, DisablingReportingInTheDefaultsMakesSendsFailUntilItIsDel
 
   const Outcome written = Sh(ctl + " defaults write disable_reporting true");
   ASSERT_EQ(written.status, 0) << Describe(written);
-  EXPECT_NE(ReadAll(service.DefaultsPath()).find("disable_reporting = true"), std::string::npos);
-  const Outcome readBack = Sh(ctl + " defaults read disable_reporting");
-  EXPECT_EQ(readBack.out, "true\n") << Describe(readBack);
-
+  EXPECT_EQ(Sh(ctl + " defaults read disable_reporting").out, "true\n");
   // The service re-reads the file when its watch sees the rename.
   Outcome refused;
-  ASSERT_TRUE(WaitUntil([&] {
-    refused = Sh(send);
-    return refused.status != 0;
-  })) << service.Log();
+  ASSERT_TRUE(WaitUntil([&] { return (refused = Sh(send)).status != 0; })) << service.Log();
   EXPECT_EQ(refused.status, 1) << Describe(refused);
   EXPECT_NE(refused.err.find("reporting is disabled (com.quorvex.audio.reporting error 1)"),
             std::string::npos)
       << refused.err;
-
   // A recording's first message is refused; its session is still stopped.
   const Outcome record = Sh(ctl + " --json record <<'EOF'\n{\"a\": 1}\nEOF\n");
   EXPECT_EQ(record.status, 1) << Describe(record);
-  const Json result = Json::parse(record.out, nullptr, false);
-  EXPECT_EQ(result["sent"], 0) << record.out;
-  EXPECT_EQ(result["stopped"], true) << record.out;
+  EXPECT_EQ(Json::parse(record.out, nullptr, false)["stopped"], true) << record.out;
 
   const Outcome removed = Sh(ctl + " --json defaults delete disable_reporting");
   ASSERT_EQ(removed.status, 0) << Describe(removed);
   EXPECT_EQ(Json::parse(removed.out)["deleted"], true);
   EXPECT_TRUE(WaitUntil([&] { return Sh(send).status == 0; })) << service.Log();
-  const Outcome all = Sh(ctl + " --json defaults read");
-  EXPECT_EQ(all.out, "{}\n") << Describe(all);
 }
 
 TEST(TavrinctlE2eTest, TheShellRunsPipedCommandsOnOneConnection) {
@@ -318,32 +225,24 @@ TEST(TavrinctlE2eTest, TheShellRunsPipedCommandsOnOneConnection) {
                            "set-type 42 telephony\n"
                            "start 42\n"
                            "send --to 42 {\"x\": 1}\n"
-                           "valid 42\n"
-                           "reporters\n"
                            "stop 42\n"
                            "bogus\n"
-                           "destroy 42\n"
-                           "# 42 is gone; 43 is left running at the end\n"
+                           "# 43 is left running at the end\n"
                            "create 43\n"
                            "start 43\n"
-                           "reporters\n"
                            "EOF\n");
   // The status of the last line that failed.
   EXPECT_EQ(shell.status, 2) << Describe(shell);
-  EXPECT_EQ(shell.err, "tavrinctl: line 8: unknown command 'bogus'; type help\n");
+  EXPECT_EQ(shell.err, "tavrinctl: line 6: unknown command 'bogus'; type help\n");
   EXPECT_EQ(shell.out,
             "created session 42\n"
             "set-type 42: true\n"
             "started 42; the service answers this start when the session stops\n"
             "sent to 42: accepted\n"
-            "42: valid, service type 2 (telephony)\n"
-            "42\n"
             "stop 42: true\n"
             "the start of 42 was answered true (its session stopped)\n"
-            "destroy 42: true\n"
             "created session 43\n"
             "started 43; the service answers this start when the session stops\n"
-            "43\n"
             "stopped 43, still running at the end\n");
   EXPECT_TRUE(WaitUntil([&] {
     return RowCount(service, "reporter_id = 42 AND payload = '{\"x\":1}'") == 1 &&
@@ -351,34 +250,13 @@ TEST(TavrinctlE2eTest, TheShellRunsPipedCommandsOnOneConnection) {
   })) << service.Log();
 
   // With --json everything it prints is a JSON line, late answers included.
-  const Outcome json = Sh(Ctl(service.root()) +
-                          " --json shell <<'EOF'\n"
-                          "create 44\n"
-                          "start 44\n"
-                          "stop 44\n"
-                          "EOF\n");
+  const Outcome json =
+      Sh(Ctl(service.root()) + " --json shell <<'EOF'\ncreate 44\nstart 44\nstop 44\nEOF\n");
   EXPECT_EQ(json.status, 0) << Describe(json);
   const std::vector<Json> lines = JsonLines(json.out);
   ASSERT_EQ(lines.size(), 4u) << json.out;
-  EXPECT_EQ(
-      lines[1],
-      Json({{"operation", "start"}, {"reporterID", 44}, {"held", true}, {"answer", nullptr}}));
-  EXPECT_EQ(lines[3], Json({{"operation", "start"},
-                            {"reporterID", 44},
-                            {"answer", true},
-                            {"answeredAtStop", true}}));
-}
-
-TEST(TavrinctlE2eTest, KillEndsTheServiceWithItsStatus) {
-  TavrindProcess service;
-  ASSERT_TRUE(service.Start()) << service.Log();
-  const std::string ctl = Ctl(service.root());
-  const Outcome killed = Sh(ctl + " kill");
-  EXPECT_EQ(killed.status, 0) << Describe(killed);
-  EXPECT_EQ(killed.out, "the service ended\n");
-  EXPECT_EQ(service.WaitForExit(), 2);
-  const Outcome after = Sh(ctl + " reporters");
-  EXPECT_EQ(after.status, 3) << Describe(after);
+  EXPECT_EQ(lines[1]["held"], true) << json.out;
+  EXPECT_EQ(lines[3]["answeredAtStop"], true) << json.out;
 }
 
 }  // namespace

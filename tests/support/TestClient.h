@@ -33,6 +33,21 @@ inline std::string MakeTempDirectory(const char* prefix) {
   return buffer.data();
 }
 
+// A unix socket bound at `path`, listening when `listen` is set (-1 on failure). Closed unheard,
+// it leaves the file a service that is gone leaves behind.
+inline int BindUnixSocket(const std::string& path, bool listen) {
+  const int fd = ::socket(AF_UNIX, SOCK_STREAM, 0);
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  std::snprintf(address.sun_path, sizeof(address.sun_path), "%s", path.c_str());
+  if (::bind(fd, reinterpret_cast<sockaddr*>(&address), sizeof(address)) != 0 ||
+      (listen && ::listen(fd, 16) != 0)) {
+    ::close(fd);
+    return -1;
+  }
+  return fd;
+}
+
 // Polls `done` until it holds or the e2e time-out passes.
 template <typename Predicate>
 bool WaitUntil(Predicate done) {

@@ -39,11 +39,8 @@ TEST(CounterWriterTest, WritesReplaceAtomicallyAndTheServiceReadsThem) {
   CounterWriter writer(tree.root());
   std::string error;
   ASSERT_TRUE(writer.Write("PipeWire", "Dummy-Driver", "xruns", 3, &error)) << error;
-  EXPECT_EQ(ReadFile(tree.path("PipeWire/Dummy-Driver/xruns")), "3\n");
   ASSERT_TRUE(writer.Write("PipeWire", "Dummy-Driver", "xruns", -9, &error)) << error;
-  EXPECT_EQ(ReadFile(tree.path("PipeWire/Dummy-Driver/xruns")), "-9\n");
   ASSERT_TRUE(writer.Write("PipeWire", "Dummy-Driver", "cycles", INT64_MAX, &error)) << error;
-
   // Exactly the two counters are there: no temporary file is left behind.
   size_t files = 0;
   for (const auto& entry :
@@ -53,20 +50,9 @@ TEST(CounterWriterTest, WritesReplaceAtomicallyAndTheServiceReadsThem) {
   }
   EXPECT_EQ(files, 2u);
 
-  CountersTreeDriverStats service(tree.root());
-  OptionalError serviceError;
-  auto channels = service.CopyChannelsInGroup("PipeWire", "Dummy-Driver", 0, &serviceError);
-  ASSERT_TRUE(channels);
-  DriverChannels subscribed;
-  const auto handle = service.CreateSubscription(*channels, &subscribed, 0);
-  auto samples = service.CreateSamples(handle, subscribed, &serviceError);
-  ASSERT_TRUE(samples);
-  std::map<std::string, int64_t> values;
-  service.IterateSamples(*samples, [&](const DriverSample& sample) {
-    values[*service.SampleChannelName(sample)] = service.SampleIntegerValue(sample);
-    return 0;
-  });
-  EXPECT_EQ(values, (std::map<std::string, int64_t>{{"cycles", INT64_MAX}, {"xruns", -9}}));
+  // The last value, at its edges, as tavrind reads it.
+  EXPECT_EQ(ParseCounterText(ReadFile(tree.path("PipeWire/Dummy-Driver/xruns"))), -9);
+  EXPECT_EQ(ParseCounterText(ReadFile(tree.path("PipeWire/Dummy-Driver/cycles"))), INT64_MAX);
 }
 
 TEST(CounterWriterTest, RefusesUnsafeNamesAndReportsFilesystemFailures) {
@@ -178,11 +164,13 @@ void AddInfo(spa_pod_builder* b, int32_t xruns) {
   spa_pod_builder_pop(b, &frame);
 }
 
-TEST(ProfilerPodTest, DecodesCyclesWithDriverFollowersAndXruns) {
-  PodBuffer pod;
+// A profile stream of every shape the decoder meets: a good cycle whose follower blocks include
+// one of the wrong shape, a value that is not an object, a cycle whose driver block stops before
+// its status, an object of another type and a good cycle without the info block.
+const spa_pod* BuildProfile(PodBuffer& pod) {
   spa_pod_builder* b = &pod.builder;
+  spa_pod_frame object, frame;
   spa_pod_builder_push_struct(b, &pod.outer);
-  spa_pod_frame object;
   spa_pod_builder_push_object(b, &object, SPA_TYPE_OBJECT_Profiler, 0);
   AddInfo(b, 4);
   spa_pod_builder_prop(b, SPA_PROFILER_clock, 0);  // ignored
@@ -190,82 +178,53 @@ TEST(ProfilerPodTest, DecodesCyclesWithDriverFollowersAndXruns) {
   AddBlock(b, SPA_PROFILER_driverBlock, 30, "Dummy-Driver", 1000, 1010, 1200);
   AddBlock(b, SPA_PROFILER_followerBlock, 31, "sink", 1010, 1020, 1100, false);
   AddBlock(b, SPA_PROFILER_followerBlock, 32, "source", 1010, 1030, 1090);
+  spa_pod_builder_prop(b, SPA_PROFILER_followerBlock, 0);  // its name is a number
+  spa_pod_builder_push_struct(b, &frame);
+  spa_pod_builder_int(b, 3);
+  spa_pod_builder_int(b, 4);
+  spa_pod_builder_pop(b, &frame);
   spa_pod_builder_pop(b, &object);
-  spa_pod_builder_int(b, 5);  // not an object: ignored
-  spa_pod_builder_push_object(b, &object, SPA_TYPE_OBJECT_Profiler, 0);
-  AddBlock(b, SPA_PROFILER_driverBlock, 40, "Other", 5, 6, 7);
-  spa_pod_builder_pop(b, &object);
-  const auto* root = static_cast<const spa_pod*>(spa_pod_builder_pop(b, &pod.outer));
-  ASSERT_NE(root, nullptr);
-
-  const auto cycles = ParseProfile(root);
-  ASSERT_EQ(cycles.size(), 2u);
-  EXPECT_EQ(cycles[0].xrunCount, 4);
-  ASSERT_TRUE(cycles[0].driver);
-  EXPECT_EQ(cycles[0].driver->name, "Dummy-Driver");
-  EXPECT_EQ(cycles[0].driver->id, 30);
-  EXPECT_EQ(cycles[0].driver->times.prevSignal, 900);
-  EXPECT_EQ(cycles[0].driver->times.finish, 1200);
-  EXPECT_EQ(cycles[0].driver->times.status, 3);
-  ASSERT_EQ(cycles[0].followers.size(), 2u);
-  EXPECT_EQ(cycles[0].followers[0].name, "sink");
-  EXPECT_EQ(cycles[0].followers[1].times.awake, 1030);
-  EXPECT_EQ(cycles[1].xrunCount, std::nullopt);
-  EXPECT_EQ(cycles[1].driver->name, "Other");
-}
-
-TEST(ProfilerPodTest, MalformedBlocksAndObjectsAreLeftOut) {
-  PodBuffer pod;
-  spa_pod_builder* b = &pod.builder;
-  spa_pod_builder_push_struct(b, &pod.outer);
-  spa_pod_frame object;
-  // A cycle whose driver block stops before its status, and a follower of the wrong shape.
+  spa_pod_builder_int(b, 5);
   spa_pod_builder_push_object(b, &object, SPA_TYPE_OBJECT_Profiler, 0);
   spa_pod_builder_prop(b, SPA_PROFILER_driverBlock, 0);
-  spa_pod_frame frame;
   spa_pod_builder_push_struct(b, &frame);
   spa_pod_builder_int(b, 1);
   spa_pod_builder_string(b, "short");
   spa_pod_builder_long(b, 1);
   spa_pod_builder_pop(b, &frame);
   spa_pod_builder_pop(b, &object);
-  // A good cycle with a follower whose name is a number.
-  spa_pod_builder_push_object(b, &object, SPA_TYPE_OBJECT_Profiler, 0);
-  AddBlock(b, SPA_PROFILER_driverBlock, 2, "good", 10, 20, 30);
-  spa_pod_builder_prop(b, SPA_PROFILER_followerBlock, 0);
-  spa_pod_builder_push_struct(b, &frame);
-  spa_pod_builder_int(b, 3);
-  spa_pod_builder_int(b, 4);
-  spa_pod_builder_pop(b, &frame);
-  spa_pod_builder_pop(b, &object);
-  // An object of another type.
   spa_pod_builder_push_object(b, &object, SPA_TYPE_OBJECT_Props, 0);
   AddBlock(b, SPA_PROFILER_driverBlock, 5, "props", 10, 20, 30);
   spa_pod_builder_pop(b, &object);
-  const auto* root = static_cast<const spa_pod*>(spa_pod_builder_pop(b, &pod.outer));
+  spa_pod_builder_push_object(b, &object, SPA_TYPE_OBJECT_Profiler, 0);
+  AddBlock(b, SPA_PROFILER_driverBlock, 40, "Other", 5, 6, 7);
+  spa_pod_builder_pop(b, &object);
+  return static_cast<const spa_pod*>(spa_pod_builder_pop(b, &pod.outer));
+}
 
-  const auto cycles = ParseProfile(root);
-  ASSERT_EQ(cycles.size(), 1u);
-  EXPECT_EQ(cycles[0].driver->name, "good");
-  EXPECT_TRUE(cycles[0].followers.empty());
+TEST(ProfilerPodTest, DecodesGoodCyclesAndLeavesMalformedBlocksAndObjectsOut) {
+  PodBuffer pod;
+  const auto cycles = ParseProfile(BuildProfile(pod));
+  ASSERT_EQ(cycles.size(), 2u);
+  EXPECT_EQ(cycles[0].xrunCount, 4);
+  ASSERT_TRUE(cycles[0].driver);
+  EXPECT_EQ(cycles[0].driver->name, "Dummy-Driver");
+  EXPECT_EQ(cycles[0].driver->id, 30);
+  EXPECT_EQ(cycles[0].driver->times.prevSignal, 900);
+  EXPECT_EQ(cycles[0].driver->times.status, 3);
+  ASSERT_EQ(cycles[0].followers.size(), 2u);
+  EXPECT_EQ(cycles[0].followers[0].name, "sink");  // without the optional latency
+  EXPECT_EQ(cycles[0].followers[1].times.awake, 1030);
+  EXPECT_EQ(cycles[1].xrunCount, std::nullopt);
+  EXPECT_EQ(cycles[1].driver->name, "Other");
   EXPECT_TRUE(ParseProfile(nullptr).empty());
 }
 
 TEST(ProfilerPodTest, TruncatedAndRandomBytesNeverReadOutOfBounds) {
   PodBuffer pod;
-  spa_pod_builder* b = &pod.builder;
-  spa_pod_builder_push_struct(b, &pod.outer);
-  spa_pod_frame object;
-  for (int i = 0; i < 3; ++i) {
-    spa_pod_builder_push_object(b, &object, SPA_TYPE_OBJECT_Profiler, 0);
-    AddInfo(b, i);
-    AddBlock(b, SPA_PROFILER_driverBlock, i, "driver", 10, 20, 30);
-    AddBlock(b, SPA_PROFILER_followerBlock, i, "follower", 10, 20, 30);
-    spa_pod_builder_pop(b, &object);
-  }
-  const auto* root = static_cast<const spa_pod*>(spa_pod_builder_pop(b, &pod.outer));
+  const spa_pod* root = BuildProfile(pod);
   const size_t size = SPA_POD_SIZE(root);
-  ASSERT_EQ(ParseProfileBytes(root, size).size(), 3u);
+  ASSERT_EQ(ParseProfileBytes(root, size).size(), 2u);
 
   // The same bytes cut short are refused as a whole (the outer size no longer fits).
   for (size_t cut = 0; cut < size; cut += 8) {
@@ -282,7 +241,7 @@ TEST(ProfilerPodTest, TruncatedAndRandomBytesNeverReadOutOfBounds) {
       std::memcpy(copy + at, &word, sizeof word);
     }
     const auto cycles = ParseProfileBytes(copy, size);
-    EXPECT_LE(cycles.size(), 3u);
+    EXPECT_LE(cycles.size(), 4u);  // the objects that could be cycles
   }
 }
 
@@ -293,69 +252,53 @@ constexpr const char* kPwLink = "/usr/bin/pw-link";
 
 // A daemon without sound hardware: the dummy driver clocks a test source linked to a null sink.
 constexpr const char* kDaemonConfig = R"(
-context.properties = {
-    support.dbus = false
-    core.daemon = true
-    core.name = pipewire-0
-    mem.allow-mlock = false
-    default.clock.rate = 48000
-    default.clock.quantum = 1024
-}
-context.spa-libs = {
-    audio.convert.* = audioconvert/libspa-audioconvert
-    support.*       = support/libspa-support
-    audiotestsrc    = audiotestsrc/libspa-audiotestsrc
-}
-context.modules = [
-    { name = libpipewire-module-protocol-native }
-    { name = libpipewire-module-profiler }
-    { name = libpipewire-module-metadata }
-    { name = libpipewire-module-spa-node-factory }
-    { name = libpipewire-module-client-node }
-    { name = libpipewire-module-access args = { } }
-    { name = libpipewire-module-adapter }
-    { name = libpipewire-module-link-factory }
-]
+context.properties = { support.dbus = false core.daemon = true core.name = pipewire-0
+  mem.allow-mlock = false default.clock.rate = 48000 default.clock.quantum = 1024 }
+context.spa-libs = { audio.convert.* = audioconvert/libspa-audioconvert
+  support.* = support/libspa-support audiotestsrc = audiotestsrc/libspa-audiotestsrc }
+context.modules = [ { name = libpipewire-module-protocol-native }
+  { name = libpipewire-module-profiler } { name = libpipewire-module-metadata }
+  { name = libpipewire-module-spa-node-factory } { name = libpipewire-module-client-node }
+  { name = libpipewire-module-access args = { } } { name = libpipewire-module-adapter }
+  { name = libpipewire-module-link-factory } ]
 context.objects = [
-    { factory = spa-node-factory
-      args = { factory.name = support.node.driver node.name = Dummy-Driver
-               node.group = pipewire.dummy priority.driver = 20000 } }
-    { factory = adapter
-      args = { factory.name = support.null-audio-sink node.name = "test sink"
-               media.class = Audio/Sink audio.position = [ FL FR ] node.group = pipewire.dummy
-               adapter.auto-port-config = { mode = dsp monitor = false control = false
-                                            position = preserve } } }
-    { factory = adapter
-      args = { factory.name = audiotestsrc node.name = test-source media.class = Audio/Source
-               audio.position = [ FL FR ] node.group = pipewire.dummy
-               adapter.auto-port-config = { mode = dsp monitor = false control = false
-                                            position = preserve } } }
+  { factory = spa-node-factory args = { factory.name = support.node.driver
+      node.name = Dummy-Driver node.group = pipewire.dummy priority.driver = 20000 } }
+  { factory = adapter args = { factory.name = support.null-audio-sink node.name = "test sink"
+      media.class = Audio/Sink audio.position = [ FL FR ] node.group = pipewire.dummy
+      adapter.auto-port-config = { mode = dsp monitor = false control = false
+                                   position = preserve } } }
+  { factory = adapter args = { factory.name = audiotestsrc node.name = test-source
+      media.class = Audio/Source audio.position = [ FL FR ] node.group = pipewire.dummy
+      adapter.auto-port-config = { mode = dsp monitor = false control = false
+                                   position = preserve } } }
 ]
 )";
 
+// Polls `done` every 50 ms for up to 30 s (generous: the machine is shared and loaded).
+template <typename Predicate>
+bool Eventually(Predicate done) {
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(30);
+  while (std::chrono::steady_clock::now() < deadline) {
+    if (done()) return true;
+    std::this_thread::sleep_for(std::chrono::milliseconds(50));
+  }
+  return done();
+}
+
+// A child process with the test's environment, its output appended to `output`.
 class Child {
  public:
-  Child(const std::vector<std::string>& argv, const std::vector<std::string>& extraEnv,
-        const std::string& output) {
-    std::vector<std::string> env = extraEnv;
-    for (char** e = environ; *e != nullptr; ++e) {
-      const std::string entry = *e;
-      const std::string key = entry.substr(0, entry.find('='));
-      bool overridden = key == "PIPEWIRE_REMOTE";
-      for (const auto& extra : extraEnv) overridden |= extra.rfind(key + "=", 0) == 0;
-      if (!overridden) env.push_back(entry);
-    }
-    std::vector<char*> args, envp;
+  Child(const std::vector<std::string>& argv, const std::string& output) {
+    std::vector<char*> args;
     for (const auto& a : argv) args.push_back(const_cast<char*>(a.c_str()));
     args.push_back(nullptr);
-    for (const auto& e : env) envp.push_back(const_cast<char*>(e.c_str()));
-    envp.push_back(nullptr);
     posix_spawn_file_actions_t actions;
     posix_spawn_file_actions_init(&actions);
     posix_spawn_file_actions_addopen(&actions, 1, output.c_str(), O_WRONLY | O_CREAT | O_APPEND,
                                      0644);
     posix_spawn_file_actions_adddup2(&actions, 1, 2);
-    if (posix_spawn(&pid_, args[0], &actions, nullptr, args.data(), envp.data()) != 0) pid_ = -1;
+    if (posix_spawn(&pid_, args[0], &actions, nullptr, args.data(), environ) != 0) pid_ = -1;
     posix_spawn_file_actions_destroy(&actions);
   }
   ~Child() {
@@ -366,35 +309,17 @@ class Child {
   }
   bool started() const { return pid_ > 0; }
   void Signal(int signal) const { ::kill(pid_, signal); }
-  // The exit status, or -1 if the child did not end within `timeout`.
-  int Wait(std::chrono::milliseconds timeout) {
-    const auto deadline = std::chrono::steady_clock::now() + timeout;
-    while (true) {
-      int status = 0;
-      const pid_t done = ::waitpid(pid_, &status, WNOHANG);
-      if (done == pid_) {
-        pid_ = -1;
-        return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
-      }
-      if (std::chrono::steady_clock::now() > deadline) return -1;
-      std::this_thread::sleep_for(std::chrono::milliseconds(20));
-    }
+  // The exit status, or -1 if the child did not end in time.
+  int Wait() {
+    int status = 0;
+    if (!Eventually([&] { return ::waitpid(pid_, &status, WNOHANG) == pid_; })) return -1;
+    pid_ = -1;
+    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
   }
 
  private:
   pid_t pid_ = -1;
 };
-
-// Polls `done` every 50 ms for up to `timeout` (generous: the machine is shared and loaded).
-template <typename Predicate>
-bool Eventually(Predicate done, std::chrono::seconds timeout = std::chrono::seconds(30)) {
-  const auto deadline = std::chrono::steady_clock::now() + timeout;
-  while (std::chrono::steady_clock::now() < deadline) {
-    if (done()) return true;
-    std::this_thread::sleep_for(std::chrono::milliseconds(50));
-  }
-  return done();
-}
 
 int64_t Counter(const TempCountersTree& tree, const std::string& rel) {
   return ParseCounterText(ReadFile(tree.path(rel))).value_or(-1);
@@ -408,22 +333,24 @@ TEST(PwExporterDaemonTest, ExportsDriverAndFollowerCountersFromALiveDaemon) {
   const std::string runtime = tree.outside();
   ::chmod(runtime.c_str(), 0700);
   std::ofstream(runtime + "/daemon.conf") << kDaemonConfig;
-  const std::vector<std::string> env = {"XDG_RUNTIME_DIR=" + runtime,
-                                        "PIPEWIRE_RUNTIME_DIR=" + runtime};
+  // The daemon and its clients meet in the tree's private runtime directory.
+  ::setenv("XDG_RUNTIME_DIR", runtime.c_str(), 1);
+  ::setenv("PIPEWIRE_RUNTIME_DIR", runtime.c_str(), 1);
+  ::unsetenv("PIPEWIRE_REMOTE");
   const std::string logFile = runtime + "/output.log";
 
-  Child daemon({kPipeWire, "-c", runtime + "/daemon.conf"}, env, logFile);
+  Child daemon({kPipeWire, "-c", runtime + "/daemon.conf"}, logFile);
   ASSERT_TRUE(daemon.started());
   ASSERT_TRUE(Eventually([&] { return ::access((runtime + "/pipewire-0").c_str(), F_OK) == 0; }))
       << ReadFile(logFile);
   // Link the source to the sink so the dummy driver has a graph to run.
   ASSERT_TRUE(Eventually([&] {
-    Child link({kPwLink, "test-source:capture_1", "test sink:playback_FL"}, env, logFile);
-    return link.Wait(std::chrono::seconds(10)) == 0;
+    Child link({kPwLink, "test-source:capture_1", "test sink:playback_FL"}, logFile);
+    return link.Wait() == 0;
   })) << ReadFile(logFile);
 
   {
-    Child exporter({TAVRIN_PW_EXPORTER_PATH, "--root", tree.root(), "--interval-ms", "50"}, env,
+    Child exporter({TAVRIN_PW_EXPORTER_PATH, "--root", tree.root(), "--interval-ms", "50"},
                    logFile);
     ASSERT_TRUE(exporter.started());
     ASSERT_TRUE(Eventually([&] {
@@ -432,36 +359,25 @@ TEST(PwExporterDaemonTest, ExportsDriverAndFollowerCountersFromALiveDaemon) {
              Counter(tree, "PipeWire/test-source/cycles") > 0;
     })) << ReadFile(logFile);
 
-    // What tavrind would see: the driver's channels, read through the counters tree service.
-    CountersTreeDriverStats service(tree.root());
-    OptionalError error;
-    auto channels = service.CopyChannelsInGroup("PipeWire", "Dummy-Driver", 0, &error);
-    ASSERT_TRUE(channels);
-    std::vector<std::string> names;
-    for (const auto& channel : channels->at("channels"))
-      names.push_back(channel.at("name").get<std::string>());
-    EXPECT_EQ(names, (std::vector<std::string>{"busy_ns_max", "busy_ns_total", "cycles",
-                                               "incomplete_cycles", "wakeup_ns_max",
-                                               "wakeup_ns_total", "xruns"}));
     const int64_t before = Counter(tree, "PipeWire/Dummy-Driver/cycles");
     EXPECT_TRUE(Eventually([&] { return Counter(tree, "PipeWire/Dummy-Driver/cycles") > before; }));
     EXPECT_GE(Counter(tree, "PipeWire/Dummy-Driver/xruns"), 0);
     EXPECT_GE(Counter(tree, "PipeWire/test_sink/busy_ns_total"), 0);
 
     exporter.Signal(SIGTERM);
-    EXPECT_EQ(exporter.Wait(std::chrono::seconds(30)), 0) << ReadFile(logFile);
+    EXPECT_EQ(exporter.Wait(), 0) << ReadFile(logFile);
   }
 
   // The daemon going away ends the exporter with status 1, for its supervisor to restart it.
   const std::string secondLog = runtime + "/second.log";
-  Child exporter({TAVRIN_PW_EXPORTER_PATH, "--root", tree.root(), "--interval-ms", "50"}, env,
+  Child exporter({TAVRIN_PW_EXPORTER_PATH, "--root", tree.root(), "--interval-ms", "50"},
                  secondLog);
   ASSERT_TRUE(Eventually([&] {
     return ReadFile(secondLog).find("profiling, counters under") != std::string::npos;
   })) << ReadFile(secondLog);
   daemon.Signal(SIGTERM);
-  EXPECT_EQ(daemon.Wait(std::chrono::seconds(30)), 0);
-  EXPECT_EQ(exporter.Wait(std::chrono::seconds(30)), 1) << ReadFile(secondLog);
+  EXPECT_EQ(daemon.Wait(), 0);
+  EXPECT_EQ(exporter.Wait(), 1) << ReadFile(secondLog);
 }
 
 }  // namespace
