@@ -92,9 +92,8 @@ TEST(MessagePackTest, DepthAtTheLimitIsAcceptedAndOneMoreIsNot) {
   EXPECT_TRUE(over.scan.WellFormed());
   EXPECT_TRUE(over.scan.tooDeep);
   EXPECT_FALSE(over.value);
-}
 
-TEST(MessagePackTest, EmptyContainerBeyondTheLimitIsTooDeep) {
+  // An empty container counts as a level too.
   Pack pack;
   for (int i = 0; i < kMaxNestingDepth; ++i) pack.array(1);
   pack.map(0);
@@ -135,16 +134,13 @@ TEST(MessagePackTest, EveryPrefixOfAValueIsTruncated) {
   }
 }
 
-TEST(MessagePackTest, BytesAfterTheValueAreRefused) {
+TEST(MessagePackTest, TrailingAndNeverUsedBytesAreRefused) {
   Bytes bytes = Pack().array(1).uint(1);
   bytes.push_back(0xc0);
   const DecodedValue decoded = DecodeMessagePack(bytes);
   EXPECT_EQ(decoded.scan.form, Form::kTrailingBytes);
   EXPECT_EQ(decoded.scan.offset, 2u);
   EXPECT_FALSE(decoded.value);
-}
-
-TEST(MessagePackTest, NeverUsedByteIsInvalid) {
   EXPECT_EQ(ScanMessagePack(Pack().array(2).uint(1).raw({0xc1})).form, Form::kInvalidByte);
 }
 
@@ -173,15 +169,11 @@ TEST(MessagePackTest, BinAndExtAreNamedAndNotParsed) {
   };
   const std::vector<Case> cases = {
       {Pack().big(0xc4, 2, 1).raw({1, 2}), "bin8"},
-      {Pack().big(0xc5, 1, 2).raw({1}), "bin16"},
       {Pack().big(0xc6, 0, 4), "bin32"},
       {Pack().big(0xc7, 1, 1).raw({5, 9}), "ext8"},
-      {Pack().big(0xc8, 0, 2).raw({5}), "ext16"},
       {Pack().big(0xc9, 2, 4).raw({5, 9, 9}), "ext32"},
       {Pack().raw({0xd4, 5, 1}), "fixext1"},
-      {Pack().raw({0xd5, 5, 1, 2}), "fixext2"},
       {Pack().raw({0xd6, 5, 1, 2, 3, 4}), "fixext4"},
-      {Pack().raw({0xd7, 5}).zeros(8), "fixext8"},
       {Pack().raw({0xd8, 5}).zeros(16), "fixext16"},
   };
   for (const Case& c : cases) {
@@ -238,13 +230,6 @@ TEST(MessagePackTest, FirstElementOfTopLevelArrayIsClassified) {
       EXPECT_EQ(scan.firstValue, cases[i].value) << "case " << i;
     }
   }
-}
-
-TEST(MessagePackTest, DuplicateKeyKeepsFirstPlaceAndLastValue) {
-  const DecodedValue decoded =
-      DecodeMessagePack(Pack().map(3).str("a").uint(1).str("b").uint(2).str("a").uint(3));
-  ASSERT_TRUE(decoded.value);
-  EXPECT_EQ(decoded.value->dump(), R"({"a":3,"b":2})");
 }
 
 TEST(MessagePackTest, InvalidUtf8StringsDecodeAndReencode) {

@@ -15,7 +15,7 @@
 
 #include "platform/Platform.h"
 #include "platform/linux/dispatch/StdCondition.h"
-#include "tests/fakes/FakeCondition.h"
+#include "tests/fakes/FakeClock.h"
 #include "tests/fakes/FakeDeviceInfoQuery.h"
 #include "tests/fakes/FakeLogSystem.h"
 
@@ -24,7 +24,6 @@ namespace {
 
 using std::chrono::milliseconds;
 using std::chrono::seconds;
-using testing::FakeCondition;
 using testing::FakeDeviceInfo;
 using testing::FakeLogSystem;
 using testing::LoggedLine;
@@ -41,16 +40,9 @@ TEST(ServiceTypeNameTest, NamesEveryCodedTypeAndTheUnsetType) {
   for (uint16_t code = 0; code <= 12; ++code) {
     EXPECT_EQ(ServiceTypeName(code), std::optional<std::string>(expected[code])) << code;
   }
-  EXPECT_EQ(ServiceTypeName(service_type::kApiUsage), "apiusage");
   EXPECT_EQ(ServiceTypeName(65535), "unknown");
-}
-
-TEST(ServiceTypeNameTest, CodesBetweenTheTableAndUnknownHaveNoName) {
   EXPECT_EQ(ServiceTypeName(13), std::nullopt);
   EXPECT_EQ(ServiceTypeName(65534), std::nullopt);
-  for (uint32_t code = 13; code < 65535; ++code) {
-    ASSERT_FALSE(ServiceTypeName(static_cast<uint16_t>(code)).has_value()) << code;
-  }
 }
 
 TEST(CategoryNameTest, GroupPrefixOnlyWhenTheWholeHighHalfIsOneGroup) {
@@ -130,16 +122,6 @@ TEST(ApplicationNameFromUserInfoTest, StoredValueComesBackAsItIsWhateverItsType)
 // ---------------------------------------------------------------------------------------------
 // Internal build flag
 
-TEST(InternalBuildFlagTest, AsksForInternalBuildOnceAndKeepsTheFirstAnswer) {
-  FakeDeviceInfo device;
-  device.SetBool("InternalBuild", true);
-  InternalBuildFlag flag;
-  EXPECT_TRUE(flag.Get(device));
-  device.SetBool("InternalBuild", false);
-  EXPECT_TRUE(flag.Get(device));
-  EXPECT_EQ(device.QueryCount("InternalBuild"), 1u);
-}
-
 TEST(InternalBuildFlagTest, MissingFactOrMissingQueryMeansNotInternal) {
   FakeDeviceInfo device;
   InternalBuildFlag flag;
@@ -186,190 +168,134 @@ TEST(IsInternalBuildTest, SixteenConcurrentFirstCallsAskOnceAndAgree) {
 // ---------------------------------------------------------------------------------------------
 // Bounded wait
 
-constexpr double kTimeoutSeconds = 2.5;
-constexpr Duration kTimeout = std::chrono::milliseconds(2500);
+// A condition whose waits play scripted outcomes on the calling thread and move the fake clock
+// to the moment each outcome happens, so deadlines are exact and nothing sleeps.
+class ScriptedCondition final : public Condition {
+ public:
+  // One wait's outcome: after `after`, a signal (setting the flag or not) or the deadline.
+  struct Outcome {
+    enum Kind { kSignalWithFlag, kSignalWithoutFlag, kTimeOut, kThrow } kind;
+    Duration after = Duration::zero();
+  };
+  ScriptedCondition(bool& flag, std::vector<Outcome> script) : flag_(flag), script_(script) {}
 
-// Splits "RuvoReportingUtility.cpp:<digits>:RuvoReportingUtilityWait: <message>" into the message;
-// nothing when the prefix has another shape. (Hand-written: std::regex trips a false
-// maybe-uninitialized warning of g++ 12 under the sanitizers.)
-std::optional<std::string> WaitLineMessage(const std::string& text) {
-  constexpr std::string_view kFile = "RuvoReportingUtility.cpp:";
-  constexpr std::string_view kFunction = ":RuvoReportingUtilityWait: ";
-  if (!text.starts_with(kFile)) return std::nullopt;
-  size_t position = kFile.size();
-  const size_t digitsStart = position;
-  while (position < text.size() && text[position] >= '0' && text[position] <= '9') ++position;
-  if (position == digitsStart) return std::nullopt;
-  if (text.compare(position, kFunction.size(), kFunction) != 0) return std::nullopt;
-  return text.substr(position + kFunction.size());
-}
-
-::testing::AssertionResult IsWaitLine(const LoggedLine& line, LogLevel level,
-                                      const std::string& message) {
-  const std::optional<std::string> logged = WaitLineMessage(line.text);
-  if (!logged) return ::testing::AssertionFailure() << "bad prefix: \"" << line.text << "\"";
-  if (*logged != message) {
-    return ::testing::AssertionFailure()
-           << "message \"" << *logged << "\", want \"" << message << "\"";
+  void Lock() override { ++locks_; }
+  void Unlock() override { --locks_; }
+  bool WaitUntil(SteadyTime deadline) override {
+    deadlines.push_back(deadline);
+    if (locks_ != 1 || next_ == script_.size()) throw std::logic_error("unscripted or unlocked");
+    const Outcome outcome = script_[next_++];
+    if (outcome.kind == Outcome::kThrow) throw std::runtime_error("wait failed");
+    if (outcome.kind == Outcome::kTimeOut) {
+      clock_.Advance(deadline - clock_.Now());
+      return false;
+    }
+    clock_.Advance(outcome.after);
+    flag_ = outcome.kind == Outcome::kSignalWithFlag;
+    return true;
   }
-  if (line.level != level) {
-    return ::testing::AssertionFailure()
-           << "level " << LogLevelName(line.level) << ", want " << LogLevelName(level);
-  }
-  return ::testing::AssertionSuccess();
-}
+  void Signal() override {}
+  Clock& GetClock() override { return clock_; }
 
-class WaitTest : public ::testing::Test {
- protected:
-  WaitTest() { condition_.SetFlag(&flag_); }
+  bool Balanced() const { return locks_ == 0 && next_ == script_.size(); }
+  std::vector<SteadyTime> deadlines;
+  testing::FakeClock clock_;
 
-  bool Wait(const LogHandle& log = nullptr, double timeout = kTimeoutSeconds) {
-    return RuvoReportingUtilityWait(condition_, flag_, "Waiting for back-ends",
-                                    "Timed out waiting for back-ends", log, timeout);
-  }
-
-  void ExpectUnlockedAndBalanced() {
-    EXPECT_FALSE(condition_.IsLocked());
-    EXPECT_EQ(condition_.LockCount(), condition_.UnlockCount());
-    EXPECT_TRUE(condition_.Violations().empty())
-        << ::testing::PrintToString(condition_.Violations());
-    EXPECT_EQ(condition_.UnscriptedWaits(), 0u);
-    EXPECT_EQ(condition_.StepsLeft(), 0u);
-  }
-
-  FakeLogSystem logs_;
-  FakeCondition condition_;
-  bool flag_ = false;
+ private:
+  bool& flag_;
+  std::vector<Outcome> script_;
+  size_t next_ = 0;
+  int locks_ = 0;
 };
 
-TEST_F(WaitTest, FlagAlreadySetReturnsAtOnceWithoutLoggingOrWaiting) {
-  flag_ = true;
-  EXPECT_TRUE(Wait());
-  EXPECT_TRUE(logs_.Lines().empty());
-  EXPECT_TRUE(condition_.Deadlines().empty());
-  EXPECT_EQ(condition_.LockCount(), 1u);
-  ExpectUnlockedAndBalanced();
-}
-
-TEST_F(WaitTest, NeverSignalledTimesOutOnceWithWaitingAndErrorLines) {
-  const SteadyTime start = condition_.Now();
-  condition_.ScriptTimeOut();
-  EXPECT_FALSE(Wait());
-
-  ASSERT_EQ(condition_.Deadlines().size(), 1u);
-  EXPECT_EQ(condition_.Deadlines()[0], start + kTimeout);
-  EXPECT_EQ(condition_.Now(), start + kTimeout);
-  const auto lines = logs_.Lines();
-  ASSERT_EQ(lines.size(), 2u);
-  EXPECT_EQ(lines[0].scope, "default");
-  EXPECT_TRUE(IsWaitLine(lines[0], LogLevel::kDefault, "Waiting for back-ends"));
-  EXPECT_TRUE(IsWaitLine(lines[1], LogLevel::kError, "Timed out waiting for back-ends"));
-  ExpectUnlockedAndBalanced();
-}
-
-TEST_F(WaitTest, SignalWithFlagReturnsTrueAfterContinuing) {
-  condition_.ScriptSignalWithFlag(milliseconds(300));
-  EXPECT_TRUE(Wait());
-  const auto lines = logs_.Lines();
-  ASSERT_EQ(lines.size(), 2u);
-  EXPECT_TRUE(IsWaitLine(lines[0], LogLevel::kDefault, "Waiting for back-ends"));
-  EXPECT_TRUE(IsWaitLine(lines[1], LogLevel::kDefault, "continuing"));
-  EXPECT_EQ(condition_.SignalCount(), 1u);
-  ExpectUnlockedAndBalanced();
-}
-
-TEST_F(WaitTest, SignalWithoutFlagGrantsAWholeNewTimeout) {
-  const SteadyTime start = condition_.Now();
-  condition_.ScriptSignalWithoutFlag(seconds(2));
-  condition_.ScriptSignalWithoutFlag(milliseconds(2400));
-  condition_.ScriptSignalWithFlag(seconds(1));
-  EXPECT_TRUE(Wait());
-
-  // Each round's deadline is counted from the moment that round began, not from the first.
-  const std::vector<SteadyTime> expected = {start + kTimeout, start + seconds(2) + kTimeout,
-                                            start + milliseconds(4400) + kTimeout};
-  EXPECT_EQ(condition_.Deadlines(), expected);
-  const auto lines = logs_.Lines();
-  ASSERT_EQ(lines.size(), 6u);
-  for (size_t i = 0; i < lines.size(); i += 2) {
-    EXPECT_TRUE(IsWaitLine(lines[i], LogLevel::kDefault, "Waiting for back-ends")) << i;
-    EXPECT_TRUE(IsWaitLine(lines[i + 1], LogLevel::kDefault, "continuing")) << i;
+// Each round's deadline counts from the moment that round began; a signal that leaves the flag
+// unset starts a whole new time-out; every way out leaves the condition unlocked.
+TEST(WaitTest, ScriptedOutcomesGiveTheirResultDeadlinesAndLines) {
+  using O = ScriptedCondition::Outcome;
+  const Duration t = milliseconds(2500);
+  const SteadyTime t0 = testing::FakeClock::kStartSteadyTime;
+  struct Case {
+    std::vector<O> script;
+    bool result;
+    std::vector<SteadyTime> deadlines;
+    std::vector<std::string> lines;  // W = waiting, C = continuing, T = timed out (an error)
+  } cases[] = {
+      {{{O::kTimeOut}}, false, {t0 + t}, {"W", "T"}},
+      {{{O::kSignalWithFlag, milliseconds(300)}}, true, {t0 + t}, {"W", "C"}},
+      {{{O::kSignalWithoutFlag, seconds(2)}, {O::kSignalWithoutFlag, milliseconds(2400)},
+        {O::kSignalWithFlag, seconds(1)}},
+       true,
+       {t0 + t, t0 + seconds(2) + t, t0 + milliseconds(4400) + t},
+       {"W", "C", "W", "C", "W", "C"}},
+      {{{O::kSignalWithoutFlag, seconds(2)}, {O::kTimeOut}},
+       false,
+       {t0 + t, t0 + seconds(2) + t},
+       {"W", "C", "W", "T"}},
+  };
+  for (size_t i = 0; i < std::size(cases); ++i) {
+    FakeLogSystem logs;
+    bool flag = false;
+    ScriptedCondition condition(flag, cases[i].script);
+    EXPECT_EQ(RuvoReportingUtilityWait(condition, flag, "W", "T", nullptr, 2.5), cases[i].result)
+        << i;
+    EXPECT_EQ(condition.deadlines, cases[i].deadlines) << i;
+    EXPECT_TRUE(condition.Balanced()) << i;
+    std::vector<std::string> lines;
+    for (const LoggedLine& line : logs.Lines()) {
+      EXPECT_EQ(line.scope, "default");
+      const bool error = line.text.ends_with(": T");
+      EXPECT_EQ(line.level, error ? LogLevel::kError : LogLevel::kDefault) << line.text;
+      // The prefix names the operation, not a helper.
+      EXPECT_NE(line.text.find(":RuvoReportingUtilityWait: "), std::string::npos) << line.text;
+      lines.push_back(line.text.substr(line.text.rfind(' ') + 1) == "continuing"
+                          ? "C"
+                          : line.text.substr(line.text.size() - 1));
+    }
+    EXPECT_EQ(lines, cases[i].lines) << i;
   }
-  ExpectUnlockedAndBalanced();
 }
 
-TEST_F(WaitTest, SignalWithoutFlagThenSilenceTimesOutLaterThanOneTimeout) {
-  const SteadyTime start = condition_.Now();
-  condition_.ScriptSignalWithoutFlag(seconds(2));
-  condition_.ScriptTimeOut();
-  EXPECT_FALSE(Wait());
+TEST(WaitTest, SetFlagThrowingWaitAndOddTimeouts) {
+  using O = ScriptedCondition::Outcome;
+  FakeLogSystem logs;
+  bool flag = true;
+  ScriptedCondition already(flag, {});
+  EXPECT_TRUE(RuvoReportingUtilityWait(already, flag, "W", "T", nullptr, 2.5));
+  EXPECT_TRUE(already.deadlines.empty());
+  EXPECT_TRUE(logs.Lines().empty());
 
-  EXPECT_EQ(condition_.Now(), start + seconds(2) + kTimeout);
-  const auto lines = logs_.Lines();
-  ASSERT_EQ(lines.size(), 4u);
-  EXPECT_TRUE(IsWaitLine(lines[0], LogLevel::kDefault, "Waiting for back-ends"));
-  EXPECT_TRUE(IsWaitLine(lines[1], LogLevel::kDefault, "continuing"));
-  EXPECT_TRUE(IsWaitLine(lines[2], LogLevel::kDefault, "Waiting for back-ends"));
-  EXPECT_TRUE(IsWaitLine(lines[3], LogLevel::kError, "Timed out waiting for back-ends"));
-  ExpectUnlockedAndBalanced();
-}
+  flag = false;
+  ScriptedCondition throwing(flag, {{O::kThrow}});
+  EXPECT_THROW(RuvoReportingUtilityWait(throwing, flag, "W", "T", nullptr, 2.5),
+               std::runtime_error);
+  EXPECT_TRUE(throwing.Balanced());
 
-TEST_F(WaitTest, LinesGoToTheGivenScopeNotTheDefaultLog) {
+  // NaN and non-positive time-outs expire at once; an infinite one still gives a valid deadline.
+  for (double timeout : {-1.0, 0.0, std::numeric_limits<double>::quiet_NaN()}) {
+    ScriptedCondition condition(flag, {{O::kTimeOut}});
+    EXPECT_FALSE(RuvoReportingUtilityWait(condition, flag, "W", "T", nullptr, timeout));
+    EXPECT_EQ(condition.deadlines, std::vector{testing::FakeClock::kStartSteadyTime}) << timeout;
+  }
+  ScriptedCondition huge(flag, {{O::kSignalWithFlag}});
+  EXPECT_TRUE(RuvoReportingUtilityWait(huge, flag, "W", "T", nullptr,
+                                       std::numeric_limits<double>::infinity()));
+  EXPECT_GT(huge.deadlines.at(0),
+            testing::FakeClock::kStartSteadyTime + std::chrono::hours(24 * 365));
+
+  // Lines go to the scope given, not the default log.
   LogHandle scope = RegisterLogScope(true, FourCharCode("rvrr"), "session", "com.quorvex.tavrin",
                                      "reporting_session_verbose", 31);
   ASSERT_NE(scope, nullptr);
-  condition_.ScriptTimeOut();
-  EXPECT_FALSE(Wait(scope));
-  const auto lines = logs_.Lines();
-  ASSERT_EQ(lines.size(), 2u);
-  EXPECT_EQ(lines[0].scope, "session");
-  EXPECT_EQ(lines[1].scope, "session");
-  ExpectUnlockedAndBalanced();
+  logs.Clear();
+  ScriptedCondition scoped(flag, {{O::kTimeOut}});
+  EXPECT_FALSE(RuvoReportingUtilityWait(scoped, flag, "W", "T", scope, 2.5));
+  ASSERT_EQ(logs.Lines().size(), 2u);
+  for (const LoggedLine& line : logs.Lines()) EXPECT_EQ(line.scope, "session");
 }
 
-TEST_F(WaitTest, NegativeOrNanTimeoutTimesOutAtOnce) {
-  for (double timeout : {-1.0, 0.0, std::numeric_limits<double>::quiet_NaN()}) {
-    const SteadyTime now = condition_.Now();
-    condition_.ScriptTimeOut();
-    EXPECT_FALSE(Wait(nullptr, timeout)) << timeout;
-    EXPECT_EQ(condition_.Deadlines().back(), now) << timeout;
-  }
-  ExpectUnlockedAndBalanced();
-}
-
-TEST_F(WaitTest, HugeTimeoutGivesAValidLaterDeadline) {
-  const SteadyTime start = condition_.Now();
-  condition_.ScriptSignalWithFlag();
-  EXPECT_TRUE(Wait(nullptr, std::numeric_limits<double>::infinity()));
-  ASSERT_EQ(condition_.Deadlines().size(), 1u);
-  EXPECT_GT(condition_.Deadlines()[0], start + std::chrono::hours(24 * 365));
-  ExpectUnlockedAndBalanced();
-}
-
-TEST_F(WaitTest, ConditionIsUnlockedWhenTheWaitThrows) {
-  condition_.Script([](SteadyTime) -> bool { throw std::runtime_error("wait failed"); });
-  EXPECT_THROW(Wait(), std::runtime_error);
-  ExpectUnlockedAndBalanced();
-}
-
-// ---------------------------------------------------------------------------------------------
-// Bounded wait on the real condition and clock. Bounds are generous: a loaded machine only
-// makes the signal later, never the wait shorter.
-
-// A lock left held would block the other thread; it is detached (and owns the condition) so that
-// such a failure reports instead of hanging the test.
-bool CanBeLockedFromAnotherThread(std::shared_ptr<Condition> condition) {
-  auto locked = std::make_shared<std::promise<void>>();
-  auto done = locked->get_future();
-  std::thread([condition, locked] {
-    condition->Lock();
-    condition->Unlock();
-    locked->set_value();
-  }).detach();
-  return done.wait_for(seconds(30)) == std::future_status::ready;
-}
-
-TEST(RealConditionWaitTest, FlagSetByAnotherThreadEndsTheWait) {
+// The real condition and clock, with generous bounds: a loaded machine only makes the signal
+// later, never the wait shorter.
+TEST(RealConditionWaitTest, FlagSetByAnotherThreadEndsTheWaitAndSilenceTimesOut) {
   FakeLogSystem logs;
   std::shared_ptr<Condition> condition = MakeCondition();
   bool flag = false;
@@ -380,29 +306,21 @@ TEST(RealConditionWaitTest, FlagSetByAnotherThreadEndsTheWait) {
     condition->Signal();
     condition->Unlock();
   });
-  const auto start = std::chrono::steady_clock::now();
-  const bool seen = RuvoReportingUtilityWait(*condition, flag, "waiting", "timed out", nullptr,
-                                             /*timeoutSeconds=*/60.0);
-  const auto elapsed = std::chrono::steady_clock::now() - start;
+  EXPECT_TRUE(RuvoReportingUtilityWait(*condition, flag, "waiting", "timed out", nullptr, 60.0));
   setter.join();
-  EXPECT_TRUE(seen);
-  EXPECT_LT(elapsed, seconds(30));
   EXPECT_EQ(logs.Count("timed out"), 0u);
 
-  EXPECT_TRUE(CanBeLockedFromAnotherThread(condition));
-}
-
-TEST(RealConditionWaitTest, NoSignalTimesOutAfterTheTimeout) {
-  FakeLogSystem logs;
-  std::shared_ptr<Condition> condition = MakeCondition();
-  bool flag = false;
+  flag = false;
   const auto start = std::chrono::steady_clock::now();
   EXPECT_FALSE(RuvoReportingUtilityWait(*condition, flag, "waiting", "timed out", nullptr, 0.05));
   EXPECT_GE(std::chrono::steady_clock::now() - start, milliseconds(50));
   EXPECT_EQ(logs.Count("timed out", LogLevel::kError), 1u);
-  EXPECT_EQ(logs.Count("waiting", LogLevel::kDefault), 1u);
-
-  EXPECT_TRUE(CanBeLockedFromAnotherThread(condition));
+  // Left unlocked: another thread can take the lock.
+  auto locked = std::async(std::launch::async, [&] {
+    condition->Lock();
+    condition->Unlock();
+  });
+  EXPECT_EQ(locked.wait_for(seconds(30)), std::future_status::ready);
 }
 
 }  // namespace
