@@ -19,7 +19,6 @@ namespace tavrin {
 namespace {
 
 using testing::FakeClientConnection;
-using testing::FakeTelvoroService;
 
 // Listener that is never asked to do anything: the delegate only receives it.
 class NullListener final : public ServiceListener {
@@ -37,6 +36,10 @@ struct Client {
   RuvoReportingServiceProtocol::BoolReply Bool(std::string what) {
     return [this, what](bool value) { replies.push_back(what + "=" + (value ? "YES" : "NO")); };
   }
+  void CreateAndStart(int64_t id) {
+    service().createReportingSession(id, Bool("create"));
+    service().startReportingSessionForID(id, Bool("start"));
+  }
 };
 
 class ServiceDelegateTest : public ::testing::Test {
@@ -45,8 +48,6 @@ class ServiceDelegateTest : public ::testing::Test {
     platform.services.processInfo = &processInfo;
     platform.services.notifications = &notifications;
     platform.services.defaults = &defaults;
-    platform.telvoro.SetDiscovery(FakeTelvoroService::Discovery::kAnswerAtOnce);
-    platform.telvoro.SetBackends({"sqlite:/tmp/tavrin.db"});
     delegate = RuvoReportingServiceDelegate::init(platform.services);
   }
 
@@ -75,29 +76,33 @@ class ServiceDelegateTest : public ::testing::Test {
   std::shared_ptr<RuvoReportingServiceDelegate> delegate;
 };
 
-TEST_F(ServiceDelegateTest, SettingsAreAbsentAndReportingEnabledUntilTheFirstNotification) {
+TEST_F(ServiceDelegateTest, SettingsComeWithEachNotificationOfTheOwnTokenAndReachEverySession) {
   EXPECT_FALSE(delegate->getDefaults().has_value());
   EXPECT_TRUE(delegate->isReportingEnabled());
   EXPECT_EQ(log.Count("notify setup result 0"), 1u);
   EXPECT_EQ(defaults.reads(), 0);
 
+  auto client = Connect(100);
+  client->service().createReportingSession(7, client->Bool("create"));
+  Run();
   defaults.Set("device_name", "kitchen");
   PostDefaults();
-  ASSERT_TRUE(delegate->getDefaults().has_value());
-  EXPECT_EQ(*delegate->getDefaults(),
+  EXPECT_EQ(delegate->getDefaults(),
+            (Dictionary{{"device_name", "kitchen"}, {"disable_reporting", 0}}));
+  EXPECT_EQ(delegate->findReportingSessionForID(7)->userInfo(),
             (Dictionary{{"device_name", "kitchen"}, {"disable_reporting", 0}}));
 
   defaults.Remove("device_name");
   PostDefaults();
-  EXPECT_EQ(*delegate->getDefaults(), (Dictionary{{"disable_reporting", 0}}));
-}
+  EXPECT_EQ(delegate->getDefaults(), (Dictionary{{"disable_reporting", 0}}));
 
-TEST_F(ServiceDelegateTest, NotificationWithAForeignTokenIsIgnored) {
+  // A foreign token is ignored.
+  const int reads = defaults.reads();
   defaults.Set("disable_reporting", true);
   notifications.PostWithToken(kDefaultsNotificationName, 999);
   Run();
   EXPECT_TRUE(delegate->isReportingEnabled());
-  EXPECT_EQ(defaults.reads(), 0);
+  EXPECT_EQ(defaults.reads(), reads);
 }
 
 TEST_F(ServiceDelegateTest, FailedRegistrationIsLoggedAndTheServiceRunsWithoutSettings) {
@@ -114,8 +119,7 @@ TEST_F(ServiceDelegateTest, FailedRegistrationIsLoggedAndTheServiceRunsWithoutSe
 
 TEST_F(ServiceDelegateTest, StartReplyIsHeldUntilStopAndArrivesBeforeTheStopReply) {
   auto client = Connect(100);
-  client->service().createReportingSession(7, client->Bool("create"));
-  client->service().startReportingSessionForID(7, client->Bool("start"));
+  client->CreateAndStart(7);
   Run();
   EXPECT_EQ(client->replies, (std::vector<std::string>{"create=YES"}));
 
@@ -130,8 +134,7 @@ TEST_F(ServiceDelegateTest, StartReplyIsHeldUntilStopAndArrivesBeforeTheStopRepl
 TEST_F(ServiceDelegateTest, TwoClientsSharingAnIdReachTheFirstClientsSessionButCannotStopIt) {
   auto a = Connect(100);
   auto b = Connect(200);
-  a->service().createReportingSession(7, a->Bool("create"));
-  a->service().startReportingSessionForID(7, a->Bool("start"));
+  a->CreateAndStart(7);
   Run();
   b->service().startReportingSessionForID(7, b->Bool("start"));
   b->service().stopReportingSessionForID(7, b->Bool("stop"));
@@ -223,10 +226,8 @@ TEST_F(ServiceDelegateTest, BroadcastWithoutRunningSessionsGoesStandaloneAndEmpt
 TEST_F(ServiceDelegateTest, BroadcastReachesEveryRunningSessionOfEveryClient) {
   auto a = Connect(100);
   auto b = Connect(200);
-  a->service().createReportingSession(1, a->Bool("create"));
-  a->service().startReportingSessionForID(1, a->Bool("start"));
-  b->service().createReportingSession(2, b->Bool("create"));
-  b->service().startReportingSessionForID(2, b->Bool("start"));
+  a->CreateAndStart(1);
+  b->CreateAndStart(2);
   b->service().createReportingSession(3, b->Bool("create"));  // not started: left out
   Run();
   a->service().sendMessage(Dictionary{{"EngineOnTime", 4.5}}, 1, 0, std::nullopt, nullptr);
@@ -251,8 +252,7 @@ TEST_F(ServiceDelegateTest, ServiceTypeOfReporterZeroIsAnsweredTwice) {
 
 TEST_F(ServiceDelegateTest, CreatingAnIdTwiceReplacesTheSessionWithoutStoppingIt) {
   auto client = Connect(100);
-  client->service().createReportingSession(7, client->Bool("create"));
-  client->service().startReportingSessionForID(7, client->Bool("start"));
+  client->CreateAndStart(7);
   Run();
   client->service().createReportingSession(7, client->Bool("create"));
   Run();
@@ -270,8 +270,7 @@ TEST_F(ServiceDelegateTest, StopSendsThePositiveDriverDeltaIntoTheSessionFirst) 
   auto second = RuvoReportingServiceDelegate::init(platform.services);  // subscribes anew
   delegate = second;
   auto client = Connect(100);
-  client->service().createReportingSession(7, client->Bool("create"));
-  client->service().startReportingSessionForID(7, client->Bool("start"));
+  client->CreateAndStart(7);
   Run();
   platform.driverStats.SetValue(channel, 13);
   client->service().stopReportingSessionForID(7, client->Bool("stop"));
@@ -287,8 +286,7 @@ TEST_F(ServiceDelegateTest, StopSendsThePositiveDriverDeltaIntoTheSessionFirst) 
 
 TEST_F(ServiceDelegateTest, UnchangedCountersLogNothingInteresting) {
   auto client = Connect(100);
-  client->service().createReportingSession(7, client->Bool("create"));
-  client->service().startReportingSessionForID(7, client->Bool("start"));
+  client->CreateAndStart(7);
   client->service().stopReportingSessionForID(7, client->Bool("stop"));
   Run();
   EXPECT_EQ(log.Count("nothing interesting to fetch from the drivers"), 1u);
@@ -297,8 +295,7 @@ TEST_F(ServiceDelegateTest, UnchangedCountersLogNothingInteresting) {
 TEST_F(ServiceDelegateTest, DisconnectStopsRunningSessionsAndRemovesTheClientOnce) {
   processInfo.SetCommandName(100, "mediaplayer");
   auto client = Connect(100);
-  client->service().createReportingSession(7, client->Bool("create"));
-  client->service().startReportingSessionForID(7, client->Bool("start"));
+  client->CreateAndStart(7);
   Run();
   platform.clock.Advance(std::chrono::seconds(42));
 
@@ -349,45 +346,24 @@ TEST_F(ServiceDelegateTest, ConnectionEndingBeforeItsClientWasListedHasNoStartDa
   EXPECT_TRUE(delegate->getAllClients().empty());
 }
 
-TEST_F(ServiceDelegateTest, DefaultsReachEverySessionOfEveryClient) {
-  auto a = Connect(100);
-  a->service().createReportingSession(7, a->Bool("create"));
-  Run();
-  defaults.Set("device_name", "hall");
-  PostDefaults();
-  RuvoReportingSessionPtr session = delegate->findReportingSessionForID(7);
-  ASSERT_TRUE(session);
-  EXPECT_EQ(session->userInfo()["device_name"], "hall");
-  EXPECT_EQ(session->userInfo()["disable_reporting"], 0);
-}
-
-TEST_F(ServiceDelegateTest, DestroyStopsARunningSessionAndRemovesIt) {
-  auto client = Connect(100);
-  client->service().createReportingSession(7, client->Bool("create"));
-  client->service().startReportingSessionForID(7, client->Bool("start"));
-  client->service().destroyReportingSession(7, client->Bool("destroy"));
-  client->service().destroyReportingSession(0, client->Bool("destroy0"));
-  std::vector<int64_t> reporters{-1};
-  client->service().getAllReporters([&](const std::vector<int64_t>& ids) { reporters = ids; });
-  Run();
-  EXPECT_EQ(traces.Count(trace::kSessionStopped), 1u);
-  EXPECT_TRUE(reporters.empty());
-  EXPECT_EQ(log.Count("destroying 7"), 1u);
-  EXPECT_EQ(log.Count("destroying 0"), 0u);
-  EXPECT_EQ(client->replies,
-            (std::vector<std::string>{"create=YES", "destroy=YES", "destroy0=YES"}));
-}
-
-TEST_F(ServiceDelegateTest, GetAllReportersListsClientsInOrder) {
+TEST_F(ServiceDelegateTest, DestroyStopsARunningSessionAndReportersAreListedInOrder) {
   auto a = Connect(100);
   auto b = Connect(200);
   b->service().createReportingSession(5, b->Bool("c"));
+  a->CreateAndStart(7);
   a->service().createReportingSession(3, a->Bool("c"));
   a->service().createReportingSession(1, a->Bool("c"));
+  a->service().destroyReportingSession(7, a->Bool("destroy"));
+  a->service().destroyReportingSession(0, a->Bool("destroy0"));
   std::vector<int64_t> reporters;
   b->service().getAllReporters([&](const std::vector<int64_t>& ids) { reporters = ids; });
   Run();
   EXPECT_EQ(reporters, (std::vector<int64_t>{1, 3, 5}));
+  EXPECT_EQ(traces.Count(trace::kSessionStopped), 1u);
+  EXPECT_EQ(log.Count("destroying 7"), 1u);
+  EXPECT_EQ(log.Count("destroying 0"), 0u);
+  EXPECT_EQ(a->replies, (std::vector<std::string>{"create=YES", "c=YES", "c=YES", "destroy=YES",
+                                                  "destroy0=YES"}));
 }
 
 TEST_F(ServiceDelegateTest, KillServiceEndsTheProcessWithStatusTwoAndNoReply) {

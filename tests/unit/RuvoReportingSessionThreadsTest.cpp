@@ -122,7 +122,7 @@ TEST_F(SessionThreadsTest, MessagesKeepTheirOrderWhileOrientationAndStopRunElsew
     const auto created = platform.telvoro.Sessions();
     if (created.size() != kSessions) return false;
     for (const auto& session : created) {
-      if (session->FlushCount() != 1) return false;
+      if (session->MessagesAtFlush().size() != 1) return false;
     }
     return platform.telvoro.SingleMessages().size() == kSessions * kAfterStop;
   }));
