@@ -117,50 +117,35 @@ TEST_F(ServiceDelegateTest, FailedRegistrationIsLoggedAndTheServiceRunsWithoutSe
   platform.services.notifications = &notifications;  // the fixture's delegate still uses it
 }
 
-TEST_F(ServiceDelegateTest, StartReplyIsHeldUntilStopAndArrivesBeforeTheStopReply) {
-  auto client = Connect(100);
-  client->CreateAndStart(7);
-  Run();
-  EXPECT_EQ(client->replies, (std::vector<std::string>{"create=YES"}));
-
-  client->service().stopReportingSessionForID(7, client->Bool("stop"));
-  Run();
-  EXPECT_EQ(client->replies, (std::vector<std::string>{"create=YES", "start=YES", "stop=YES"}));
-  EXPECT_EQ(traces.Count(trace::kClientCreate), 1u);
-  EXPECT_EQ(traces.Count(trace::kClientStart), 1u);
-  EXPECT_EQ(traces.Count(trace::kClientStop), 1u);
-}
-
-TEST_F(ServiceDelegateTest, TwoClientsSharingAnIdReachTheFirstClientsSessionButCannotStopIt) {
+TEST_F(ServiceDelegateTest, StartReplyIsHeldUntilItsOwnClientStopsAndLookupFavoursTheFirstClient) {
   auto a = Connect(100);
   auto b = Connect(200);
   a->CreateAndStart(7);
-  Run();
-  b->service().startReportingSessionForID(7, b->Bool("start"));
-  b->service().stopReportingSessionForID(7, b->Bool("stop"));
-  Run();
-  EXPECT_EQ(b->replies, (std::vector<std::string>{"start=YES", "stop=YES"}));
-  // A's start reply is still held: B stopped nothing.
-  EXPECT_EQ(a->replies, (std::vector<std::string>{"create=YES"}));
-  RuvoReportingSessionPtr session = delegate->findReportingSessionForID(7);
-  ASSERT_TRUE(session);
-  EXPECT_TRUE(session->started());
-  EXPECT_EQ(log.Count("found reporting session 7 for client 100"), 2u);
-}
-
-TEST_F(ServiceDelegateTest, LookupAnswersTheClientAcceptedFirst) {
-  auto a = Connect(100);
-  auto b = Connect(200);
   b->service().createReportingSession(9, b->Bool("create"));
   a->service().createReportingSession(9, a->Bool("create"));
   Run();
-  log.Clear();
-  RuvoReportingSessionPtr found = delegate->findReportingSessionForID(9);
-  ASSERT_TRUE(found);
-  EXPECT_EQ(found->processIdentifiers(), (std::vector<int32_t>{100}));
-  EXPECT_EQ(log.Count("failed to find reporting session 9"), 0u);
+  // B reaches A's session under the same id, but its stop stops nothing.
+  b->service().startReportingSessionForID(7, b->Bool("start"));
+  b->service().stopReportingSessionForID(7, b->Bool("stop"));
+  Run();
+  EXPECT_EQ(b->replies, (std::vector<std::string>{"create=YES", "start=YES", "stop=YES"}));
+  EXPECT_EQ(a->replies, (std::vector<std::string>{"create=YES", "create=YES"}));
+  EXPECT_TRUE(delegate->findReportingSessionForID(7)->started());
+  EXPECT_EQ(log.Count("found reporting session 7 for client 100"), 2u);
+  EXPECT_EQ(delegate->findReportingSessionForID(9)->processIdentifiers(),
+            (std::vector<int32_t>{100}));
+  EXPECT_EQ(log.Count("failed to find reporting session"), 0u);
   EXPECT_FALSE(delegate->findReportingSessionForID(10));
   EXPECT_EQ(log.Count("failed to find reporting session 10", LogLevel::kError), 1u);
+
+  // The held start reply arrives before the stop reply.
+  a->service().stopReportingSessionForID(7, a->Bool("stop"));
+  Run();
+  EXPECT_EQ(a->replies,
+            (std::vector<std::string>{"create=YES", "create=YES", "start=YES", "stop=YES"}));
+  EXPECT_EQ(traces.Count(trace::kClientCreate), 3u);
+  EXPECT_EQ(traces.Count(trace::kClientStart), 2u);
+  EXPECT_EQ(traces.Count(trace::kClientStop), 2u);
 }
 
 TEST_F(ServiceDelegateTest, DisabledReportingRefusesMessagesAndHidesOtherClientsSessions) {
@@ -199,21 +184,22 @@ TEST_F(ServiceDelegateTest, DisabledReportingRefusesMessagesAndHidesOtherClients
   EXPECT_EQ(*valid, (Dictionary{{"reporterID", 7}, {"serviceType", 2}}));
 }
 
-TEST_F(ServiceDelegateTest, BroadcastWithoutRunningSessionsGoesStandaloneAndEmptyListsSendNothing) {
-  auto client = Connect(100);
-  client->service().createReportingSession(7, client->Bool("create"));  // created, not started
+TEST_F(ServiceDelegateTest, BroadcastReachesEveryRunningSessionOfEveryClientOrGoesStandalone) {
+  auto a = Connect(100);
+  auto b = Connect(200);
+  b->service().createReportingSession(3, b->Bool("create"));  // never started: left out
   Run();
   int nilReplies = 0;
   auto countNil = [&](const OptionalError& error) { nilReplies += error ? 0 : 1; };
-
-  client->service().sendMessage(Dictionary{{"a", 1}}, 3, 1, std::vector<int64_t>{}, countNil);
-  client->service().sendMessage(Dictionary{{"a", 2}}, 3, 1, std::vector<int64_t>{0, 5}, countNil);
+  // Empty lists, or ones naming no session, send nothing at all.
+  a->service().sendMessage(Dictionary{{"a", 1}}, 3, 1, std::vector<int64_t>{}, countNil);
+  a->service().sendMessage(Dictionary{{"a", 2}}, 3, 1, std::vector<int64_t>{0, 5}, countNil);
   Run();
   EXPECT_EQ(nilReplies, 2);
   EXPECT_TRUE(platform.telvoro.SingleMessages().empty());
   EXPECT_TRUE(platform.analytics.Events().empty());
 
-  client->service().sendMessage(Dictionary{{"a", 3}}, 3, 1, std::nullopt, countNil);
+  a->service().sendMessage(Dictionary{{"a", 3}}, 3, 1, std::nullopt, countNil);
   Run();
   EXPECT_EQ(nilReplies, 3);
   EXPECT_EQ(log.Count("no active reporting sessions found, sending as standalone"), 1u);
@@ -221,14 +207,9 @@ TEST_F(ServiceDelegateTest, BroadcastWithoutRunningSessionsGoesStandaloneAndEmpt
   ASSERT_EQ(singles.size(), 1u);
   EXPECT_EQ(singles[0].userInfo[kTelvoroUserInfoServiceName], "standalone");
   EXPECT_EQ(singles[0].payload, (Dictionary{{"a", 3}}));
-}
 
-TEST_F(ServiceDelegateTest, BroadcastReachesEveryRunningSessionOfEveryClient) {
-  auto a = Connect(100);
-  auto b = Connect(200);
   a->CreateAndStart(1);
   b->CreateAndStart(2);
-  b->service().createReportingSession(3, b->Bool("create"));  // not started: left out
   Run();
   a->service().sendMessage(Dictionary{{"EngineOnTime", 4.5}}, 1, 0, std::nullopt, nullptr);
   Run();
@@ -236,7 +217,7 @@ TEST_F(ServiceDelegateTest, BroadcastReachesEveryRunningSessionOfEveryClient) {
   size_t delivered = 0;
   for (const auto& session : platform.telvoro.Sessions()) delivered += session->Messages().size();
   EXPECT_EQ(delivered, 2u);
-  EXPECT_EQ(platform.analytics.Events().size(), 2u);
+  EXPECT_EQ(platform.analytics.Events().size(), 2u);  // none for the standalone one
   EXPECT_EQ(platform.powerLog.Events().size(), 2u);
 }
 
