@@ -146,6 +146,7 @@ TEST_F(ServiceDelegateTest, StartReplyIsHeldUntilItsOwnClientStopsAndLookupFavou
   EXPECT_EQ(traces.Count(trace::kClientCreate), 3u);
   EXPECT_EQ(traces.Count(trace::kClientStart), 2u);
   EXPECT_EQ(traces.Count(trace::kClientStop), 2u);
+  EXPECT_EQ(log.Count("nothing interesting to fetch from the drivers"), 1u);  // no counters
 }
 
 TEST_F(ServiceDelegateTest, DisabledReportingRefusesMessagesAndHidesOtherClientsSessions) {
@@ -265,14 +266,6 @@ TEST_F(ServiceDelegateTest, StopSendsThePositiveDriverDeltaIntoTheSessionFirst) 
   EXPECT_EQ(log.Count("fetching driver logs {\"Speaker_xruns\":3}"), 1u);
 }
 
-TEST_F(ServiceDelegateTest, UnchangedCountersLogNothingInteresting) {
-  auto client = Connect(100);
-  client->CreateAndStart(7);
-  client->service().stopReportingSessionForID(7, client->Bool("stop"));
-  Run();
-  EXPECT_EQ(log.Count("nothing interesting to fetch from the drivers"), 1u);
-}
-
 TEST_F(ServiceDelegateTest, DisconnectStopsRunningSessionsAndRemovesTheClientOnce) {
   processInfo.SetCommandName(100, "mediaplayer");
   auto client = Connect(100);
@@ -301,30 +294,25 @@ TEST_F(ServiceDelegateTest, DisconnectStopsRunningSessionsAndRemovesTheClientOnc
   EXPECT_EQ(traces.Count(trace::kSessionReleased), 1u);
 }
 
-TEST_F(ServiceDelegateTest, ClientsWithoutANameSendNoUptimeEvent) {
+TEST_F(ServiceDelegateTest, ClientsWithoutANameOrStartDateSendNoUptimeEvent) {
   auto zero = Connect(0);
   EXPECT_FALSE(delegate->getAllClients().back()->clientProcessName().has_value());
   zero->connection->End(/*abnormal=*/false);
+  auto early = std::make_shared<FakeClientConnection>(100);
+  processInfo.SetCommandName(100, "early");
+  ASSERT_TRUE(delegate->shouldAcceptNewConnection(listener, early));
+  early->End(/*abnormal=*/false);  // before the queue added the client
   Run();
   EXPECT_EQ(log.Count("clientProcessName is nil. clientpid=0"), 1u);
+  EXPECT_EQ(log.Count("clientStartDate is nil. clientpid=100 clientprocessname=(null)"), 1u);
+  EXPECT_EQ(log.Count("uptime_sec=-1"), 1u);
   EXPECT_EQ(log.Count("InterruptionHandler"), 0u);
   EXPECT_TRUE(platform.analytics.Events().empty());
+  EXPECT_TRUE(delegate->getAllClients().empty());
 
   auto own = Connect(processInfo.ownPid);
   EXPECT_EQ(delegate->getAllClients().back()->clientProcessName(),
             std::optional<std::string>("tavrind"));
-}
-
-TEST_F(ServiceDelegateTest, ConnectionEndingBeforeItsClientWasListedHasNoStartDate) {
-  auto client = std::make_unique<Client>();
-  client->connection = std::make_shared<FakeClientConnection>(100);
-  processInfo.SetCommandName(100, "early");
-  ASSERT_TRUE(delegate->shouldAcceptNewConnection(listener, client->connection));
-  client->connection->End(/*abnormal=*/false);  // before the queue added the client
-  Run();
-  EXPECT_EQ(log.Count("clientStartDate is nil. clientpid=100 clientprocessname=(null)"), 1u);
-  EXPECT_EQ(log.Count("uptime_sec=-1"), 1u);
-  EXPECT_TRUE(delegate->getAllClients().empty());
 }
 
 TEST_F(ServiceDelegateTest, DestroyStopsARunningSessionAndReportersAreListedInOrder) {
