@@ -293,8 +293,10 @@ TEST_F(SessionTest, StopFlushesAfterEveryQueuedMessageAndDropsTheLists) {
   EXPECT_EQ(Sequence(fake), (std::vector<int64_t>{0, 1, 2}));
   EXPECT_TRUE(platform.telvoro.SingleMessages().empty());
   EXPECT_EQ(fake->MessagesAtFlush(), (std::vector<size_t>{4}));
-  EXPECT_EQ(fake->Messages().back().category, 0xFFFF);
-  EXPECT_EQ(fake->Messages().back().type, 0xFFFF);
+  const FakeTelvoroMessage summary = fake->Messages().back();
+  EXPECT_EQ(summary.category, 0xFFFF);
+  EXPECT_EQ(summary.type, 0xFFFF);
+  EXPECT_EQ(summary.payload, (Dictionary{{"Ruvo_Session_Summary_Event", "3"}, {"seq", "0,1,2"}}));
   EXPECT_EQ(session->telvoroSession(), nullptr);
   EXPECT_EQ(CountMessage("flush error disk full", LogLevel::kError), 1u);
 }
@@ -451,7 +453,7 @@ TEST_F(SessionTest, AlarmsSingleMessagesWaitTheDrawnDelay) {
   EXPECT_EQ(platform.telvoro.SingleMessages().size(), 2u);
 }
 
-TEST_F(SessionTest, OtherSingleMessagesGoAtOnceWithoutTheClientsUserInfo) {
+TEST_F(SessionTest, OtherSingleMessagesGoAtOnceWithoutTheClientsUserInfoAndReportFailures) {
   RuvoReportingSession::sendSingleMessage(
       Dictionary{{"engine on time", 7}}, 0x20000003, 2, 2,
       Dictionary{{"secret", "x"}, {"ServiceName", "mine"}, {"HostApplicationDisplayID", "a"}},
@@ -477,17 +479,14 @@ TEST_F(SessionTest, OtherSingleMessagesGoAtOnceWithoutTheClientsUserInfo) {
   EXPECT_EQ(CountMessage("message {\"engine on time\":7} : category 536870915 : type 2",
                          LogLevel::kDebug),
             1u);
-}
-
-TEST_F(SessionTest, SingleMessageFailuresReachTheReply) {
+  // A refusal reaches the reply and the log.
   platform.telvoro.FailSends(Error{"com.example", 9, "back-end down"});
   std::optional<OptionalError> answer;
   RuvoReportingSession::sendSingleMessage(Dictionary{{"a", 1}}, 0xFFFFFFFF, 1, 13,
                                           Dictionary::object(),
                                           [&](const OptionalError& error) { answer = error; });
   platform.dispatcher.RunUntilIdle();
-  ASSERT_TRUE(answer.has_value());
-  ASSERT_TRUE(answer->has_value());
+  ASSERT_TRUE(answer.has_value() && answer->has_value());
   EXPECT_EQ((*answer)->code, 9);
   EXPECT_EQ((*answer)->description, "back-end down");
   EXPECT_EQ(CountMessage("sendOneMessageWithSessionInfo back-end down", LogLevel::kError), 1u);
