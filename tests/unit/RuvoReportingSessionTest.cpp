@@ -84,8 +84,11 @@ TEST_F(SessionTest, BackendsThatNeverAnswerDropTheSessionAfterNineSecondsAndAggr
   EXPECT_TRUE(fake->DiscoveryPending());
   EXPECT_EQ(CountMessage("waiting for telvorod to find backends", LogLevel::kDefault), 1u);
 
-  // Messages sent during the wait queue up behind it.
-  for (int i = 0; i < 3; ++i) Send(session, Dictionary{{"seq", i}});
+  // Messages sent during the wait queue up behind it; replies mean accepted and come at once.
+  int replies = 0;
+  auto reply = [&](const OptionalError& error) { replies += error ? 100 : 1; };
+  for (int i = 0; i < 3; ++i) session->sendMessage(Dictionary{{"seq", i}}, 1, 1, i == 0, reply);
+  EXPECT_EQ(replies, 3);
   platform.dispatcher.RunUntilIdle();
   EXPECT_EQ(platform.dispatcher.PendingCount(*session->telvoroQueue()), 3u);
 
@@ -115,12 +118,14 @@ TEST_F(SessionTest, BackendsThatNeverAnswerDropTheSessionAfterNineSecondsAndAggr
   EXPECT_EQ(session->telvoroSession(), nullptr);
 
   // Still aggregating, so the summary is made; it too finds no session, and nothing is flushed.
-  Send(session, Dictionary{{"seq", 3}});
+  session->sendMessage(Dictionary{{"seq", 3}}, 1, 1, reply);
+  EXPECT_EQ(replies, 4);
   EXPECT_EQ(Aggregated(session->summaryTexts()), 4u);
   session->stop();
   platform.dispatcher.RunUntilIdle();
   EXPECT_EQ(CountMessage("sending summary event for reporter 42", LogLevel::kDefault), 1u);
   EXPECT_EQ(CountMessage("No valid TelvoroSession", LogLevel::kError), 5u);
+  EXPECT_EQ(replies, 4);  // none twice
   EXPECT_TRUE(fake->MessagesAtFlush().empty());
 }
 
@@ -256,7 +261,10 @@ TEST_F(SessionTest, TestSessionsGetNoBackEndButStillSummarise) {
 
 TEST_F(SessionTest, BeforeStartMessagesGoAloneStopDoesNothingAndStartDropsTheAggregate) {
   auto session = Create();
-  Send(session, Dictionary{{"early", 1}});
+  bool replied = false;
+  session->sendMessage(Dictionary{{"early", 1}}, 1, 1,
+                       [&](const OptionalError& error) { replied = !error; });
+  EXPECT_TRUE(replied);
   session->stop();
   platform.dispatcher.RunUntilIdle();
   EXPECT_FALSE(session->started());
@@ -374,26 +382,6 @@ TEST_F(SessionTest, MessageIdsCountPerCategoryAndType) {
   for (const auto& message : platform.telvoro.LastSession()->Messages()) {
     EXPECT_EQ(message.category, 1);
   }
-}
-
-TEST_F(SessionTest, RepliesMeanAcceptedAndComeAtOnceEvenWithoutABackEnd) {
-  platform.telvoro.SetDiscovery(Discovery::kAnswerLater);
-  auto session = Create();
-  int replies = 0;
-  auto reply = [&](const OptionalError& error) {
-    EXPECT_FALSE(error.has_value());
-    ++replies;
-  };
-  session->sendMessage(Dictionary{{"a", 1}}, 1, 1, reply);  // not started
-  EXPECT_EQ(replies, 1);
-  StartAndRun(session);
-  session->sendMessage(Dictionary{{"a", 1}}, 1, 1, true, reply);  // waiting for back-ends
-  EXPECT_EQ(replies, 2);
-  platform.dispatcher.AdvanceBy(seconds(9));
-  session->sendMessage(Dictionary{{"a", 1}}, 1, 1, reply);  // back-end gone
-  EXPECT_EQ(replies, 3);
-  platform.dispatcher.RunUntilIdle();
-  EXPECT_EQ(replies, 3);
 }
 
 TEST_F(SessionTest, AfterStopMessagesGoAloneAndReachNoSummary) {
