@@ -5,8 +5,8 @@
 #include <functional>
 #include <memory>
 #include <mutex>
-#include <optional>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "base/Dictionary.h"
@@ -37,24 +37,26 @@ class FakeTelvoroSession final : public TelvoroSession {
   void FlushMessages(std::function<void(const OptionalError&)> done) override;
   std::string Description() const override;
 
-  // Answers a discovery that is still waiting (answer-later and never-answer modes). False when
-  // there is none, or it was answered already.
+  // Answers a discovery that is still waiting; false when there is none.
   bool AnswerDiscovery(const BackendList& backends);
-  bool DiscoveryPending() const;
-  size_t StartConfigurationCalls() const;
+  bool DiscoveryPending() const { return static_cast<bool>(Locked(pendingDiscovery_)); }
 
-  size_t Index() const { return index_; }
   const Dictionary& SessionInfo() const { return sessionInfo_; }
   const Dictionary& UserInfo() const { return userInfo_; }
   const std::vector<std::string>& FrameworksToCheck() const { return frameworks_; }
-  // Messages accepted, in the order they arrived (refused ones are not kept).
-  std::vector<FakeTelvoroMessage> Messages() const;
-  size_t RefusedCount() const;
-  size_t FlushCount() const;
+  // Messages accepted, in the order they arrived (refused ones are only counted).
+  std::vector<FakeTelvoroMessage> Messages() const { return Locked(messages_); }
+  size_t RefusedCount() const { return Locked(refused_); }
   // How many messages had arrived when each flush was asked.
-  std::vector<size_t> MessagesAtFlush() const;
+  std::vector<size_t> MessagesAtFlush() const { return Locked(messagesAtFlush_); }
 
  private:
+  template <typename T>
+  T Locked(const T& member) const {
+    std::lock_guard lock(mutex_);
+    return member;
+  }
+
   FakeTelvoroService& service_;
   const size_t index_;
   const Dictionary sessionInfo_;
@@ -63,7 +65,6 @@ class FakeTelvoroSession final : public TelvoroSession {
 
   mutable std::mutex mutex_;
   std::function<void(const BackendList&)> pendingDiscovery_;  // guarded by mutex_
-  size_t startConfigurationCalls_ = 0;                        // guarded by mutex_
   std::vector<FakeTelvoroMessage> messages_;                  // guarded by mutex_
   size_t refused_ = 0;                                        // guarded by mutex_
   std::vector<size_t> messagesAtFlush_;                       // guarded by mutex_
@@ -74,10 +75,9 @@ class FakeTelvoroSession final : public TelvoroSession {
 class FakeTelvoroService final : public TelvoroService {
  public:
   enum class Discovery {
-    kAnswerAtOnce,  // StartConfiguration calls back before it returns, with Backends()
-    kAnswerLater,   // held until the test calls AnswerDiscovery
+    kAnswerAtOnce,  // StartConfiguration calls back before it returns, with one back-end
+    kAnswerLater,   // held until the test answers (AnswerPendingDiscoveries)
     kAnswerNil,     // calls back at once with no back-ends
-    kNeverAnswer,   // held; nothing answers unless the test does
   };
 
   struct SingleMessage {
@@ -88,28 +88,21 @@ class FakeTelvoroService final : public TelvoroService {
     Dictionary payload;
   };
 
-  static constexpr const char* kErrorDomain = "com.quorvex.tavrin.fake.telvoro";
-  static constexpr uint64_t kFirstToken = 1000;
-
-  void SetDiscovery(Discovery mode);
-  Discovery DiscoveryMode() const;
-  void SetBackends(std::vector<std::string> backends);
-  std::vector<std::string> Backends() const;
+  void SetDiscovery(Discovery mode) { Set(discovery_, mode); }
   // Answers every discovery still waiting; returns how many were answered.
   size_t AnswerPendingDiscoveries(const BackendList& backends);
-
   // Sends (session and single) fail with `error` while set.
-  void FailSends(OptionalError error);
+  void FailSends(OptionalError error) { Set(sendError_, std::move(error)); }
   // Flushes call back with `error` while set.
-  void FailFlushes(OptionalError error);
+  void FailFlushes(OptionalError error) { Set(flushError_, std::move(error)); }
 
   // Tokens handed out, in order, with the parent each was asked for (null for none).
-  std::vector<TelvoroTokenPtr> Tokens() const;
-  std::vector<TelvoroTokenPtr> TokenParents() const;
-  std::vector<std::shared_ptr<FakeTelvoroSession>> Sessions() const;
+  std::vector<TelvoroTokenPtr> Tokens() const { return Locked(tokens_); }
+  std::vector<TelvoroTokenPtr> TokenParents() const { return Locked(tokenParents_); }
+  std::vector<std::shared_ptr<FakeTelvoroSession>> Sessions() const { return Locked(sessions_); }
   std::shared_ptr<FakeTelvoroSession> LastSession() const;
-  std::vector<SingleMessage> SingleMessages() const;
-  size_t RefusedSingleMessages() const;
+  std::vector<SingleMessage> SingleMessages() const { return Locked(singleMessages_); }
+  size_t RefusedSingleMessages() const { return Locked(refusedSingles_); }
 
   // TelvoroService
   TelvoroTokenPtr NewSecureHierarchyToken(const TelvoroTokenPtr& parent) override;
@@ -121,15 +114,22 @@ class FakeTelvoroService final : public TelvoroService {
 
  private:
   friend class FakeTelvoroSession;
-  OptionalError SendError() const;
-  OptionalError FlushError() const;
+  template <typename T>
+  T Locked(const T& member) const {
+    std::lock_guard lock(mutex_);
+    return member;
+  }
+  template <typename T>
+  void Set(T& member, T value) {
+    std::lock_guard lock(mutex_);
+    member = std::move(value);
+  }
 
   mutable std::mutex mutex_;
   Discovery discovery_ = Discovery::kAnswerAtOnce;
-  std::vector<std::string> backends_{"sqlite:/fake/tavrin.db"};
   OptionalError sendError_;
   OptionalError flushError_;
-  uint64_t nextToken_ = kFirstToken;
+  uint64_t nextToken_ = 1000;
   std::vector<TelvoroTokenPtr> tokens_;
   std::vector<TelvoroTokenPtr> tokenParents_;
   std::vector<std::shared_ptr<FakeTelvoroSession>> sessions_;

@@ -3,6 +3,8 @@
 #include <cstdlib>
 #include <ctime>
 #include <memory>
+#include <optional>
+#include <regex>
 #include <string>
 #include <vector>
 
@@ -26,15 +28,8 @@ inline FakeLogSystem& ProcessLogSystem() {
 
 // The text of a logged line without its "file:line:function: " prefix.
 inline std::string LineMessage(const std::string& line) {
-  const size_t file = line.find(':');
-  if (file == std::string::npos) return line;
-  const size_t number = line.find(':', file + 1);
-  if (number == std::string::npos || number == file + 1) return line;
-  for (size_t i = file + 1; i < number; ++i) {
-    if (line[i] < '0' || line[i] > '9') return line;
-  }
-  const size_t function = line.find(": ", number + 1);
-  return function == std::string::npos ? line : line.substr(function + 2);
+  static const std::regex prefix("^[^:]+:[0-9]+:.*?: ");
+  return std::regex_replace(line, prefix, "", std::regex_constants::format_first_only);
 }
 
 // Base of the session tests: a fresh fake platform per test, the process's log facility cleared,
@@ -57,23 +52,16 @@ class SessionTestBase : public ::testing::Test {
     return session;
   }
 
-  // Messages (prefix removed) of the session scope, in order; only those of `level` when given.
-  std::vector<std::string> SessionMessages() const { return Messages("rvrr", nullptr); }
-  std::vector<std::string> SessionMessages(LogLevel level) const {
-    return Messages("rvrr", &level);
-  }
+  // Messages (prefix removed) of the session scope, in order, of `level`.
+  std::vector<std::string> SessionMessages(LogLevel level) const { return Messages("rvrr", level); }
   std::vector<std::string> DefaultMessages(LogLevel level) const {
-    return Messages("default", &level);
+    return Messages("default", level);
   }
-  size_t CountMessage(const std::string& message) const {
-    size_t count = 0;
-    for (const auto& line : log.Lines()) count += LineMessage(line.text) == message ? 1 : 0;
-    return count;
-  }
-  size_t CountMessage(const std::string& message, LogLevel level) const {
+  // Lines whose message (prefix removed) is `message`, of `level` when given.
+  size_t CountMessage(const std::string& message, std::optional<LogLevel> level = {}) const {
     size_t count = 0;
     for (const auto& line : log.Lines()) {
-      count += line.level == level && LineMessage(line.text) == message ? 1 : 0;
+      count += (!level || line.level == *level) && LineMessage(line.text) == message ? 1 : 0;
     }
     return count;
   }
@@ -94,12 +82,10 @@ class SessionTestBase : public ::testing::Test {
   RecordingTraceRecorder traces;
 
  private:
-  std::vector<std::string> Messages(const std::string& scope, const LogLevel* level) const {
+  std::vector<std::string> Messages(const std::string& scope, LogLevel level) const {
     std::vector<std::string> messages;
     for (const auto& line : log.Lines()) {
-      if (line.scope != scope) continue;
-      if (level != nullptr && line.level != *level) continue;
-      messages.push_back(LineMessage(line.text));
+      if (line.scope == scope && line.level == level) messages.push_back(LineMessage(line.text));
     }
     return messages;
   }

@@ -16,35 +16,29 @@ class ExternalBuildTest : public SessionTestBase {
   ExternalBuildTest() : SessionTestBase(/*internalBuild=*/false) {}
 };
 
-TEST_F(ExternalBuildTest, NoFileIsWrittenHoweverMuchWasAggregated) {
-  auto session = Create(42, 2);
-  session->start();
-  platform.dispatcher.RunUntilIdle();
-  for (int i = 0; i < 50; ++i) session->sendMessage(Dictionary{{"n", i}}, 1, 1, nullptr);
-  session->stop();
-  session->start();
-  session->sendMessage(Dictionary{{"n", 0}}, 1, 1, nullptr);
-  session->stop();
-  platform.dispatcher.RunUntilIdle();
-  EXPECT_TRUE(platform.fileSystem.CreateDirectoriesCalls().empty());
-  EXPECT_TRUE(platform.fileSystem.WriteCalls().empty());
-  // The summary event itself is still sent.
-  EXPECT_EQ(CountMessage("sending summary event for reporter 42"), 2u);
-  // The device was asked at most once, whatever number of stops asked.
-  EXPECT_LE(platform.deviceInfo.QueryCount(kDeviceInfoInternalBuild), 1u);
-}
-
-TEST_F(ExternalBuildTest, OrientationIsNeverTracked) {
+TEST_F(ExternalBuildTest, NoFileIsWrittenAndNoOrientationTrackedHoweverMuchWasAggregated) {
   for (uint16_t type : {uint16_t{2}, uint16_t{7}}) {
-    auto session = Create(7, type);
+    auto session = Create(42, type);
     EXPECT_FALSE(session->shouldReportOrientation());
     session->start();
+    platform.dispatcher.RunUntilIdle();
     EXPECT_FALSE(session->orientationCallbackID().has_value());
     EXPECT_FALSE(session->startDate().has_value());
+    for (int i = 0; i < 50; ++i) session->sendMessage(Dictionary{{"n", i}}, 1, 1, nullptr);
     session->stop();
+    session->start();
+    session->sendMessage(Dictionary{{"n", 0}}, 1, 1, nullptr);
+    session->stop();
+    platform.dispatcher.RunUntilIdle();
   }
+  EXPECT_TRUE(platform.fileSystem.CreateDirectoriesCalls().empty());
+  EXPECT_TRUE(platform.fileSystem.WriteCalls().empty());
   EXPECT_TRUE(platform.orientation.History().empty());
-  // Decided by the build alone: the device class is never asked.
+  // The summary event itself is still sent.
+  EXPECT_EQ(CountMessage("sending summary event for reporter 42"), 4u);
+  // The device was asked at most once, whatever number of stops asked; its class never, as the
+  // build alone decides about orientation.
+  EXPECT_LE(platform.deviceInfo.QueryCount(kDeviceInfoInternalBuild), 1u);
   EXPECT_EQ(platform.deviceInfo.QueryCount(kDeviceInfoDeviceClassNumber), 0u);
 }
 

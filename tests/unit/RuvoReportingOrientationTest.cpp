@@ -52,12 +52,13 @@ TEST_F(OrientationTest, TelephonyAndLongFormAudioRegisterDeviceThenUI) {
   }
 }
 
-TEST_F(OrientationTest, OtherServiceTypesAndDeviceClassSixNeverTrack) {
+TEST_F(OrientationTest, OtherServiceTypesDeviceClassSixAndNeverStartedSessionsNeverTrack) {
   for (uint16_t type : {uint16_t{0}, uint16_t{3}, uint16_t{8}, uint16_t{0xFFFF}}) {
     auto session = Started(type);
     EXPECT_FALSE(session->orientationCallbackID().has_value()) << type;
     session->stop();
   }
+  Create(42, 2)->stop();  // never started: nothing to unregister
   platform.deviceInfo.SetInt32(kDeviceInfoDeviceClassNumber, 6);
   auto session = Started(2);
   EXPECT_FALSE(session->shouldReportOrientation());
@@ -90,80 +91,57 @@ TEST_F(OrientationTest, TimesAreRoundedToWholeMilliseconds) {
   EXPECT_EQ(session->messageTypeCounts(), Dictionary::object());
   EXPECT_TRUE(Entries(session->nestedAggregatedPayloadData()).empty());
 
-  const auto debug = SessionMessages(LogLevel::kDebug);
-  const std::vector<std::string> expected{
-      "Orientation handler callback mode=ui orientation=\"landscape-left\" "
-      "app=\"com.example.call\", time=0.013, id=\"RuvoReportingService 42\"",
-      "Orientation handler callback mode=device orientation=\"portrait\" "
-      "app=\"com.example.call\", time=2, id=\"RuvoReportingService 42\""};
-  EXPECT_EQ(CountMessage(expected[0], LogLevel::kDebug), 1u);
-  EXPECT_EQ(CountMessage(expected[1], LogLevel::kDebug), 1u);
+  for (const char* line :
+       {"mode=ui orientation=\"landscape-left\" app=\"com.example.call\", time=0.013",
+        "mode=device orientation=\"portrait\" app=\"com.example.call\", time=2"}) {
+    EXPECT_EQ(CountMessage(std::string("Orientation handler callback ") + line +
+                               ", id=\"RuvoReportingService 42\"",
+                           LogLevel::kDebug),
+              1u);
+  }
 }
 
-TEST_F(OrientationTest, RecordsInterleaveWithMessagesAndReachTheSummary) {
-  auto session = Started(7);
-  session->sendMessage(Dictionary{{"a", 1}}, 1, 1, nullptr);
-  platform.clock.Advance(milliseconds(250));
-  platform.orientation.FireDevice("portrait");
-  session->sendMessage(Dictionary{{"a", 2}}, 1, 1, nullptr);
-  platform.orientation.FireUI("portrait");
-  const auto summary = session->createSummaryEventForSession();
-  ASSERT_TRUE(summary.has_value());
-  EXPECT_EQ(*summary, (Dictionary{{"Ruvo_Session_Summary_Event", "7"},
-                                  {"a", "1,2"},
-                                  {"device_orientation", "portrait"},
-                                  {"device_orientation_time", "0.25"},
-                                  {"ui_orientation", "portrait"},
-                                  {"ui_orientation_time", "0.25"}}));
-  EXPECT_EQ(CountMessage("Orientation handler callback mode=ui orientation=\"portrait\" "
-                         "app=\"(null)\", time=0.25, id=\"RuvoReportingService 42\""),
-            1u);
-}
+TEST_F(OrientationTest, TheCallbacksHoldTheSessionUntilStopUnregistersThem) {
+  std::weak_ptr<RuvoReportingSession> weak = Started(2);
+  // Released without stop: still registered, still aggregating.
+  ASSERT_FALSE(weak.expired());
+  EXPECT_EQ(platform.orientation.FireUI("portrait"), 1u);
+  EXPECT_EQ(Aggregated(weak.lock()->summaryTexts()), 1u);
 
-TEST_F(OrientationTest, ATypeChangedBeforeStopLeavesTheCallbacksRegistered) {
-  auto session = Started(2);
-  session->setServiceType(3);
-  session->stop();
+  // A type changed before stop leaves the callbacks registered; what they report after stop is
+  // kept nowhere.
+  weak.lock()->setServiceType(3);
+  weak.lock()->stop();
   EXPECT_TRUE(platform.orientation.IsRegistered(Kind::kDevice, kCallbackID));
   EXPECT_TRUE(platform.orientation.IsRegistered(Kind::kUI, kCallbackID));
-  EXPECT_EQ(session->orientationCallbackID(), kCallbackID);
-
-  // The callbacks hold the session; what they report after stop is kept nowhere.
-  std::weak_ptr<RuvoReportingSession> weak = session;
-  session.reset();
-  EXPECT_FALSE(weak.expired());
+  EXPECT_EQ(weak.lock()->orientationCallbackID(), kCallbackID);
   EXPECT_EQ(platform.orientation.FireDevice("portrait"), 1u);
   EXPECT_EQ(weak.lock()->summaryTexts(), nullptr);
   EXPECT_EQ(CountMessage("deallocing this session 42"), 0u);
 }
 
-TEST_F(OrientationTest, ASessionReleasedWithoutStopStaysRegistered) {
-  auto session = Started(2);
-  std::weak_ptr<RuvoReportingSession> weak = session;
-  session.reset();
-  EXPECT_FALSE(weak.expired());
-  EXPECT_EQ(platform.orientation.RegisteredCount(Kind::kDevice), 1u);
-  platform.orientation.FireUI("portrait");
-  EXPECT_EQ(Aggregated(weak.lock()->summaryTexts()), 1u);
-}
-
-TEST_F(OrientationTest, StopOfANeverStartedSessionUnregistersNothing) {
-  auto session = Create(42, 2);
-  session->stop();
-  EXPECT_TRUE(platform.orientation.History().empty());
-}
-
-TEST_F(OrientationTest, RestartRegistersAgainWithANewStartDate) {
-  auto session = Started(2);
+TEST_F(OrientationTest, ARestartRegistersAgainAndRecordsInterleaveWithMessages) {
+  auto session = Started(7);
   session->stop();
   platform.clock.Advance(std::chrono::seconds(30));
   session->start();
   EXPECT_EQ(session->startDate(), platform.clock.Now());
   EXPECT_TRUE(platform.orientation.IsRegistered(Kind::kDevice, kCallbackID));
-  platform.clock.Advance(milliseconds(1));
+  session->sendMessage(Dictionary{{"a", 1}}, 1, 1, nullptr);
+  platform.clock.Advance(milliseconds(250));
   platform.orientation.FireDevice("portrait");
-  EXPECT_EQ((*session->createSummaryEventForSession())["device_orientation_time"], "0.001");
-  session->stop();
+  session->sendMessage(Dictionary{{"a", 2}}, 1, 1, nullptr);
+  platform.orientation.FireUI("portrait");
+  EXPECT_EQ(*session->createSummaryEventForSession(),
+            (Dictionary{{"Ruvo_Session_Summary_Event", "7"},
+                        {"a", "1,2"},
+                        {"device_orientation", "portrait"},
+                        {"device_orientation_time", "0.25"},
+                        {"ui_orientation", "portrait"},
+                        {"ui_orientation_time", "0.25"}}));
+  EXPECT_EQ(CountMessage("Orientation handler callback mode=ui orientation=\"portrait\" "
+                         "app=\"(null)\", time=0.25, id=\"RuvoReportingService 42\""),
+            1u);
 }
 
 }  // namespace

@@ -19,7 +19,6 @@ namespace tavrin {
 namespace {
 
 using testing::FakeClientConnection;
-using testing::FakeTelvoroService;
 
 // Listener that is never asked to do anything: the delegate only receives it.
 class NullListener final : public ServiceListener {
@@ -37,6 +36,10 @@ struct Client {
   RuvoReportingServiceProtocol::BoolReply Bool(std::string what) {
     return [this, what](bool value) { replies.push_back(what + "=" + (value ? "YES" : "NO")); };
   }
+  void CreateAndStart(int64_t id) {
+    service().createReportingSession(id, Bool("create"));
+    service().startReportingSessionForID(id, Bool("start"));
+  }
 };
 
 class ServiceDelegateTest : public ::testing::Test {
@@ -45,8 +48,6 @@ class ServiceDelegateTest : public ::testing::Test {
     platform.services.processInfo = &processInfo;
     platform.services.notifications = &notifications;
     platform.services.defaults = &defaults;
-    platform.telvoro.SetDiscovery(FakeTelvoroService::Discovery::kAnswerAtOnce);
-    platform.telvoro.SetBackends({"sqlite:/tmp/tavrin.db"});
     delegate = RuvoReportingServiceDelegate::init(platform.services);
   }
 
@@ -75,29 +76,33 @@ class ServiceDelegateTest : public ::testing::Test {
   std::shared_ptr<RuvoReportingServiceDelegate> delegate;
 };
 
-TEST_F(ServiceDelegateTest, SettingsAreAbsentAndReportingEnabledUntilTheFirstNotification) {
+TEST_F(ServiceDelegateTest, SettingsComeWithEachNotificationOfTheOwnTokenAndReachEverySession) {
   EXPECT_FALSE(delegate->getDefaults().has_value());
   EXPECT_TRUE(delegate->isReportingEnabled());
   EXPECT_EQ(log.Count("notify setup result 0"), 1u);
   EXPECT_EQ(defaults.reads(), 0);
 
+  auto client = Connect(100);
+  client->service().createReportingSession(7, client->Bool("create"));
+  Run();
   defaults.Set("device_name", "kitchen");
   PostDefaults();
-  ASSERT_TRUE(delegate->getDefaults().has_value());
-  EXPECT_EQ(*delegate->getDefaults(),
+  EXPECT_EQ(delegate->getDefaults(),
+            (Dictionary{{"device_name", "kitchen"}, {"disable_reporting", 0}}));
+  EXPECT_EQ(delegate->findReportingSessionForID(7)->userInfo(),
             (Dictionary{{"device_name", "kitchen"}, {"disable_reporting", 0}}));
 
   defaults.Remove("device_name");
   PostDefaults();
-  EXPECT_EQ(*delegate->getDefaults(), (Dictionary{{"disable_reporting", 0}}));
-}
+  EXPECT_EQ(delegate->getDefaults(), (Dictionary{{"disable_reporting", 0}}));
 
-TEST_F(ServiceDelegateTest, NotificationWithAForeignTokenIsIgnored) {
+  // A foreign token is ignored.
+  const int reads = defaults.reads();
   defaults.Set("disable_reporting", true);
   notifications.PostWithToken(kDefaultsNotificationName, 999);
   Run();
   EXPECT_TRUE(delegate->isReportingEnabled());
-  EXPECT_EQ(defaults.reads(), 0);
+  EXPECT_EQ(defaults.reads(), reads);
 }
 
 TEST_F(ServiceDelegateTest, FailedRegistrationIsLoggedAndTheServiceRunsWithoutSettings) {
@@ -112,52 +117,36 @@ TEST_F(ServiceDelegateTest, FailedRegistrationIsLoggedAndTheServiceRunsWithoutSe
   platform.services.notifications = &notifications;  // the fixture's delegate still uses it
 }
 
-TEST_F(ServiceDelegateTest, StartReplyIsHeldUntilStopAndArrivesBeforeTheStopReply) {
-  auto client = Connect(100);
-  client->service().createReportingSession(7, client->Bool("create"));
-  client->service().startReportingSessionForID(7, client->Bool("start"));
-  Run();
-  EXPECT_EQ(client->replies, (std::vector<std::string>{"create=YES"}));
-
-  client->service().stopReportingSessionForID(7, client->Bool("stop"));
-  Run();
-  EXPECT_EQ(client->replies, (std::vector<std::string>{"create=YES", "start=YES", "stop=YES"}));
-  EXPECT_EQ(traces.Count(trace::kClientCreate), 1u);
-  EXPECT_EQ(traces.Count(trace::kClientStart), 1u);
-  EXPECT_EQ(traces.Count(trace::kClientStop), 1u);
-}
-
-TEST_F(ServiceDelegateTest, TwoClientsSharingAnIdReachTheFirstClientsSessionButCannotStopIt) {
+TEST_F(ServiceDelegateTest, StartReplyIsHeldUntilItsOwnClientStopsAndLookupFavoursTheFirstClient) {
   auto a = Connect(100);
   auto b = Connect(200);
-  a->service().createReportingSession(7, a->Bool("create"));
-  a->service().startReportingSessionForID(7, a->Bool("start"));
-  Run();
-  b->service().startReportingSessionForID(7, b->Bool("start"));
-  b->service().stopReportingSessionForID(7, b->Bool("stop"));
-  Run();
-  EXPECT_EQ(b->replies, (std::vector<std::string>{"start=YES", "stop=YES"}));
-  // A's start reply is still held: B stopped nothing.
-  EXPECT_EQ(a->replies, (std::vector<std::string>{"create=YES"}));
-  RuvoReportingSessionPtr session = delegate->findReportingSessionForID(7);
-  ASSERT_TRUE(session);
-  EXPECT_TRUE(session->started());
-  EXPECT_EQ(log.Count("found reporting session 7 for client 100"), 2u);
-}
-
-TEST_F(ServiceDelegateTest, LookupAnswersTheClientAcceptedFirst) {
-  auto a = Connect(100);
-  auto b = Connect(200);
+  a->CreateAndStart(7);
   b->service().createReportingSession(9, b->Bool("create"));
   a->service().createReportingSession(9, a->Bool("create"));
   Run();
-  log.Clear();
-  RuvoReportingSessionPtr found = delegate->findReportingSessionForID(9);
-  ASSERT_TRUE(found);
-  EXPECT_EQ(found->processIdentifiers(), (std::vector<int32_t>{100}));
-  EXPECT_EQ(log.Count("failed to find reporting session 9"), 0u);
+  // B reaches A's session under the same id, but its stop stops nothing.
+  b->service().startReportingSessionForID(7, b->Bool("start"));
+  b->service().stopReportingSessionForID(7, b->Bool("stop"));
+  Run();
+  EXPECT_EQ(b->replies, (std::vector<std::string>{"create=YES", "start=YES", "stop=YES"}));
+  EXPECT_EQ(a->replies, (std::vector<std::string>{"create=YES", "create=YES"}));
+  EXPECT_TRUE(delegate->findReportingSessionForID(7)->started());
+  EXPECT_EQ(log.Count("found reporting session 7 for client 100"), 2u);
+  EXPECT_EQ(delegate->findReportingSessionForID(9)->processIdentifiers(),
+            (std::vector<int32_t>{100}));
+  EXPECT_EQ(log.Count("failed to find reporting session"), 0u);
   EXPECT_FALSE(delegate->findReportingSessionForID(10));
   EXPECT_EQ(log.Count("failed to find reporting session 10", LogLevel::kError), 1u);
+
+  // The held start reply arrives before the stop reply.
+  a->service().stopReportingSessionForID(7, a->Bool("stop"));
+  Run();
+  EXPECT_EQ(a->replies,
+            (std::vector<std::string>{"create=YES", "create=YES", "start=YES", "stop=YES"}));
+  EXPECT_EQ(traces.Count(trace::kClientCreate), 3u);
+  EXPECT_EQ(traces.Count(trace::kClientStart), 2u);
+  EXPECT_EQ(traces.Count(trace::kClientStop), 2u);
+  EXPECT_EQ(log.Count("nothing interesting to fetch from the drivers"), 1u);  // no counters
 }
 
 TEST_F(ServiceDelegateTest, DisabledReportingRefusesMessagesAndHidesOtherClientsSessions) {
@@ -196,21 +185,22 @@ TEST_F(ServiceDelegateTest, DisabledReportingRefusesMessagesAndHidesOtherClients
   EXPECT_EQ(*valid, (Dictionary{{"reporterID", 7}, {"serviceType", 2}}));
 }
 
-TEST_F(ServiceDelegateTest, BroadcastWithoutRunningSessionsGoesStandaloneAndEmptyListsSendNothing) {
-  auto client = Connect(100);
-  client->service().createReportingSession(7, client->Bool("create"));  // created, not started
+TEST_F(ServiceDelegateTest, BroadcastReachesEveryRunningSessionOfEveryClientOrGoesStandalone) {
+  auto a = Connect(100);
+  auto b = Connect(200);
+  b->service().createReportingSession(3, b->Bool("create"));  // never started: left out
   Run();
   int nilReplies = 0;
   auto countNil = [&](const OptionalError& error) { nilReplies += error ? 0 : 1; };
-
-  client->service().sendMessage(Dictionary{{"a", 1}}, 3, 1, std::vector<int64_t>{}, countNil);
-  client->service().sendMessage(Dictionary{{"a", 2}}, 3, 1, std::vector<int64_t>{0, 5}, countNil);
+  // Empty lists, or ones naming no session, send nothing at all.
+  a->service().sendMessage(Dictionary{{"a", 1}}, 3, 1, std::vector<int64_t>{}, countNil);
+  a->service().sendMessage(Dictionary{{"a", 2}}, 3, 1, std::vector<int64_t>{0, 5}, countNil);
   Run();
   EXPECT_EQ(nilReplies, 2);
   EXPECT_TRUE(platform.telvoro.SingleMessages().empty());
   EXPECT_TRUE(platform.analytics.Events().empty());
 
-  client->service().sendMessage(Dictionary{{"a", 3}}, 3, 1, std::nullopt, countNil);
+  a->service().sendMessage(Dictionary{{"a", 3}}, 3, 1, std::nullopt, countNil);
   Run();
   EXPECT_EQ(nilReplies, 3);
   EXPECT_EQ(log.Count("no active reporting sessions found, sending as standalone"), 1u);
@@ -218,16 +208,9 @@ TEST_F(ServiceDelegateTest, BroadcastWithoutRunningSessionsGoesStandaloneAndEmpt
   ASSERT_EQ(singles.size(), 1u);
   EXPECT_EQ(singles[0].userInfo[kTelvoroUserInfoServiceName], "standalone");
   EXPECT_EQ(singles[0].payload, (Dictionary{{"a", 3}}));
-}
 
-TEST_F(ServiceDelegateTest, BroadcastReachesEveryRunningSessionOfEveryClient) {
-  auto a = Connect(100);
-  auto b = Connect(200);
-  a->service().createReportingSession(1, a->Bool("create"));
-  a->service().startReportingSessionForID(1, a->Bool("start"));
-  b->service().createReportingSession(2, b->Bool("create"));
-  b->service().startReportingSessionForID(2, b->Bool("start"));
-  b->service().createReportingSession(3, b->Bool("create"));  // not started: left out
+  a->CreateAndStart(1);
+  b->CreateAndStart(2);
   Run();
   a->service().sendMessage(Dictionary{{"EngineOnTime", 4.5}}, 1, 0, std::nullopt, nullptr);
   Run();
@@ -235,7 +218,7 @@ TEST_F(ServiceDelegateTest, BroadcastReachesEveryRunningSessionOfEveryClient) {
   size_t delivered = 0;
   for (const auto& session : platform.telvoro.Sessions()) delivered += session->Messages().size();
   EXPECT_EQ(delivered, 2u);
-  EXPECT_EQ(platform.analytics.Events().size(), 2u);
+  EXPECT_EQ(platform.analytics.Events().size(), 2u);  // none for the standalone one
   EXPECT_EQ(platform.powerLog.Events().size(), 2u);
 }
 
@@ -251,8 +234,7 @@ TEST_F(ServiceDelegateTest, ServiceTypeOfReporterZeroIsAnsweredTwice) {
 
 TEST_F(ServiceDelegateTest, CreatingAnIdTwiceReplacesTheSessionWithoutStoppingIt) {
   auto client = Connect(100);
-  client->service().createReportingSession(7, client->Bool("create"));
-  client->service().startReportingSessionForID(7, client->Bool("start"));
+  client->CreateAndStart(7);
   Run();
   client->service().createReportingSession(7, client->Bool("create"));
   Run();
@@ -270,8 +252,7 @@ TEST_F(ServiceDelegateTest, StopSendsThePositiveDriverDeltaIntoTheSessionFirst) 
   auto second = RuvoReportingServiceDelegate::init(platform.services);  // subscribes anew
   delegate = second;
   auto client = Connect(100);
-  client->service().createReportingSession(7, client->Bool("create"));
-  client->service().startReportingSessionForID(7, client->Bool("start"));
+  client->CreateAndStart(7);
   Run();
   platform.driverStats.SetValue(channel, 13);
   client->service().stopReportingSessionForID(7, client->Bool("stop"));
@@ -285,20 +266,10 @@ TEST_F(ServiceDelegateTest, StopSendsThePositiveDriverDeltaIntoTheSessionFirst) 
   EXPECT_EQ(log.Count("fetching driver logs {\"Speaker_xruns\":3}"), 1u);
 }
 
-TEST_F(ServiceDelegateTest, UnchangedCountersLogNothingInteresting) {
-  auto client = Connect(100);
-  client->service().createReportingSession(7, client->Bool("create"));
-  client->service().startReportingSessionForID(7, client->Bool("start"));
-  client->service().stopReportingSessionForID(7, client->Bool("stop"));
-  Run();
-  EXPECT_EQ(log.Count("nothing interesting to fetch from the drivers"), 1u);
-}
-
 TEST_F(ServiceDelegateTest, DisconnectStopsRunningSessionsAndRemovesTheClientOnce) {
   processInfo.SetCommandName(100, "mediaplayer");
   auto client = Connect(100);
-  client->service().createReportingSession(7, client->Bool("create"));
-  client->service().startReportingSessionForID(7, client->Bool("start"));
+  client->CreateAndStart(7);
   Run();
   platform.clock.Advance(std::chrono::seconds(42));
 
@@ -323,71 +294,45 @@ TEST_F(ServiceDelegateTest, DisconnectStopsRunningSessionsAndRemovesTheClientOnc
   EXPECT_EQ(traces.Count(trace::kSessionReleased), 1u);
 }
 
-TEST_F(ServiceDelegateTest, ClientsWithoutANameSendNoUptimeEvent) {
+TEST_F(ServiceDelegateTest, ClientsWithoutANameOrStartDateSendNoUptimeEvent) {
   auto zero = Connect(0);
   EXPECT_FALSE(delegate->getAllClients().back()->clientProcessName().has_value());
   zero->connection->End(/*abnormal=*/false);
+  auto early = std::make_shared<FakeClientConnection>(100);
+  processInfo.SetCommandName(100, "early");
+  ASSERT_TRUE(delegate->shouldAcceptNewConnection(listener, early));
+  early->End(/*abnormal=*/false);  // before the queue added the client
   Run();
   EXPECT_EQ(log.Count("clientProcessName is nil. clientpid=0"), 1u);
+  EXPECT_EQ(log.Count("clientStartDate is nil. clientpid=100 clientprocessname=(null)"), 1u);
+  EXPECT_EQ(log.Count("uptime_sec=-1"), 1u);
   EXPECT_EQ(log.Count("InterruptionHandler"), 0u);
   EXPECT_TRUE(platform.analytics.Events().empty());
+  EXPECT_TRUE(delegate->getAllClients().empty());
 
   auto own = Connect(processInfo.ownPid);
   EXPECT_EQ(delegate->getAllClients().back()->clientProcessName(),
             std::optional<std::string>("tavrind"));
 }
 
-TEST_F(ServiceDelegateTest, ConnectionEndingBeforeItsClientWasListedHasNoStartDate) {
-  auto client = std::make_unique<Client>();
-  client->connection = std::make_shared<FakeClientConnection>(100);
-  processInfo.SetCommandName(100, "early");
-  ASSERT_TRUE(delegate->shouldAcceptNewConnection(listener, client->connection));
-  client->connection->End(/*abnormal=*/false);  // before the queue added the client
-  Run();
-  EXPECT_EQ(log.Count("clientStartDate is nil. clientpid=100 clientprocessname=(null)"), 1u);
-  EXPECT_EQ(log.Count("uptime_sec=-1"), 1u);
-  EXPECT_TRUE(delegate->getAllClients().empty());
-}
-
-TEST_F(ServiceDelegateTest, DefaultsReachEverySessionOfEveryClient) {
-  auto a = Connect(100);
-  a->service().createReportingSession(7, a->Bool("create"));
-  Run();
-  defaults.Set("device_name", "hall");
-  PostDefaults();
-  RuvoReportingSessionPtr session = delegate->findReportingSessionForID(7);
-  ASSERT_TRUE(session);
-  EXPECT_EQ(session->userInfo()["device_name"], "hall");
-  EXPECT_EQ(session->userInfo()["disable_reporting"], 0);
-}
-
-TEST_F(ServiceDelegateTest, DestroyStopsARunningSessionAndRemovesIt) {
-  auto client = Connect(100);
-  client->service().createReportingSession(7, client->Bool("create"));
-  client->service().startReportingSessionForID(7, client->Bool("start"));
-  client->service().destroyReportingSession(7, client->Bool("destroy"));
-  client->service().destroyReportingSession(0, client->Bool("destroy0"));
-  std::vector<int64_t> reporters{-1};
-  client->service().getAllReporters([&](const std::vector<int64_t>& ids) { reporters = ids; });
-  Run();
-  EXPECT_EQ(traces.Count(trace::kSessionStopped), 1u);
-  EXPECT_TRUE(reporters.empty());
-  EXPECT_EQ(log.Count("destroying 7"), 1u);
-  EXPECT_EQ(log.Count("destroying 0"), 0u);
-  EXPECT_EQ(client->replies,
-            (std::vector<std::string>{"create=YES", "destroy=YES", "destroy0=YES"}));
-}
-
-TEST_F(ServiceDelegateTest, GetAllReportersListsClientsInOrder) {
+TEST_F(ServiceDelegateTest, DestroyStopsARunningSessionAndReportersAreListedInOrder) {
   auto a = Connect(100);
   auto b = Connect(200);
   b->service().createReportingSession(5, b->Bool("c"));
+  a->CreateAndStart(7);
   a->service().createReportingSession(3, a->Bool("c"));
   a->service().createReportingSession(1, a->Bool("c"));
+  a->service().destroyReportingSession(7, a->Bool("destroy"));
+  a->service().destroyReportingSession(0, a->Bool("destroy0"));
   std::vector<int64_t> reporters;
   b->service().getAllReporters([&](const std::vector<int64_t>& ids) { reporters = ids; });
   Run();
   EXPECT_EQ(reporters, (std::vector<int64_t>{1, 3, 5}));
+  EXPECT_EQ(traces.Count(trace::kSessionStopped), 1u);
+  EXPECT_EQ(log.Count("destroying 7"), 1u);
+  EXPECT_EQ(log.Count("destroying 0"), 0u);
+  EXPECT_EQ(a->replies, (std::vector<std::string>{"create=YES", "c=YES", "c=YES", "destroy=YES",
+                                                  "destroy0=YES"}));
 }
 
 TEST_F(ServiceDelegateTest, KillServiceEndsTheProcessWithStatusTwoAndNoReply) {

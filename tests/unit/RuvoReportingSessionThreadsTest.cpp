@@ -4,8 +4,9 @@
 #include <algorithm>
 #include <atomic>
 #include <chrono>
-#include <fstream>
+#include <filesystem>
 #include <functional>
+#include <iterator>
 #include <memory>
 #include <string>
 #include <thread>
@@ -27,17 +28,8 @@ using std::chrono::milliseconds;
 constexpr auto kDeadline = std::chrono::seconds(120);
 
 size_t ThreadCount() {
-  std::ifstream status("/proc/self/status");
-  std::string key;
-  while (status >> key) {
-    if (key == "Threads:") {
-      size_t count = 0;
-      status >> count;
-      return count;
-    }
-    std::getline(status, key);
-  }
-  return 0;
+  const std::filesystem::directory_iterator tasks("/proc/self/task");
+  return static_cast<size_t>(std::distance(begin(tasks), end(tasks)));
 }
 
 // Polls `done` until it holds or the deadline passes; true when it held.
@@ -120,11 +112,10 @@ TEST_F(SessionThreadsTest, MessagesKeepTheirOrderWhileOrientationAndStopRunElsew
 
   ASSERT_TRUE(Eventually([&] {
     const auto created = platform.telvoro.Sessions();
-    if (created.size() != kSessions) return false;
-    for (const auto& session : created) {
-      if (session->FlushCount() != 1) return false;
-    }
-    return platform.telvoro.SingleMessages().size() == kSessions * kAfterStop;
+    return created.size() == kSessions &&
+           std::all_of(created.begin(), created.end(),
+                       [](const auto& s) { return s->MessagesAtFlush().size() == 1; }) &&
+           platform.telvoro.SingleMessages().size() == kSessions * kAfterStop;
   }));
 
   std::string allSeq;
@@ -157,10 +148,7 @@ TEST_F(SessionThreadsTest, MessagesKeepTheirOrderWhileOrientationAndStopRunElsew
   std::vector<std::weak_ptr<RuvoReportingSession>> weak(sessions.begin(), sessions.end());
   sessions.clear();
   EXPECT_TRUE(Eventually([&] {
-    for (const auto& session : weak) {
-      if (!session.expired()) return false;
-    }
-    return true;
+    return std::all_of(weak.begin(), weak.end(), [](const auto& s) { return s.expired(); });
   }));
   EXPECT_EQ(platform.orientation.RegisteredCount(FakeOrientationRegistry::Kind::kDevice), 0u);
 }
@@ -183,11 +171,9 @@ TEST_F(SessionThreadsTest, TenThousandSessionsWaitForBackEndsWithoutThreads) {
   }
   ASSERT_TRUE(Eventually([&] {
     const auto created = platform.telvoro.Sessions();
-    if (created.size() != kSessions) return false;
-    for (const auto& session : created) {
-      if (!session->DiscoveryPending()) return false;
-    }
-    return true;
+    return created.size() == kSessions &&
+           std::all_of(created.begin(), created.end(),
+                       [](const auto& s) { return s->DiscoveryPending(); });
   }));
   // Every session is waiting now, and the process has no more threads than before.
   EXPECT_LE(ThreadCount(), threadsBefore + 1);

@@ -33,51 +33,34 @@ class SinksTest : public SessionTestBase {
 
 // --- analytics --------------------------------------------------------------------------------
 
-TEST_F(SinksTest, EveryMessageBecomesAnAnalyticsEventWithTheApplicationName) {
+TEST_F(SinksTest, EveryMessageBecomesANamedAnalyticsEventWithTheSessionsApplicationName) {
   Offer(Dictionary{{"latency", 12}, {"route", "speaker"}}, 0x80000001, 1);
+  Offer(Dictionary{{"HostApplicationDisplayID", "forged"}}, 12, 6);
+  Offer(Dictionary(), 0xFFFFFFFF, 0xFFFF);  // absent: an event all the same
+  Offer(Dictionary::object(), 0x90000001, 5);
+  RuvoReportingKelvaneUtility::handleEvent(Value::array({"EngineOnTime"}), 1, 1, *session);
+  RuvoReportingStratikBridge::handleEvent(Dictionary{{"HostApplicationDisplayID", "forged"}}, 1, 1,
+                                          *Create(7, 3));
   const auto events = platform.analytics.Events();
-  ASSERT_EQ(events.size(), 1u);
-  EXPECT_EQ(events[0].name, "com.quorvex.tavrin.Toolbox_Generic.Start");
+  ASSERT_EQ(events.size(), 5u);
+  const std::string names[] = {"Toolbox_Generic.Start", "Undefined.Undefined", "Undefined.Unknown",
+                               "_Generic.IssueDetector"};
+  for (size_t i = 0; i < 4; ++i) EXPECT_EQ(events[i].name, "com.quorvex.tavrin." + names[i]);
   EXPECT_EQ(events[0].builderCalls, 1u);
+  const Dictionary game{{"HostApplicationDisplayID", "com.example.game"}};
   EXPECT_EQ(*events[0].payload, (Dictionary{{"latency", 12},
                                             {"route", "speaker"},
                                             {"HostApplicationDisplayID", "com.example.game"}}));
-  // No engine time: no power event.
+  EXPECT_EQ(*events[1].payload, game);
+  EXPECT_EQ(*events[2].payload, game);
+  EXPECT_EQ(*events[3].payload, game);
+  EXPECT_EQ(*events[4].payload, (Dictionary{{"HostApplicationDisplayID", "Unknown"}}));
+  // No engine time, or no dictionary: no power event.
   EXPECT_TRUE(platform.powerLog.Events().empty());
+  EXPECT_TRUE(DefaultMessages(LogLevel::kError).empty());
 }
 
-TEST_F(SinksTest, UnknownCodesUseTheFallbackNames) {
-  Offer(Dictionary::object(), 12, 6);
-  Offer(Dictionary::object(), 0xFFFFFFFF, 0xFFFF);
-  Offer(Dictionary::object(), 0x90000001, 5);
-  const auto events = platform.analytics.Events();
-  ASSERT_EQ(events.size(), 3u);
-  EXPECT_EQ(events[0].name, "com.quorvex.tavrin.Undefined.Undefined");
-  EXPECT_EQ(events[1].name, "com.quorvex.tavrin.Undefined.Unknown");
-  EXPECT_EQ(events[2].name, "com.quorvex.tavrin._Generic.IssueDetector");
-}
-
-TEST_F(SinksTest, TheClientsOwnApplicationNameIsReplaced) {
-  Offer(Dictionary{{"HostApplicationDisplayID", "forged"}, {"x", 1}}, 1, 1);
-  EXPECT_EQ(*platform.analytics.Events()[0].payload,
-            (Dictionary{{"HostApplicationDisplayID", "com.example.game"}, {"x", 1}}));
-
-  auto anonymous = Create(7, 3);
-  RuvoReportingStratikBridge::handleEvent(Dictionary{{"HostApplicationDisplayID", "forged"}}, 1, 1,
-                                          *anonymous);
-  EXPECT_EQ(*platform.analytics.Events()[1].payload,
-            (Dictionary{{"HostApplicationDisplayID", "Unknown"}}));
-}
-
-TEST_F(SinksTest, AnAbsentEventStillBecomesAnEvent) {
-  Offer(Dictionary(), 1, 1);
-  ASSERT_EQ(platform.analytics.Events().size(), 1u);
-  EXPECT_EQ(*platform.analytics.Events()[0].payload,
-            (Dictionary{{"HostApplicationDisplayID", "com.example.game"}}));
-  EXPECT_TRUE(platform.powerLog.Events().empty());
-}
-
-TEST_F(SinksTest, TheLazyPayloadIsTheOnePreparedAtSendTime) {
+TEST_F(SinksTest, TheLazyPayloadIsTheOnePreparedAtSendTimeAndASwitchedOffSinkNeverBuildsIt) {
   platform.analytics.SetBuilders(Builders::kCallLater);
   Offer(Dictionary{{"n", 1}}, 1, 1);
   EXPECT_EQ(platform.analytics.Events()[0].builderCalls, 0u);
@@ -86,24 +69,24 @@ TEST_F(SinksTest, TheLazyPayloadIsTheOnePreparedAtSendTime) {
   EXPECT_EQ(platform.analytics.RunPendingBuilders(), 1u);
   EXPECT_EQ(*platform.analytics.Events()[0].payload,
             (Dictionary{{"n", 1}, {"HostApplicationDisplayID", "com.example.game"}}));
-}
 
-TEST_F(SinksTest, ASwitchedOffSinkNeverBuildsThePayload) {
   platform.analytics.SetBuilders(Builders::kNeverCall);
-  Offer(Dictionary{{"n", 1}}, 1, 1);
+  Offer(Dictionary{{"n", 2}}, 1, 1);
   const auto events = platform.analytics.Events();
-  ASSERT_EQ(events.size(), 1u);
-  EXPECT_EQ(events[0].builderCalls, 0u);
-  EXPECT_FALSE(events[0].payload.has_value());
+  ASSERT_EQ(events.size(), 2u);
+  EXPECT_EQ(events[1].builderCalls, 0u);
+  EXPECT_FALSE(events[1].payload.has_value());
 }
 
 // --- power events -----------------------------------------------------------------------------
 
-TEST_F(SinksTest, EngineTimeBecomesAPowerEventWithNameAndTimestamp) {
+TEST_F(SinksTest, EngineTimeBecomesAPowerEventAndAMissingTimestampIsLogged) {
   Offer(Dictionary{{"EngineOnTime", 12.5}, {"ruvoreporting_timestamp", 1700000000123}, {"x", 1}}, 3,
         2);
+  EXPECT_TRUE(DefaultMessages(LogLevel::kError).empty());
+  Offer(Dictionary{{"EngineOnTime", 3}}, 1, 1);
   const auto events = platform.powerLog.Events();
-  ASSERT_EQ(events.size(), 1u);
+  ASSERT_EQ(events.size(), 2u);
   EXPECT_EQ(events[0].agent, 28);
   EXPECT_EQ(events[0].name, "Mediane_Haptics");
   EXPECT_FALSE(events[0].extra.has_value());
@@ -111,19 +94,12 @@ TEST_F(SinksTest, EngineTimeBecomesAPowerEventWithNameAndTimestamp) {
                                            {"ApplicationName", "com.example.game"},
                                            {"TimestampEnd", 1700000000123}}));
   EXPECT_TRUE(events[0].payload["EngineOnDuration"].is_number_float());
-  EXPECT_TRUE(DefaultMessages(LogLevel::kError).empty());
-  // The analytics event is made as well.
-  EXPECT_EQ(platform.analytics.Events().size(), 1u);
-}
-
-TEST_F(SinksTest, AMissingTimestampIsLoggedAndTheEventStillLogged) {
-  Offer(Dictionary{{"EngineOnTime", 3}}, 1, 1);
-  const auto events = platform.powerLog.Events();
-  ASSERT_EQ(events.size(), 1u);
-  EXPECT_EQ(events[0].payload,
+  EXPECT_EQ(events[1].payload,
             (Dictionary{{"EngineOnDuration", 3}, {"ApplicationName", "com.example.game"}}));
   EXPECT_EQ(DefaultMessages(LogLevel::kError),
             std::vector<std::string>{"failed to get RuvoReporting timestamp for kelvane"});
+  // The analytics events are made as well.
+  EXPECT_EQ(platform.analytics.Events().size(), 2u);
 }
 
 TEST_F(SinksTest, AnAbsentApplicationNameIsLoggedAndLeftOut) {
@@ -136,16 +112,8 @@ TEST_F(SinksTest, AnAbsentApplicationNameIsLoggedAndLeftOut) {
   EXPECT_EQ(DefaultMessages(LogLevel::kError),
             std::vector<std::string>{"failed to get app name for kelvane"});
 
-  auto anonymous = Create(7, 3);
-  RuvoReportingKelvaneUtility::handleEvent(Dictionary{{"EngineOnTime", 1}}, 1, 1, *anonymous);
+  RuvoReportingKelvaneUtility::handleEvent(Dictionary{{"EngineOnTime", 1}}, 1, 1, *Create(7, 3));
   EXPECT_EQ(platform.powerLog.Events()[1].payload["ApplicationName"], "Unknown");
-}
-
-TEST_F(SinksTest, NonDictionaryEventsAreIgnoredByThePowerLog) {
-  RuvoReportingKelvaneUtility::handleEvent(Dictionary(), 1, 1, *session);
-  RuvoReportingKelvaneUtility::handleEvent(Value::array({"EngineOnTime"}), 1, 1, *session);
-  EXPECT_TRUE(platform.powerLog.Events().empty());
-  EXPECT_TRUE(DefaultMessages(LogLevel::kError).empty());
 }
 
 }  // namespace
