@@ -222,7 +222,8 @@ TEST(WaitTest, ScriptedOutcomesGiveTheirResultDeadlinesAndLines) {
   } cases[] = {
       {{{O::kTimeOut}}, false, {t0 + t}, {"W", "T"}},
       {{{O::kSignalWithFlag, milliseconds(300)}}, true, {t0 + t}, {"W", "C"}},
-      {{{O::kSignalWithoutFlag, seconds(2)}, {O::kSignalWithoutFlag, milliseconds(2400)},
+      {{{O::kSignalWithoutFlag, seconds(2)},
+        {O::kSignalWithoutFlag, milliseconds(2400)},
         {O::kSignalWithFlag, seconds(1)}},
        true,
        {t0 + t, t0 + seconds(2) + t, t0 + milliseconds(4400) + t},
@@ -287,6 +288,7 @@ TEST(WaitTest, SetFlagThrowingWaitAndOddTimeouts) {
                                      "reporting_session_verbose", 31);
   ASSERT_NE(scope, nullptr);
   logs.Clear();
+  flag = false;
   ScriptedCondition scoped(flag, {{O::kTimeOut}});
   EXPECT_FALSE(RuvoReportingUtilityWait(scoped, flag, "W", "T", scope, 2.5));
   ASSERT_EQ(logs.Lines().size(), 2u);
