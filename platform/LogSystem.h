@@ -84,17 +84,25 @@ void Write(LogScope& scope, LogLevel level, std::string_view file, int line,
 }  // namespace log_detail
 }  // namespace tavrin
 
+// The operation that log lines name when they are written from a lambda or helper, where
+// __func__ would say "operator()". Declared at the top of the operation with TLOG_OPERATION; the
+// empty one below stands everywhere else, and __func__ is used.
+inline constexpr std::string_view tavrin_log_operation_{};
+#define TLOG_OPERATION(name) \
+  static constexpr std::string_view tavrin_log_operation_ { name }
+
 // Writes one line with the "file:line:function: " prefix to `target` (a LogHandle, which may be
 // null for the default log, or a LogScope&). The format uses fmt's "{}" placeholders; a Value
 // prints in its text form. Nothing is formatted when the scope filters the level out.
-#define TAVRIN_LOG(target, level, format, ...)                                                  \
-  do {                                                                                          \
-    ::tavrin::LogScope& tavrin_log_scope_ = ::tavrin::LogTarget(target);                        \
-    if (tavrin_log_scope_.ShouldLog(level)) {                                                   \
-      ::tavrin::log_detail::Write(tavrin_log_scope_, level,                                     \
-                                  ::tavrin::log_detail::BaseName(__FILE__), __LINE__, __func__, \
-                                  format __VA_OPT__(, ) __VA_ARGS__);                           \
-    }                                                                                           \
+#define TAVRIN_LOG(target, level, format, ...)                                                \
+  do {                                                                                        \
+    ::tavrin::LogScope& tavrin_log_scope_ = ::tavrin::LogTarget(target);                      \
+    if (tavrin_log_scope_.ShouldLog(level)) {                                                 \
+      ::tavrin::log_detail::Write(                                                            \
+          tavrin_log_scope_, level, ::tavrin::log_detail::BaseName(__FILE__), __LINE__,       \
+          tavrin_log_operation_.empty() ? std::string_view(__func__) : tavrin_log_operation_, \
+          format __VA_OPT__(, ) __VA_ARGS__);                                                 \
+    }                                                                                         \
   } while (0)
 
 #define TLOG_DEBUG(target, format, ...) \

@@ -198,6 +198,7 @@ std::optional<std::string> RuvoReportingServiceDelegate::processNameForPID(int32
 
 bool RuvoReportingServiceDelegate::shouldAcceptNewConnection(
     ServiceListener& /*listener*/, const ClientConnectionPtr& connection) {
+  TLOG_OPERATION("shouldAcceptNewConnection");
   const int32_t pid = connection->ProcessIdentifier();
   TLOG_DEFAULT(ServiceLog(), "newConnection: {}", connection->Description());
 
@@ -372,6 +373,7 @@ RuvoReportingSessionPtr RuvoReportingServerInstance::findReportingSessionForID(
 }
 
 void RuvoReportingServerInstance::createReportingSession(int64_t reporterID, BoolReply reply) {
+  TLOG_OPERATION("createReportingSession");
   TLOG_DEBUG(RuvoReportingServiceDelegate::ServiceLog(), "creating session for reporter {}",
              reporterID);
   enqueue([reporterID, reply = std::move(reply)](RuvoReportingServerInstance& self) {
@@ -390,6 +392,7 @@ void RuvoReportingServerInstance::createReportingSession(int64_t reporterID, Boo
 
 void RuvoReportingServerInstance::setServiceType(uint16_t serviceType, int64_t reporterID,
                                                  BoolReply reply) {
+  TLOG_OPERATION("setServiceType");
   TLOG_DEBUG(RuvoReportingServiceDelegate::ServiceLog(), "setting service type {} for reporter {}",
              serviceType, reporterID);
   enqueue([serviceType, reporterID, reply = std::move(reply)](RuvoReportingServerInstance& self) {
@@ -406,6 +409,7 @@ void RuvoReportingServerInstance::setServiceType(uint16_t serviceType, int64_t r
 
 void RuvoReportingServerInstance::getServiceNameForReporterID(int64_t reporterID,
                                                               ServiceTypeReply reply) {
+  TLOG_OPERATION("getServiceNameForReporterID");
   TLOG_DEBUG(RuvoReportingServiceDelegate::ServiceLog(), "fetching seviceType");
   enqueue([reporterID, reply = std::move(reply)](RuvoReportingServerInstance& self) {
     // ID 0 is answered twice on purpose: once here, once with the lookup below.
@@ -550,6 +554,7 @@ void RuvoReportingServerInstance::stopOnQueue(int64_t reporterID) {
 }
 
 void RuvoReportingServerInstance::destroyReportingSession(int64_t reporterID, BoolReply reply) {
+  TLOG_OPERATION("destroyReportingSession");
   TLOG_DEBUG(RuvoReportingServiceDelegate::ServiceLog(), "destroying session for reporter {}",
              reporterID);
   enqueue([reporterID, reply = std::move(reply)](RuvoReportingServerInstance& self) {
@@ -568,6 +573,7 @@ void RuvoReportingServerInstance::destroyReportingSession(int64_t reporterID, Bo
 }
 
 void RuvoReportingServerInstance::reporterID(int64_t reporterID, DictionaryReply valid) {
+  TLOG_OPERATION("reporterID");
   TLOG_DEBUG(RuvoReportingServiceDelegate::ServiceLog(), "validating reporter {}", reporterID);
   enqueue([reporterID, valid = std::move(valid)](RuvoReportingServerInstance& self) {
     Dictionary answer = MakeDictionary();

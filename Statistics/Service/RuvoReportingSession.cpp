@@ -197,6 +197,7 @@ void RuvoReportingSession::start() {
 
 void RuvoReportingSession::createTelvoroSessionOnQueue(
     const std::optional<std::string>& serviceName, uint16_t serviceType) {
+  TLOG_OPERATION("start");
   // Test sessions never get a TelvoroSession.
   if (this->serviceType() == service_type::kTest) return;
 
@@ -283,6 +284,7 @@ bool RuvoReportingSession::EndBackendWait(const std::shared_ptr<BackendWait>& wa
 }
 
 void RuvoReportingSession::stop() {
+  TLOG_OPERATION("stop");
   TLOG_DEBUG(SessionLog(), "ending session {}", reporterID_);
   if (shouldReportOrientation()) {
     std::optional<std::string> id = orientationCallbackID();
@@ -607,8 +609,9 @@ void RuvoReportingSession::sendSingleMessage(const Dictionary& payload, uint32_t
     if (reply) reply(result);
   };
   if (delaySeconds > 0) {
-    platform.dispatcher->BackgroundQueue().AsyncAfter(std::chrono::seconds(delaySeconds),
-                                                      std::move(send));
+    // Held back, not dropped, when the service stops: it then goes at once.
+    platform.dispatcher->AsyncDeferred(platform.dispatcher->BackgroundQueue(),
+                                       std::chrono::seconds(delaySeconds), std::move(send));
   } else {
     platform.dispatcher->BackgroundQueue().Async(std::move(send));
   }

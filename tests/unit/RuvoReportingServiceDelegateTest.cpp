@@ -347,7 +347,7 @@ TEST_F(ServiceDelegateTest, KillServiceEndsTheProcessWithStatusTwoAndNoReply) {
   EXPECT_EQ(log.Count("DESTROYING SERVICE"), 1u);
 }
 
-TEST_F(ServiceDelegateTest, EntryLinesAreDebugOnlyWhenTheScopeIsVerbose) {
+TEST_F(ServiceDelegateTest, EntryLinesAreDebugOnlyWhenVerboseAndLinesNameTheOperation) {
   log.SetVerbose(false);
   auto client = Connect(100);
   client->service().createReportingSession(7, client->Bool("create"));
@@ -357,6 +357,9 @@ TEST_F(ServiceDelegateTest, EntryLinesAreDebugOnlyWhenTheScopeIsVerbose) {
   client->service().createReportingSession(8, client->Bool("create"));
   Run();
   EXPECT_EQ(log.Count("creating session for reporter 8", LogLevel::kDebug), 1u);
+  // Lines written from the queued work name the operation, not the lambda that runs it.
+  EXPECT_EQ(log.Count(":createReportingSession: session created for reporter 8"), 1u);
+  EXPECT_EQ(log.Count("operator()"), 0u);
 }
 
 }  // namespace

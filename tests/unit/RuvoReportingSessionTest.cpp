@@ -160,6 +160,7 @@ TEST_F(SessionTest, NoBackendListRunsIntoTheTimeOutAndTheWaitKeepsTheSessionAliv
   EXPECT_EQ(CountMessage("No backends found, this session won't get sent to the server",
                          LogLevel::kError),
             1u);
+  EXPECT_EQ(log.Count(":start: No backends found"), 1u);
   EXPECT_EQ(CountMessage("waiting for telvorod to find backends"), 1u);
   EXPECT_NE(session->telvoroSession(), nullptr);
   std::weak_ptr<RuvoReportingSession> weak = session;
@@ -307,6 +308,7 @@ TEST_F(SessionTest, StopFlushesAfterEveryQueuedMessageAndDropsTheLists) {
   EXPECT_EQ(summary.payload, (Dictionary{{"Ruvo_Session_Summary_Event", "3"}, {"seq", "0,1,2"}}));
   EXPECT_EQ(session->telvoroSession(), nullptr);
   EXPECT_EQ(CountMessage("flush error disk full", LogLevel::kError), 1u);
+  EXPECT_EQ(log.Count(":stop: flush error disk full"), 1u);
 }
 
 TEST_F(SessionTest, StartingTwiceChangesNothingButARestartGetsANewBackEndAndFreshLists) {

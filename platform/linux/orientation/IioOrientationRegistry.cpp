@@ -154,6 +154,7 @@ void IioOrientationRegistry::WaitForWake(std::chrono::milliseconds timeout) {
 }
 
 bool IioOrientationRegistry::Connect() {
+  TLOG_OPERATION("Connect");
   try {
     connection_ = sdbus::createSystemBusConnection();
     connection_->setMethodCallTimeout(options_.callTimeout);
@@ -264,6 +265,7 @@ void IioOrientationRegistry::OwnerAppeared(const std::string& owner) {
 }
 
 void IioOrientationRegistry::Claim(const std::string& owner) {
+  TLOG_OPERATION("Claim");
   sensorProxy_->callMethodAsync("ClaimAccelerometer")
       .onInterface(kInterface)
       .withTimeout(options_.callTimeout)
@@ -286,6 +288,7 @@ void IioOrientationRegistry::Claim(const std::string& owner) {
 }
 
 void IioOrientationRegistry::ReadOrientation() {
+  TLOG_OPERATION("ReadOrientation");
   sensorProxy_->callMethodAsync("Get")
       .onInterface(kPropertiesInterface)
       .withTimeout(options_.callTimeout)
