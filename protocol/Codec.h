@@ -57,8 +57,14 @@ struct RequestLimits {
   static constexpr uint64_t kDefaultReporterIDsPerMessage = 1'024;
   static constexpr uint64_t kMinReporterIDsPerMessage = 16;
 
+  // Sessions one connection keeps: each holds its aggregation, queue and timers in the service.
+  // A client has a few; the bound stops one connection from creating them without end.
+  static constexpr uint64_t kDefaultSessionsPerConnection = 1'024;
+  static constexpr uint64_t kMinSessionsPerConnection = 16;
+
   uint64_t entriesPerFrame = kDefaultEntriesPerFrame;
   uint64_t reporterIDsPerMessage = kDefaultReporterIDsPerMessage;
+  uint64_t sessionsPerConnection = kDefaultSessionsPerConnection;
 };
 
 // Refusals of a peer that may not make the request; code 1: not allowed to stop the service.

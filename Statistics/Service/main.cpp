@@ -93,6 +93,7 @@ struct ListenerSettings {
 };
 
 ListenerSettings ReadListenerSettings(const tavrin::Dictionary& defaults) {
+  TLOG_OPERATION("ReadListenerSettings");
   using tavrin::protocol::RequestLimits;
   ListenerSettings settings;
   auto table = defaults.find("limits");
@@ -115,6 +116,8 @@ ListenerSettings ReadListenerSettings(const tavrin::Dictionary& defaults) {
             settings.limits.entriesPerFrame);
   readCount("reporter_ids_per_message", RequestLimits::kMinReporterIDsPerMessage,
             settings.limits.reporterIDsPerMessage);
+  readCount("sessions_per_connection", RequestLimits::kMinSessionsPerConnection,
+            settings.limits.sessionsPerConnection);
   readCount("frame_bytes", 64 * 1024, settings.frameBytes);
   settings.frameBytes = std::min<uint64_t>(settings.frameBytes, UINT32_MAX);
   readCount("connections_per_uid", 8, settings.connectionsPerUid);
@@ -147,6 +150,7 @@ void ApplyListenerSettings(tavrin::UnixServiceListener& listener,
 }  // namespace
 
 int main(int argc, char** argv) {
+  TLOG_OPERATION("main");
   CLI::App app{"tavrind: the reporting service of the audio stack"};
   Options options;
   app.add_option("--root", options.root, "put every path under DIR (the embedded default)")

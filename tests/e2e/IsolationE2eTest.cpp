@@ -174,6 +174,20 @@ TEST(IsolationLimitsE2eTest, WideFramesAndLongReporterListsAreRefusedWithoutStal
   EXPECT_LT(std::chrono::steady_clock::now() - started, 1 * kSlowBuild);
   EXPECT_LT(worstRoundTrip, std::chrono::milliseconds(50) * kSlowBuild.count());
   EXPECT_EQ(service.LogCount("refused request from pid"), 2u) << service.Log();
+
+  // Large frames are decoded aside from the I/O thread; a connection's requests keep their order.
+  Dictionary large;
+  for (int key = 0; key < 2000; ++key) large["k" + std::to_string(key)] = std::string(40, 'v');
+  for (uint64_t next = 3; next < 9; next += 2) {
+    attacker.Send(next, protocol::SendMessage{large, 1, 0, std::nullopt});
+    attacker.Send(next + 1, protocol::GetAllReporters{});
+  }
+  for (uint64_t expected = 3; expected < 9; ++expected) {
+    auto reply = attacker.Read();
+    ASSERT_TRUE(reply) << service.Log();
+    EXPECT_EQ(reply->call, expected);
+    EXPECT_EQ(reply->status, protocol::Status::kOk);
+  }
 }
 
 // The frame limit is a setting: a frame over it ends the connection, one under it is answered.
@@ -190,6 +204,45 @@ TEST(IsolationLimitsE2eTest, FrameLimitComesFromTheSettings) {
   EXPECT_TRUE(sendOfSize(69'000));
   EXPECT_FALSE(sendOfSize(71'000));
   EXPECT_TRUE(service.WaitForLog("outside 1..70000")) << service.Log();
+}
+
+// A connection keeps a bounded number of sessions: one more is refused with code 1 and creates
+// nothing; re-creating an ID it has is no new session, destroying one frees a place, and another
+// connection has places of its own.
+TEST(IsolationLimitsE2eTest, SessionsPerConnectionAreBounded) {
+  TavrindProcess service;
+  testing::WriteFileAtomically(service.DefaultsPath(), "[limits]\nsessions_per_connection = 3\n");
+  ASSERT_TRUE(service.Start()) << service.Log();
+  TestClient client(service.SocketPath());
+  TestClient other(service.SocketPath());
+  uint64_t call = 0;
+  auto create = [&](TestClient& on, int64_t id) {
+    on.Send(++call, protocol::CreateReportingSession{id});
+    auto reply = on.Read();
+    if (!reply) return std::string("no reply");
+    if (reply->status == protocol::Status::kOk) return std::string("created");
+    return reply->value.value("domain", "") + " " + std::to_string(reply->value.value("code", 0));
+  };
+  const std::string refused = std::string(protocol::kLimitsErrorDomain) + " 1";
+  // 3 is below the floor of 16.
+  for (int64_t id = 1; id <= 16; ++id) EXPECT_EQ(create(client, id), "created") << id;
+  EXPECT_EQ(create(client, 5), "created");
+  EXPECT_EQ(create(client, 17), refused);
+  EXPECT_EQ(create(other, 17), "created");
+  client.Send(++call, protocol::DestroyReportingSession{0});  // ID 0 is never a session of its own
+  client.Send(++call, protocol::DestroyReportingSession{3});
+  ASSERT_TRUE(client.Read() && client.Read());
+  EXPECT_EQ(create(client, 18), "created");
+  EXPECT_EQ(create(client, 19), refused);
+
+  client.Send(++call, protocol::GetAllReporters{});
+  auto reporters = client.Read();
+  ASSERT_TRUE(reporters);
+  const auto ids = protocol::ReportersReplyValue(reporters->value);
+  ASSERT_TRUE(ids);
+  EXPECT_EQ(std::count(ids->begin(), ids->end(), 19), 0) << "a refused request had an effect";
+  EXPECT_EQ(ids->size(), 17u);  // 15 of this connection's, 18, and the other's 17
+  EXPECT_TRUE(service.WaitForLog("(2 from this client)")) << service.Log();
 }
 
 // Peak resident memory of a process, from /proc.

@@ -14,6 +14,7 @@
 #include <deque>
 #include <filesystem>
 #include <system_error>
+#include <unordered_set>
 
 #include "platform/LogSystem.h"
 #include "protocol/Codec.h"
@@ -166,9 +167,27 @@ class UnixClientConnection final : public ClientConnection,
       }
       const auto body = reader_.Body();
       RecentTraffic(static_cast<double>(body.size() + protocol::kFrameHeaderSize));
-      if (!HandleFrame(body)) return;
+      if (body.size() > UnixServiceListener::kInlineDecodeBytes) {
+        DecodeAside(std::vector<uint8_t>(body.begin(), body.end()));
+        return;
+      }
+      if (!HandleRequest(protocol::DecodeRequest(body, listener_.RequestLimits()))) return;
     }
     Read();
+  }
+
+  // Decodes a large frame on the listener's decode thread, so that other connections' requests
+  // and replies do not wait for it; this connection reads nothing more until it is handled, which
+  // keeps its requests in order.
+  void DecodeAside(std::vector<uint8_t> body) {
+    asio::post(listener_.decodePool_, [self = shared_from_this(), body = std::move(body),
+                                       limits = listener_.RequestLimits()]() mutable {
+      auto decoded = protocol::DecodeRequest(body, limits);
+      asio::post(self->socket_.get_executor(), [self, decoded = std::move(decoded)]() mutable {
+        if (self->ended_) return;
+        if (self->HandleRequest(std::move(decoded))) self->HandleFrames();
+      });
+    });
   }
 
   // This connection's recent bytes, decayed to now, after adding `bytes`; the listener's total
@@ -182,14 +201,10 @@ class UnixClientConnection final : public ClientConnection,
   }
 
   // False when the frame ended the connection.
-  bool HandleFrame(std::span<const uint8_t> body) {
-    auto decoded = protocol::DecodeRequest(body, listener_.RequestLimits());
+  bool HandleRequest(std::variant<protocol::Request, protocol::RequestError> decoded) {
     if (auto* error = std::get_if<protocol::RequestError>(&decoded)) {
       if (error->kind == protocol::RequestError::Kind::kOverLimit) {
-        listener_.limitRefusals_.fetch_add(1, std::memory_order_relaxed);
-        TLOG_ERROR(nullptr, "refused request from pid {} uid {}: limit {}: {}", pid_, uid_,
-                   static_cast<int64_t>(error->limit), error->reason);
-        if (auto reply = protocol::EncodeRejectReply(*error)) Send(std::move(*reply));
+        RefuseOverLimit(*error);
         return true;
       }
       if (error->kind == protocol::RequestError::Kind::kCloseConnection) {
@@ -215,6 +230,7 @@ class UnixClientConnection final : public ClientConnection,
       }
       return true;
     }
+    if (!TrackSessions(request, listener_.RequestLimits().sessionsPerConnection)) return true;
     std::shared_ptr<RuvoReportingServiceProtocol> object = object_;
     if (!object) return true;
     std::weak_ptr<UnixClientConnection> weakSelf = weak_from_this();
@@ -222,6 +238,37 @@ class UnixClientConnection final : public ClientConnection,
       if (auto self = weakSelf.lock()) self->Send(std::move(reply));
     });
     return !ended_;
+  }
+
+  // Answers a request over a limit; the request has no other effect.
+  void RefuseOverLimit(const protocol::RequestError& error) {
+    listener_.limitRefusals_.fetch_add(1, std::memory_order_relaxed);
+    ++limitRefusals_;
+    TLOG_ERROR(nullptr, "refused request from pid {} uid {}: limit {}: {} ({} from this client)",
+               pid_, uid_, static_cast<int64_t>(error.limit), error.reason, limitRefusals_);
+    if (auto reply = protocol::EncodeRejectReply(error)) Send(std::move(*reply));
+  }
+
+  // Keeps the reporter IDs this connection's sessions live under, as the service's session map
+  // for the client does: creating adds or replaces, destroying removes (ID 0 is never removed).
+  // False when a new session would be over the limit; it has been refused then.
+  bool TrackSessions(const protocol::Request& request, uint64_t limit) {
+    if (const auto* create = std::get_if<protocol::CreateReportingSession>(&request.arguments)) {
+      if (!sessionIDs_.contains(create->reporterID) && sessionIDs_.size() >= limit) {
+        RefuseOverLimit({protocol::RequestError::Kind::kOverLimit, request.call,
+                         protocol::RejectCode::kUnknownOp,
+                         fmt::format("this connection already has {} sessions, the most it may "
+                                     "keep (limits.sessions_per_connection); destroy one first",
+                                     sessionIDs_.size()),
+                         protocol::LimitCode::kSessionsPerConnection});
+        return false;
+      }
+      sessionIDs_.insert(create->reporterID);
+    } else if (const auto* destroy =
+                   std::get_if<protocol::DestroyReportingSession>(&request.arguments)) {
+      if (destroy->reporterID != 0) sessionIDs_.erase(destroy->reporterID);
+    }
+    return true;
   }
 
   void QueueWrite(std::vector<uint8_t> frame) {
@@ -305,6 +352,8 @@ class UnixClientConnection final : public ClientConnection,
   std::function<void()> invalidation_;
   bool resumed_ = false;
   bool ended_ = false;
+  std::unordered_set<int64_t> sessionIDs_;  // I/O thread
+  uint64_t limitRefusals_ = 0;              // I/O thread
   // Write side, I/O thread only.
   std::deque<std::vector<uint8_t>> writes_;
   size_t pendingBytes_ = 0;
@@ -312,7 +361,9 @@ class UnixClientConnection final : public ClientConnection,
 };
 
 UnixServiceListener::UnixServiceListener(UnixListenerOptions options)
-    : options_(std::move(options)), acceptor_(io_) {}
+    : options_(std::move(options)), acceptor_(io_) {
+  asio::post(decodePool_, [] { pthread_setname_np(pthread_self(), "tavrin-decode"); });
+}
 
 UnixServiceListener::~UnixServiceListener() {
   Stop();
@@ -421,11 +472,13 @@ void UnixServiceListener::SetKillUids(std::vector<uint32_t> uids) {
 void UnixServiceListener::SetRequestLimits(const protocol::RequestLimits& limits) {
   entriesPerFrame_.store(limits.entriesPerFrame, std::memory_order_relaxed);
   reporterIDsPerMessage_.store(limits.reporterIDsPerMessage, std::memory_order_relaxed);
+  sessionsPerConnection_.store(limits.sessionsPerConnection, std::memory_order_relaxed);
 }
 
 protocol::RequestLimits UnixServiceListener::RequestLimits() const {
   return protocol::RequestLimits{entriesPerFrame_.load(std::memory_order_relaxed),
-                                 reporterIDsPerMessage_.load(std::memory_order_relaxed)};
+                                 reporterIDsPerMessage_.load(std::memory_order_relaxed),
+                                 sessionsPerConnection_.load(std::memory_order_relaxed)};
 }
 
 bool UnixServiceListener::MayKill(uint32_t uid) const {
