@@ -1,8 +1,5 @@
 #include "Statistics/Service/RuvoReportingBlockThrottle.h"
 
-#include <asio/error.hpp>
-#include <asio/post.hpp>
-
 #include <algorithm>
 #include <array>
 #include <cmath>
@@ -40,9 +37,6 @@ constexpr int64_t kLargestAcceptedWholeSeconds = 4;
 // Caps a fire date far beyond any accepted throttle time, so the deadline arithmetic stays valid.
 constexpr double kMaxSleepSeconds = 24.0 * 3600;
 
-// Keys added during one round of the throttle thread rarely exceed a handful.
-constexpr size_t kUnscheduledKeysInitialCapacity = 6;
-
 // A throttle time as the timer reads it: single precision, widened back.
 double AsSinglePrecision(double seconds) {
   // Out-of-range finite values cannot be converted to float; any negative fires at once anyway.
@@ -70,13 +64,14 @@ void RuvoReportingBlockThrottleTimerWrapper::setBlock(Block block) {
   // `previous` (and whatever it captured) is released here, outside the lock.
 }
 
-void RuvoReportingBlockThrottleTimerWrapper::sleepFor(double seconds) {
+Duration RuvoReportingBlockThrottleTimerWrapper::sleepFor(double seconds) {
   Duration delay = Duration::zero();
   if (seconds > 0) {
     delay = std::chrono::duration_cast<Duration>(
         std::chrono::duration<double>(std::min(seconds, kMaxSleepSeconds)));
   }
-  fireDate_.store((std::chrono::steady_clock::now() + delay).time_since_epoch().count());
+  fireDate_.store((clock_.Now() + delay).time_since_epoch().count());
+  return delay;
 }
 
 SteadyTime RuvoReportingBlockThrottleTimerWrapper::fireDate() const {
@@ -86,27 +81,23 @@ SteadyTime RuvoReportingBlockThrottleTimerWrapper::fireDate() const {
 // ---------------------------------------------------------------------------------------------
 // RuvoReportingBlockThrottle
 
-RuvoReportingBlockThrottle::RuvoReportingBlockThrottle() : RuvoReportingBlockThrottle(Timing{}) {}
+RuvoReportingBlockThrottle::RuvoReportingBlockThrottle(Dispatcher& dispatcher)
+    : RuvoReportingBlockThrottle(dispatcher, Timing{}) {}
 
-RuvoReportingBlockThrottle::RuvoReportingBlockThrottle(const Timing& timing) : timing_(timing) {
-  unscheduledTimerKeys_.reserve(kUnscheduledKeysInitialCapacity);
-  queueThread_ = std::thread([this] { threadLoop(); });
-}
+RuvoReportingBlockThrottle::RuvoReportingBlockThrottle(Dispatcher& dispatcher, Timing timing)
+    : dispatcher_(dispatcher),
+      timing_(timing),
+      queue_(dispatcher.CreateSerialQueue(kQueueLabel, QualityOfService::kUtility)) {}
 
 RuvoReportingBlockThrottle::~RuvoReportingBlockThrottle() {
-  shouldKeepRunning_ = false;
+  std::map<std::string, WrapperPtr> pending;
   {
-    // Taking the pause lock orders the flag before the thread's next look at it.
-    std::lock_guard lock(pauseMutex_);
+    std::lock_guard lock(state_->mutex);
+    state_->stopped = true;
+    pending.swap(state_->timersInFlight);
+    // A cancelled timer never runs its work, even when its expiry is already being processed.
+    for (auto& [key, wrapper] : pending) wrapper->timer_->Cancel();
   }
-  pauseWake_.notify_all();
-  io_.stop();
-  if (queueThread_.joinable()) queueThread_.join();
-
-  // The thread is gone, so its timers may be released here; no pending wait outlives them.
-  std::lock_guard lock(timersInFlightMutex_);
-  for (auto& [key, wrapper] : timersInFlight_) invalidate(*wrapper);
-  timersInFlight_.clear();
 }
 
 std::string RuvoReportingBlockThrottle::buildMessageKey(const Dictionary& message,
@@ -204,185 +195,78 @@ void RuvoReportingBlockThrottle::addMessageBlock(Block block, int64_t reporterID
   std::string key = buildMessageKey(message, reporterID, category, type);
   const double seconds = determineSleepTime(message);
 
-  // The look-up and the insert below are separate steps: two first messages of one key at the
-  // same moment may both create entries, and only the later one is kept and delivered.
-  if (WrapperPtr existing = findEntry(key)) {
+  std::lock_guard lock(state_->mutex);
+  if (state_->stopped) return;
+  const auto existing = state_->timersInFlight.find(key);
+  if (existing != state_->timersInFlight.end()) {
     TLOG_DEBUG(nullptr, "Dropping duplicate message for {}", key);
-    existing->sleepFor(seconds);
-    existing->setBlock(std::move(block));
-    // Only the throttle thread touches timers: it moves this one if it is already attached
-    // (a timer not attached yet picks the new date up when it is).
-    asio::post(io_, [this, weak = std::weak_ptr(existing), key = std::move(key)] {
-      WrapperPtr wrapper = weak.lock();
-      if (wrapper && wrapper->attached_) arm(wrapper, key);
-    });
+    RuvoReportingBlockThrottleTimerWrapper& wrapper = *existing->second;
+    // Re-arming means the earlier arming's work never runs, even if its expiry was already
+    // being processed: the replaced callback can never run early.
+    wrapper.setBlock(std::move(block));
+    wrapper.timer_->ScheduleAfter(wrapper.sleepFor(seconds));
     return;
   }
-
-  auto wrapper = std::make_shared<RuvoReportingBlockThrottleTimerWrapper>();
+  auto wrapper = std::make_shared<RuvoReportingBlockThrottleTimerWrapper>(dispatcher_.GetClock());
   wrapper->setBlock(std::move(block));
-  wrapper->sleepFor(seconds);
+  const Duration delay = wrapper->sleepFor(seconds);
+  wrapper->timer_ = dispatcher_.CreateTimer(
+      *queue_, [state = state_, key, weak = std::weak_ptr(wrapper)] { deliver(state, key, weak); });
+  wrapper->timer_->ScheduleAfter(delay);
+  state_->timersInFlight.emplace(std::move(key), std::move(wrapper));
+}
+
+void RuvoReportingBlockThrottle::deliver(
+    const std::shared_ptr<State>& state, const std::string& key,
+    const std::weak_ptr<RuvoReportingBlockThrottleTimerWrapper>& weak) {
+  TLOG_OPERATION("deliver");
+  WrapperPtr wrapper;
   {
-    std::lock_guard lock(timersInFlightMutex_);
-    timersInFlight_[key] = wrapper;
+    std::lock_guard lock(state->mutex);
+    const auto found = state->timersInFlight.find(key);
+    if (state->stopped || found == state->timersInFlight.end() || found->second != weak.lock()) {
+      return;
+    }
+    // The entry goes before the callback runs, so no stale entry swallows later messages of the
+    // key, also when the callback throws.
+    wrapper = std::move(found->second);
+    state->timersInFlight.erase(found);
+    if (state->timersInFlight.empty()) state->emptied.notify_all();
   }
-  {
-    std::lock_guard lock(unscheduledTimerKeysMutex_);
-    unscheduledTimerKeys_.push_back(std::move(key));
+  try {
+    if (Block block = wrapper->block()) block();
+  } catch (const std::exception& error) {
+    const uint64_t failures = ++state->failedDeliveries;
+    TLOG_ERROR(nullptr, "Throttled delivery raised an exception: {} ({} so far)", error.what(),
+               failures);
+  } catch (...) {
+    const uint64_t failures = ++state->failedDeliveries;
+    TLOG_ERROR(nullptr, "Throttled delivery raised an unknown exception ({} so far)", failures);
   }
+  // Releasing the wrapper here destroys the timer whose work this is: the dispatcher keeps
+  // a running timer's work alive by itself.
 }
 
 void RuvoReportingBlockThrottle::waitForCompletion() {
-  TLOG_INFO(nullptr, "waitForCompletion. timersInFlight={} unscheduledTimerKeys={}",
-            timersInFlightCount(), unscheduledTimerKeysCount());
-  if (timersInFlightCount() == 0) return;
+  const size_t inFlight = timersInFlightCount();
+  TLOG_INFO(nullptr, "waitForCompletion. timersInFlight={} unscheduledTimerKeys={}", inFlight, 0);
+  if (inFlight == 0) return;
 
+  const Duration bound = timing_.completionStep * timing_.completionSteps;
   const auto boundSeconds =
-      static_cast<unsigned>(std::chrono::duration_cast<std::chrono::seconds>(
-                                timing_.completionStep * timing_.completionSteps)
-                                .count());
+      static_cast<unsigned>(std::chrono::duration_cast<std::chrono::seconds>(bound).count());
   TLOG_DEBUG(nullptr, "Waiting up to {} seconds for blockThrottle queue to be empty.",
              boundSeconds);
-  for (unsigned step = 0; step < timing_.completionSteps; ++step) {
-    if (timersInFlightCount() == 0) break;
-    std::this_thread::sleep_for(timing_.completionStep);
-  }
-  const size_t left = timersInFlightCount();
-  if (left != 0) {
+  std::unique_lock lock(state_->mutex);
+  if (!state_->emptied.wait_for(lock, bound, [&] { return state_->timersInFlight.empty(); })) {
     TLOG_DEFAULT(nullptr, "Giving up on waiting for completion after {} seconds. timersInFlight={}",
-                 boundSeconds, left);
+                 boundSeconds, state_->timersInFlight.size());
   }
-}
-
-// ---------------------------------------------------------------------------------------------
-// The throttle thread
-
-void RuvoReportingBlockThrottle::threadLoop() {
-  while (shouldKeepRunning_) {
-    if (unscheduledTimerKeysCount() != 0) {
-      TLOG_DEBUG(nullptr, "calling workingRunLoop run from inside thread block");
-      attachUnscheduledTimers();
-      runUntilNoTimersLeft();
-    }
-    TLOG_DEBUG(nullptr, "sleeping in thread");
-    std::unique_lock lock(pauseMutex_);
-    pauseWake_.wait_for(lock, timing_.pollInterval, [this] { return !shouldKeepRunning_; });
-  }
-}
-
-void RuvoReportingBlockThrottle::attachUnscheduledTimers() {
-  std::vector<std::string> keys;
-  {
-    std::lock_guard lock(unscheduledTimerKeysMutex_);
-    keys.swap(unscheduledTimerKeys_);
-    unscheduledTimerKeys_.reserve(kUnscheduledKeysInitialCapacity);
-  }
-  // Looked up one by one afterwards, so the two locks are never held together.
-  for (const std::string& key : keys) {
-    WrapperPtr wrapper = findEntry(key);
-    // A key listed twice (two first messages at once) names one stored entry; attach it once.
-    if (!wrapper || wrapper->attached_ || wrapper->invalidated_) continue;
-    wrapper->attached_ = true;
-    wrapper->timer_.emplace(io_);
-    arm(wrapper, key);
-  }
-}
-
-void RuvoReportingBlockThrottle::runUntilNoTimersLeft() {
-  // A callback's exception escapes io_context::run() on this thread. Nothing else could observe
-  // it, and letting it end the thread would strand every pending key (and end the process), so
-  // it is logged and counted here and the round goes on; its entry was already removed.
-  while (shouldKeepRunning_) {
-    try {
-      io_.run();
-      break;
-    } catch (const std::exception& error) {
-      const uint64_t failures = ++failedDeliveries_;
-      TLOG_ERROR(nullptr, "Throttled delivery raised an exception: {} ({} so far)", error.what(),
-                 failures);
-    } catch (...) {
-      const uint64_t failures = ++failedDeliveries_;
-      TLOG_ERROR(nullptr, "Throttled delivery raised an unknown exception ({} so far)", failures);
-    }
-  }
-  io_.restart();
-}
-
-void RuvoReportingBlockThrottle::arm(const WrapperPtr& wrapper, const std::string& key) {
-  if (wrapper->invalidated_ || !wrapper->timer_) return;
-  const uint64_t generation = ++wrapper->generation_;
-  // Moving the expiry aborts a pending wait, but a completion already queued still runs: the
-  // generation tells onTimer which wait is current.
-  wrapper->timer_->expires_at(wrapper->fireDate());
-  wrapper->timer_->async_wait([this, wrapper, key, generation](const std::error_code& error) {
-    onTimer(wrapper, key, generation, error);
-  });
-}
-
-void RuvoReportingBlockThrottle::onTimer(const WrapperPtr& wrapper, const std::string& key,
-                                         uint64_t generation, const std::error_code& error) {
-  if (error == asio::error::operation_aborted) return;
-  if (generation != wrapper->generation_ || wrapper->invalidated_) return;
-  // The callback is read before the fire date: a duplicate moves the date before it replaces the
-  // callback, so a callback seen here is never run before its own throttle time.
-  Block block = wrapper->block();
-  // A duplicate pushed the fire date after this wait was armed.
-  if (wrapper->fireDate() > std::chrono::steady_clock::now()) {
-    arm(wrapper, key);
-    return;
-  }
-  // Replaced in the dictionary by a later first message of the same key: that one delivers.
-  if (findEntry(key) != wrapper) {
-    invalidate(*wrapper);
-    return;
-  }
-  deliver(std::move(block), key);
-}
-
-void RuvoReportingBlockThrottle::deliver(Block block, const std::string& key) {
-  // Removes the entry after the callback, also when the callback throws, so no stale entry
-  // swallows later messages of the key.
-  struct EntryRemover {
-    RuvoReportingBlockThrottle& throttle;
-    const std::string& key;
-    ~EntryRemover() { throttle.removeEntry(key); }
-  } remover{*this, key};
-  if (block) block();
-}
-
-void RuvoReportingBlockThrottle::removeEntry(const std::string& key) {
-  WrapperPtr entry;
-  {
-    std::lock_guard lock(timersInFlightMutex_);
-    const auto found = timersInFlight_.find(key);
-    if (found == timersInFlight_.end()) return;
-    entry = std::move(found->second);
-    timersInFlight_.erase(found);
-  }
-  invalidate(*entry);
-}
-
-void RuvoReportingBlockThrottle::invalidate(RuvoReportingBlockThrottleTimerWrapper& wrapper) {
-  wrapper.invalidated_ = true;
-  // Destroying the timer here keeps every timer's life on the thread that runs its io_context.
-  wrapper.timer_.reset();
-}
-
-RuvoReportingBlockThrottle::WrapperPtr RuvoReportingBlockThrottle::findEntry(
-    const std::string& key) const {
-  std::lock_guard lock(timersInFlightMutex_);
-  const auto found = timersInFlight_.find(key);
-  return found == timersInFlight_.end() ? nullptr : found->second;
 }
 
 size_t RuvoReportingBlockThrottle::timersInFlightCount() const {
-  std::lock_guard lock(timersInFlightMutex_);
-  return timersInFlight_.size();
-}
-
-size_t RuvoReportingBlockThrottle::unscheduledTimerKeysCount() const {
-  std::lock_guard lock(unscheduledTimerKeysMutex_);
-  return unscheduledTimerKeys_.size();
+  std::lock_guard lock(state_->mutex);
+  return state_->timersInFlight.size();
 }
 
 }  // namespace tavrin

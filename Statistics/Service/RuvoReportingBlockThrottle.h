@@ -1,8 +1,5 @@
 #pragma once
 
-#include <asio/io_context.hpp>
-#include <asio/steady_timer.hpp>
-
 #include <atomic>
 #include <chrono>
 #include <condition_variable>
@@ -11,75 +8,60 @@
 #include <map>
 #include <memory>
 #include <mutex>
-#include <optional>
 #include <string>
-#include <thread>
-#include <vector>
 
 #include "base/Dictionary.h"
 #include "platform/Clock.h"
+#include "platform/Dispatcher.h"
 
 namespace tavrin {
 
-class RuvoReportingBlockThrottle;
-
-// One pending delivery of the throttle: the newest callback for a key and when it is due.
-// `block` and the fire date may be read and written from any thread. The asio timer that carries
-// the fire date is created, armed and destroyed only on the throttle's thread.
+// One pending delivery of the throttle: the newest callback for a key, when it is due, and the
+// dispatcher timer that runs it then. `block` and the fire date may be read and written from any
+// thread; the timer is armed only under the throttle's lock.
 class RuvoReportingBlockThrottleTimerWrapper {
  public:
   using Block = std::function<void()>;
 
+  explicit RuvoReportingBlockThrottleTimerWrapper(Clock& clock) : clock_(clock) {}
+
   Block block() const;
   void setBlock(Block block);
 
-  // Moves the fire date to now plus `seconds` (negative or NaN: now).
-  void sleepFor(double seconds);
+  // Moves the fire date to now plus `seconds` (negative or NaN: now) and returns the delay.
+  Duration sleepFor(double seconds);
   SteadyTime fireDate() const;
 
  private:
   friend class RuvoReportingBlockThrottle;
 
+  Clock& clock_;
   mutable std::mutex blockMutex_;
   Block block_;  // guarded by blockMutex_
   std::atomic<SteadyTime::rep> fireDate_{0};
-
-  // Throttle thread only.
-  std::optional<asio::steady_timer> timer_;
-  uint64_t generation_ = 0;  // the wait whose completion may deliver; older ones are stale
-  bool attached_ = false;
-  bool invalidated_ = false;
+  std::unique_ptr<Timer> timer_;  // guarded by the throttle's lock
 };
 
-// Per-key trailing-edge debounce with its own thread: the first callback for a message key runs
-// one throttle time after it was added, and every duplicate added before that replaces the
-// callback and pushes the run to one throttle time after itself. Callbacks run on the throttle
-// thread, one at a time, in fire-date order. Messages configure it themselves with
-// "_throttle_seconds" and "_comparison_field_blacklist".
-//
-// Timers are asio steady timers on a private io_context that only the throttle thread runs.
-// A round of that thread attaches the timers of newly added keys and runs the io_context until
-// no timer is left, then pauses for the poll interval.
+// Per-key trailing-edge debounce: the first callback for a message key runs one throttle time
+// after it was added, and every duplicate added before that replaces the callback and pushes the
+// run to one throttle time after itself. Callbacks run one at a time on the throttle's own serial
+// queue, in fire-date order, on the dispatcher's timers and clock. Messages configure it
+// themselves with "_throttle_seconds" and "_comparison_field_blacklist".
 class RuvoReportingBlockThrottle {
  public:
   using Block = RuvoReportingBlockThrottleTimerWrapper::Block;
+  static constexpr const char* kQueueLabel = "com.quorvex.tavrin.blockthrottle";
 
   struct Timing {
-    // Pause between rounds of the throttle thread while no new key is waiting.
-    Duration pollInterval = std::chrono::milliseconds(100);
-    // waitForCompletion polls `completionSteps` times, `completionStep` apart.
+    // waitForCompletion waits `completionSteps` times `completionStep` at the most.
     Duration completionStep = std::chrono::milliseconds(500);
     unsigned completionSteps = 10;
   };
 
-  // Starts the throttle thread with the standard timing (0.1 s pause, 10 x 0.5 s wait).
-  RuvoReportingBlockThrottle();
-  // For tests: the same with shorter pauses.
-  explicit RuvoReportingBlockThrottle(const Timing& timing);
-
-  // The service keeps its throttle for the life of the process; this exists for tests and an
-  // orderly exit. It finishes the callback that is running, if any, and stops the thread;
-  // pending callbacks never run. Never call it from a callback.
+  explicit RuvoReportingBlockThrottle(Dispatcher& dispatcher);
+  RuvoReportingBlockThrottle(Dispatcher& dispatcher, Timing timing);
+  // Pending callbacks never run once the throttle is gone; one that is running finishes. Never
+  // call it from a callback.
   ~RuvoReportingBlockThrottle();
 
   RuvoReportingBlockThrottle(const RuvoReportingBlockThrottle&) = delete;
@@ -91,7 +73,7 @@ class RuvoReportingBlockThrottle {
                        uint32_t category, uint16_t type);
 
   // Blocks until nothing is pending or the completion bound (5 s by default) has passed. Never
-  // call it from a callback: the deliveries it waits for run on that same thread.
+  // call it from a callback: the deliveries it waits for run on the throttle's queue.
   void waitForCompletion();
 
   // The key under which duplicates of `message` collapse: the message's fields sorted by name
@@ -107,37 +89,24 @@ class RuvoReportingBlockThrottle {
  private:
   using WrapperPtr = std::shared_ptr<RuvoReportingBlockThrottleTimerWrapper>;
 
-  void threadLoop();
-  void attachUnscheduledTimers();
-  void runUntilNoTimersLeft();
-  void arm(const WrapperPtr& wrapper, const std::string& key);
-  void onTimer(const WrapperPtr& wrapper, const std::string& key, uint64_t generation,
-               const std::error_code& error);
-  void deliver(Block block, const std::string& key);
-  void removeEntry(const std::string& key);
-  static void invalidate(RuvoReportingBlockThrottleTimerWrapper& wrapper);
-  WrapperPtr findEntry(const std::string& key) const;
+  // What the timers' work reaches: shared so that a delivery already running when the throttle
+  // goes keeps it alive until it ends.
+  struct State {
+    std::mutex mutex;
+    std::condition_variable emptied;
+    std::map<std::string, WrapperPtr> timersInFlight;  // guarded by mutex
+    bool stopped = false;                              // guarded by mutex
+    std::atomic<uint64_t> failedDeliveries{0};
+  };
+
+  static void deliver(const std::shared_ptr<State>& state, const std::string& key,
+                      const std::weak_ptr<RuvoReportingBlockThrottleTimerWrapper>& wrapper);
   size_t timersInFlightCount() const;
-  size_t unscheduledTimerKeysCount() const;
 
+  Dispatcher& dispatcher_;
   const Timing timing_;
-  std::atomic<bool> shouldKeepRunning_{true};
-
-  // Declared before the entries so that timers are destroyed before their io_context.
-  asio::io_context io_;
-
-  mutable std::recursive_mutex timersInFlightMutex_;
-  std::map<std::string, WrapperPtr> timersInFlight_;  // guarded by timersInFlightMutex_
-
-  mutable std::recursive_mutex unscheduledTimerKeysMutex_;
-  std::vector<std::string> unscheduledTimerKeys_;  // guarded by unscheduledTimerKeysMutex_
-
-  // Wakes the pause between rounds when the throttle is destroyed.
-  std::mutex pauseMutex_;
-  std::condition_variable pauseWake_;
-
-  std::atomic<uint64_t> failedDeliveries_{0};
-  std::thread queueThread_;  // last: starts after everything it uses exists
+  SerialQueuePtr queue_;
+  std::shared_ptr<State> state_ = std::make_shared<State>();
 };
 
 }  // namespace tavrin
