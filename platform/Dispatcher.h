@@ -56,6 +56,14 @@ class Dispatcher {
   virtual WorkQueue& BackgroundQueue() = 0;
   // A timer that runs `work` on `queue` each time it fires; the queue must outlive the timer.
   virtual std::unique_ptr<Timer> CreateTimer(WorkQueue& queue, Work work) = 0;
+  // Runs `work` on `queue` once `delay` has passed, or earlier when RunDeferredNow() is called:
+  // for work that may be held back but must not be lost when the process stops.
+  virtual void AsyncDeferred(WorkQueue& queue, Duration delay, Work work) = 0;
+  // Hands every item still held back by AsyncDeferred to its queue now; returns how many. Each
+  // item runs once, whichever comes first.
+  virtual size_t RunDeferredNow() = 0;
+  // Items of AsyncDeferred not yet handed to their queue.
+  virtual size_t DeferredCount() const = 0;
   // The clock behind every delay of this dispatcher.
   virtual Clock& GetClock() = 0;
 };

@@ -272,7 +272,8 @@ int main(int argc, char** argv) {
   // Clients that send faster than the store commits are slowed down through their sockets rather
   // than have their records dropped.
   listener.SetReadGate([&] {
-    const uint64_t queued = dispatcher.QueuedItems();
+    // Single messages held back on a timer are owed to their clients as much as queued work.
+    const uint64_t queued = dispatcher.QueuedItems() + dispatcher.DeferredCount();
     const double backlog = reporting.BacklogShare();
     // Far behind, everyone waits; behind, only those who send more than their share, so that
     // a client making round trips keeps getting answers while another floods.
@@ -295,6 +296,9 @@ int main(int argc, char** argv) {
   // Orderly stop: client clean-ups and queued deliveries run, including messages held behind a
   // session that still waits for its back-ends, then the store commits everything it accepted.
   notifications.Cancel(refreshToken);
+  if (const size_t deferred = dispatcher.RunDeferredNow()) {
+    TLOG_DEFAULT(nullptr, "sending {} held-back single message(s) now", deferred);
+  }
   if (!dispatcher.WaitUntilDrained(kShutdownDrainLimit)) {
     TLOG_ERROR(nullptr, "stopping with {} work items still queued after {} s",
                dispatcher.QueuedItems(), kShutdownDrainLimit.count());

@@ -7,6 +7,7 @@
 #include <csignal>
 #include <filesystem>
 
+#include "tests/support/StoreFiles.h"
 #include "tests/support/TavrindProcess.h"
 
 namespace tavrin {
@@ -23,6 +24,27 @@ TEST(ServiceLifecycleE2eTest, KillServiceEndsTheProcessWithStatusTwoAndNoReply) 
   EXPECT_FALSE(client.Read(std::chrono::milliseconds(2000)).has_value());
   EXPECT_EQ(service.WaitForExit(), 2);
   EXPECT_EQ(service.LogCount("DESTROYING SERVICE"), 1u);
+}
+
+// Single messages of the "alarms" service type wait up to 59 s on a timer; a SIGTERM sends the
+// ones still waiting instead of dropping them.
+TEST(ServiceLifecycleE2eTest, SigtermSendsTheAlarmsMessagesStillHeldBack) {
+  TavrindProcess service;
+  ASSERT_TRUE(service.Start()) << service.Log();
+  TestClient client(service.SocketPath());
+  client.Send(1, protocol::CreateReportingSession{21});
+  client.Send(2, protocol::SetServiceType{4, 21});  // alarms; never started: single messages
+  constexpr int kMessages = 20;  // each waits a random 0..59 s: all of them at once is unlikely
+  for (int i = 0; i < kMessages; ++i) {
+    client.Send(3 + i,
+                protocol::SendMessage{Dictionary{{"alarm", i}}, 1, 0, std::vector<int64_t>{21}});
+  }
+  for (int i = 0; i < 2 + kMessages; ++i) ASSERT_TRUE(client.Read()) << service.Log();
+  EXPECT_EQ(service.Stop(), 0) << service.Log();
+  EXPECT_EQ(testing::QueryStore(service.DatabasePath(), "SELECT count(*) FROM single_messages"),
+            (std::vector<std::vector<std::string>>{{std::to_string(kMessages)}}))
+      << service.Log();
+  EXPECT_EQ(service.LogCount("held-back single message(s) now"), 1u) << service.Log();
 }
 
 TEST(ServiceLifecycleE2eTest, SocketActivationServesThePassedSocketAndLeavesItsOwnPathAlone) {

@@ -36,6 +36,8 @@ struct FakeDispatcher::State {
   // Hands a due item to its queue; called without the lock.
   std::map<FireKey, std::function<void()>> delayed;
   std::vector<Duration> timerDelays;
+  // AsyncDeferred items not handed over yet, in the order given.
+  std::map<uint64_t, std::pair<WorkQueue*, Work>> deferred;
   bool running = false;  // inside RunUntilIdle
   const FakeQueue* current = nullptr;
   std::thread::id currentThread;
@@ -237,6 +239,44 @@ WorkQueue& FakeDispatcher::BackgroundQueue() { return background_; }
 
 std::unique_ptr<Timer> FakeDispatcher::CreateTimer(WorkQueue& queue, Work work) {
   return std::make_unique<FakeTimer>(state_, queue, std::move(work));
+}
+
+void FakeDispatcher::AsyncDeferred(WorkQueue& queue, Duration delay, Work work) {
+  if (!work) return;
+  uint64_t id = 0;
+  {
+    std::lock_guard lock(state_->mutex);
+    id = state_->nextSequence++;
+    state_->deferred.emplace(id, std::pair{&queue, std::move(work)});
+  }
+  queue.AsyncAfter(delay, [state = std::weak_ptr(state_), id] {
+    auto alive = state.lock();
+    if (!alive) return;
+    Work due;
+    {
+      std::lock_guard lock(alive->mutex);
+      auto found = alive->deferred.find(id);
+      if (found == alive->deferred.end()) return;
+      due = std::move(found->second.second);
+      alive->deferred.erase(found);
+    }
+    due();
+  });
+}
+
+size_t FakeDispatcher::RunDeferredNow() {
+  std::map<uint64_t, std::pair<WorkQueue*, Work>> due;
+  {
+    std::lock_guard lock(state_->mutex);
+    due.swap(state_->deferred);
+  }
+  for (auto& [id, item] : due) item.first->Async(std::move(item.second));
+  return due.size();
+}
+
+size_t FakeDispatcher::DeferredCount() const {
+  std::lock_guard lock(state_->mutex);
+  return state_->deferred.size();
 }
 
 size_t FakeDispatcher::RunUntilIdle() {

@@ -40,6 +40,11 @@ class FakeDispatcher final : public Dispatcher {
   WorkQueue& BackgroundQueue() override;
   // `queue` may be any WorkQueue; the timer's work is handed to its Async when the timer fires.
   std::unique_ptr<Timer> CreateTimer(WorkQueue& queue, Work work) override;
+  // Held back as AsyncAfter items are; RunDeferredNow() hands them to their queues (run them with
+  // RunUntilIdle), and their later expiry does nothing.
+  void AsyncDeferred(WorkQueue& queue, Duration delay, Work work) override;
+  size_t RunDeferredNow() override;
+  size_t DeferredCount() const override;
   Clock& GetClock() override { return clock_; }
   FakeClock& Time() { return clock_; }
 

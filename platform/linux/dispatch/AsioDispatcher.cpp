@@ -481,6 +481,43 @@ Clock& AsioDispatcher::GetClock() { return SystemClock(); }
 
 void AsioDispatcher::Shutdown() { core_->Shutdown(); }
 
+void AsioDispatcher::AsyncDeferred(WorkQueue& queue, Duration delay, Work work) {
+  if (!work) return;
+  uint64_t id = 0;
+  {
+    std::lock_guard lock(deferredMutex_);
+    id = nextDeferredId_++;
+    deferred_.emplace(id, std::pair{&queue, std::move(work)});
+  }
+  // The dispatcher outlives its delayed items: Shutdown() in the destructor cancels them first.
+  queue.AsyncAfter(delay, [this, id] {
+    Work due;
+    {
+      std::lock_guard lock(deferredMutex_);
+      auto found = deferred_.find(id);
+      if (found == deferred_.end()) return;  // handed over early
+      due = std::move(found->second.second);
+      deferred_.erase(found);
+    }
+    due();
+  });
+}
+
+size_t AsioDispatcher::RunDeferredNow() {
+  std::unordered_map<uint64_t, std::pair<WorkQueue*, Work>> due;
+  {
+    std::lock_guard lock(deferredMutex_);
+    due.swap(deferred_);
+  }
+  for (auto& [id, item] : due) item.first->Async(std::move(item.second));
+  return due.size();
+}
+
+size_t AsioDispatcher::DeferredCount() const {
+  std::lock_guard lock(deferredMutex_);
+  return deferred_.size();
+}
+
 bool AsioDispatcher::WaitUntilDrained(Duration limit) { return core_->WaitUntilDrained(limit); }
 
 uint64_t AsioDispatcher::QueuedItems() const { return core_->Queued(); }

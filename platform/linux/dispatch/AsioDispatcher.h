@@ -3,7 +3,10 @@
 #include <cstddef>
 #include <cstdint>
 #include <memory>
+#include <mutex>
 #include <string>
+#include <unordered_map>
+#include <utility>
 
 #include "platform/Dispatcher.h"
 
@@ -46,6 +49,9 @@ class AsioDispatcher final : public Dispatcher {
   WorkQueue& BackgroundQueue() override;
   // `queue` may be any WorkQueue (it must outlive the timer); the work is handed to its Async.
   std::unique_ptr<Timer> CreateTimer(WorkQueue& queue, Work work) override;
+  void AsyncDeferred(WorkQueue& queue, Duration delay, Work work) override;
+  size_t RunDeferredNow() override;
+  size_t DeferredCount() const override;
   Clock& GetClock() override;
 
   // Idempotent and thread-safe; must not be called from a pool thread (it joins them).
@@ -67,6 +73,11 @@ class AsioDispatcher final : public Dispatcher {
 
  private:
   std::shared_ptr<Core> core_;
+  // Work of AsyncDeferred not yet handed over, by id: the timer and RunDeferredNow() each take
+  // an item out under the lock, so it runs once.
+  mutable std::mutex deferredMutex_;
+  std::unordered_map<uint64_t, std::pair<WorkQueue*, Work>> deferred_;  // guarded by deferredMutex_
+  uint64_t nextDeferredId_ = 0;                                         // guarded by deferredMutex_
 };
 
 }  // namespace tavrin
