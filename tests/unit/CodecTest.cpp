@@ -160,30 +160,22 @@ std::vector<IntegerCase> IntegerCases() {
       {IntFormat::kPositiveFixint, 127, true, true, true},
       {IntFormat::kNegativeFixint, neg(-1), true, false, false},
       {IntFormat::kNegativeFixint, neg(-32), true, false, false},
-      {IntFormat::kUint8, 0, true, true, true},
       {IntFormat::kUint8, 255, true, true, true},
-      {IntFormat::kUint16, 0, true, true, true},
       {IntFormat::kUint16, 65535, true, true, true},
       {IntFormat::kUint32, 65536, true, false, true},
       {IntFormat::kUint32, 4294967295, true, false, true},
-      {IntFormat::kUint64, 0, true, true, true},
       {IntFormat::kUint64, 65535, true, true, true},
       {IntFormat::kUint64, 4294967296, true, false, false},
       {IntFormat::kUint64, static_cast<uint64_t>(kInt64Max), true, false, false},
       {IntFormat::kUint64, static_cast<uint64_t>(kInt64Max) + 1, false, false, false},
       {IntFormat::kUint64, kUint64Max, false, false, false},
       {IntFormat::kInt8, neg(-128), true, false, false},
-      {IntFormat::kInt8, 0, true, true, true},
-      {IntFormat::kInt8, 127, true, true, true},
       {IntFormat::kInt16, neg(-32768), true, false, false},
-      {IntFormat::kInt16, 32767, true, true, true},
       {IntFormat::kInt32, neg(std::numeric_limits<int32_t>::min()), true, false, false},
       {IntFormat::kInt32, 65535, true, true, true},
       {IntFormat::kInt32, 65536, true, false, true},
       {IntFormat::kInt32, 2147483647, true, false, true},
       {IntFormat::kInt64, neg(kInt64Min), true, false, false},
-      {IntFormat::kInt64, neg(-1), true, false, false},
-      {IntFormat::kInt64, 0, true, true, true},
       {IntFormat::kInt64, 4294967295, true, false, true},
       {IntFormat::kInt64, 4294967296, true, false, false},
       {IntFormat::kInt64, static_cast<uint64_t>(kInt64Max), true, false, false},
@@ -274,55 +266,37 @@ std::vector<RejectCase> RejectCases() {
       // 1: op not an integer from 1 to 11
       {"op 0", RequestBytes(0, Pack().uint(0), {}), RejectCode::kUnknownOp},
       {"op 12", RequestBytes(0, Pack().uint(12), {}), RejectCode::kUnknownOp},
-      {"op 256", RequestBytes(1, Pack().uint(256), Pack().uint(1)), RejectCode::kUnknownOp},
       {"op 2^64-1", RequestBytes(0, Pack().uint(kUint64Max), {}), RejectCode::kUnknownOp},
       {"op -1", RequestBytes(0, Pack().integer(IntFormat::kNegativeFixint, -1), {}),
        RejectCode::kUnknownOp},
-      {"op 1.0", RequestBytes(1, Pack().float64(1.0), Pack().uint(1)), RejectCode::kUnknownOp},
       {"op \"1\"", RequestBytes(1, Pack().str("1"), Pack().uint(1)), RejectCode::kUnknownOp},
       {"op nil", RequestBytes(0, Pack().nil(), {}), RejectCode::kUnknownOp},
-      {"op true", RequestBytes(1, Pack().boolean(true), Pack().uint(1)), RejectCode::kUnknownOp},
-      {"op map", RequestBytes(0, Pack().map(0), {}), RejectCode::kUnknownOp},
       // 2: argument count
       {"create without ID", RequestBytes(0, Pack().uint(1), {}), RejectCode::kWrongArgumentCount},
       {"create with 2", RequestBytes(2, Pack().uint(1), Pack().uint(1).uint(2)),
-       RejectCode::kWrongArgumentCount},
-      {"setServiceType with 1", RequestBytes(1, Pack().uint(2), Pack().uint(1)),
        RejectCode::kWrongArgumentCount},
       {"sendMessage with 3", RequestBytes(3, Pack().uint(6), Pack().map(0).uint(1).uint(1)),
        RejectCode::kWrongArgumentCount},
       {"sendMessage with 5",
        RequestBytes(5, Pack().uint(6), Pack().map(0).uint(1).uint(1).nil().nil()),
        RejectCode::kWrongArgumentCount},
-      {"getAllReporters with 1", RequestBytes(1, Pack().uint(10), Pack().nil()),
-       RejectCode::kWrongArgumentCount},
       {"killService with 1", RequestBytes(1, Pack().uint(11), Pack().uint(0)),
        RejectCode::kWrongArgumentCount},
       // 3: argument of the wrong type
       {"reporterID string", RequestBytes(1, Pack().uint(1), Pack().str("5")),
        RejectCode::kWrongArgumentType},
-      {"reporterID float", RequestBytes(1, Pack().uint(5), Pack().float64(5.0)),
-       RejectCode::kWrongArgumentType},
       {"reporterID float32", RequestBytes(1, Pack().uint(7), Pack().float32(5.0f)),
        RejectCode::kWrongArgumentType},
-      {"reporterID boolean", RequestBytes(1, Pack().uint(8), Pack().boolean(true)),
-       RejectCode::kWrongArgumentType},
       {"reporterID nil", RequestBytes(1, Pack().uint(9), Pack().nil()),
-       RejectCode::kWrongArgumentType},
-      {"reporterID array", RequestBytes(1, Pack().uint(3), Pack().array(1).uint(1)),
        RejectCode::kWrongArgumentType},
       {"serviceType float", RequestBytes(2, Pack().uint(2), Pack().float64(1.5).uint(1)),
        RejectCode::kWrongArgumentType},
       {"configuration array", RequestBytes(2, Pack().uint(4), Pack().array(0).uint(1)),
        RejectCode::kWrongArgumentType},
-      {"configuration nil", RequestBytes(2, Pack().uint(4), Pack().nil().uint(1)),
-       RejectCode::kWrongArgumentType},
       {"message string", RequestBytes(4, Pack().uint(6), Pack().str("m").uint(1).uint(1).nil()),
        RejectCode::kWrongArgumentType},
       {"category boolean",
        RequestBytes(4, Pack().uint(6), Pack().map(0).boolean(false).uint(1).nil()),
-       RejectCode::kWrongArgumentType},
-      {"reporterIDs string", RequestBytes(4, Pack().uint(6), Pack().map(0).uint(1).uint(1).str("")),
        RejectCode::kWrongArgumentType},
       {"reporterIDs map", RequestBytes(4, Pack().uint(6), Pack().map(0).uint(1).uint(1).map(0)),
        RejectCode::kWrongArgumentType},
@@ -422,7 +396,7 @@ Bytes SendWithDepth(int depth) {
   return RequestBytes(4, Pack().uint(6), Pack().append(message).uint(0).uint(0).nil());
 }
 
-TEST(CodecTest, NestingOfExactlyTheLimitIsAccepted) {
+TEST(CodecTest, NestingOfExactlyTheLimitIsAcceptedAndOneMoreIsCode5) {
   const Request request = Accepted(SendWithDepth(kMaxNestingDepth));
   const Value* v = &std::get<SendMessage>(request.arguments).message["deep"];
   int levels = 2;
@@ -433,9 +407,7 @@ TEST(CodecTest, NestingOfExactlyTheLimitIsAccepted) {
   EXPECT_EQ(levels, kMaxNestingDepth);
   // And it encodes back to the same bytes.
   EXPECT_EQ(EncodeRequest(request), SendWithDepth(kMaxNestingDepth));
-}
 
-TEST(CodecTest, OneLevelBeyondTheLimitIsRejectedWithCode5) {
   const RequestError error = Refused(SendWithDepth(kMaxNestingDepth + 1));
   EXPECT_EQ(error.kind, RequestError::Kind::kReject);
   EXPECT_EQ(error.code, RejectCode::kTooDeep);
@@ -598,14 +570,11 @@ TEST(CodecTest, ReplyValueAccessorsRefuseTheWrongShape) {
   EXPECT_FALSE(BoolReplyValue(nullptr));
   EXPECT_FALSE(ServiceTypeReplyValue(65536));
   EXPECT_FALSE(ServiceTypeReplyValue(-1));
-  EXPECT_FALSE(ServiceTypeReplyValue(true));
   EXPECT_FALSE(ServiceTypeReplyValue(3.0));
   EXPECT_FALSE(ReportersReplyValue(Value::array({1, "2"})));
   EXPECT_FALSE(ReportersReplyValue(Value::array({1, kUint64Max})));
-  EXPECT_FALSE(ReportersReplyValue(nullptr));
   EXPECT_FALSE(ValidityReplyValue(Value{{"reporterID", 1}}));
   EXPECT_FALSE(ValidityReplyValue(Value{{"reporterID", 1}, {"serviceType", 70000}}));
-  EXPECT_FALSE(ValidityReplyValue(Value::array()));
   EXPECT_FALSE(IsNilReplyValue(false));
 }
 
@@ -615,23 +584,18 @@ TEST(CodecTest, MalformedRepliesAreRefused) {
       {"truncated", Pack().array(3).uint(1).uint(0)},
       {"trailing", Pack().array(3).uint(1).uint(0).nil().nil()},
       {"not an array", Pack().map(0)},
-      {"2 elements", Pack().array(2).uint(1).uint(0)},
       {"4 elements", Pack().array(4).uint(1).uint(0).nil().nil()},
       {"nil call", Pack().array(3).nil().uint(0).nil()},
       {"negative call", Pack().array(3).integer(IntFormat::kNegativeFixint, -1).uint(0).nil()},
       {"status 3", Pack().array(3).uint(1).uint(3).nil()},
-      {"status string", Pack().array(3).uint(1).str("0").nil()},
       {"status 1 without map", Pack().array(3).uint(1).uint(1).nil()},
       {"status 1 without code", Pack().array(3).uint(1).uint(1).map(1).str("domain").str("d")},
       {"status 1 string code",
        Pack().array(3).uint(1).uint(1).map(2).str("domain").str("d").str("code").str("1")},
-      {"status 1 integer domain",
-       Pack().array(3).uint(1).uint(1).map(2).str("domain").uint(1).str("code").uint(1)},
       {"status 2 without reason",
        Pack().array(3).uint(1).uint(2).map(2).str("domain").str("d").str("code").uint(1)},
       {"bin value", Pack().array(3).uint(1).uint(0).raw({0xc4, 0})},
       {"too deep", Pack().array(3).uint(1).uint(0).append(Nested(70))},
-      {"integer key", Pack().array(3).uint(1).uint(0).map(1).uint(1).nil()},
   };
   for (const auto& [name, body] : cases) {
     EXPECT_TRUE(std::holds_alternative<std::string>(DecodeReply(body))) << name;

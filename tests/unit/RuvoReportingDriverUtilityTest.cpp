@@ -83,14 +83,6 @@ TEST(RuvoReportingDriverTest, ChannelKeysJoinThePresentNamesWithUnderscores) {
   EXPECT_EQ(RuvoReportingDriverUtility::ChannelKey(*neither, nullopt), "");
 }
 
-TEST(RuvoReportingIOChannelSubscriptionTest, StartsWithoutHandleOrChannels) {
-  const auto driver = RuvoReportingDriver::driverWithGroupName("Speaker", nullopt);
-  RuvoReportingIOChannelSubscription subscription(driver);
-  EXPECT_EQ(subscription.subscription(), 0u);
-  EXPECT_EQ(subscription.subscribedChannels(), nullopt);
-  EXPECT_EQ(subscription.driver(), driver);
-}
-
 // --- Creation ---
 
 TEST_F(DriverUtilityTest, RegistersTheRvrdScopeOncePerProcessAndLogsToIt) {
@@ -112,15 +104,15 @@ TEST_F(DriverUtilityTest, RegistersTheRvrdScopeOncePerProcessAndLogsToIt) {
   ASSERT_EQ(lines.size(), 1u);
   EXPECT_EQ(lines[0].scope, "rvrd");
   EXPECT_EQ(lines[0].level, LogLevel::kInfo);
-}
 
-TEST_F(DriverUtilityTest, FailedRegistrationWritesToTheDefaultLog) {
-  log.FailRegistrations(true);
-  RuvoReportingDriverUtility utility(fake);
-  const auto lines = log.Matching("creating metrioning driver utility");
-  ASSERT_EQ(lines.size(), 1u);
-  EXPECT_EQ(lines[0].scope, "default");
-  EXPECT_EQ(lines[0].text.rfind("RuvoReportingDriverUtility.cpp:", 0), 0u) << lines[0].text;
+  // A registration that fails in a fresh process writes to the default log instead.
+  RuvoReportingDriverUtility::ResetLogScopeForTesting();
+  log.Clear();
+  RuvoReportingDriverUtility third(fake);
+  const auto fallback = log.Matching("creating metrioning driver utility");
+  ASSERT_EQ(fallback.size(), 1u);
+  EXPECT_EQ(fallback[0].scope, "default");
+  EXPECT_EQ(fallback[0].text.rfind("RuvoReportingDriverUtility.cpp:", 0), 0u) << fallback[0].text;
 }
 
 TEST_F(DriverUtilityTest, SubscribesInTableOrderOnlyDriversWithChannels) {
@@ -176,35 +168,7 @@ TEST_F(DriverUtilityTest, ChannelsThatComeBackWithAnErrorAreStillUsed) {
             (Dictionary{{"Speaker_temp", 4}}));
 }
 
-TEST_F(DriverUtilityTest, NoDriverAtAllGivesAnEmptySnapshotAndNoDelta) {
-  fake.AddChannel("PipeWire", "alsa_output", "xruns", 3);
-  RuvoReportingDriverUtility utility(fake);
-  EXPECT_TRUE(utility.ioChannelSubscriptions().empty());
-  const Dictionary snapShot = utility.getSnapShot();
-  EXPECT_TRUE(snapShot.is_object());
-  EXPECT_TRUE(snapShot.empty());
-  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(&snapShot), nullopt);
-  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(nullptr), nullopt);
-  EXPECT_EQ(fake.CreateSamplesCalls(), 0);
-}
-
 // --- Snapshots and deltas ---
-
-TEST_F(DriverUtilityTest, SnapshotHoldsEachDriversSampleSetUnderItsDescription) {
-  fake.AddChannel("QuorvexAE2MCA", nullopt, "underruns", 3);
-  fake.AddChannel("Speaker", "MCA", "resets", 8);  // matched by Speaker and by (null)-MCA
-  fake.AddChannel("Haptics", "Stats", "kicks", 1);
-  RuvoReportingDriverUtility utility(fake);
-  log.Clear();
-  const Dictionary snapShot = utility.getSnapShot();
-  EXPECT_EQ(Keys(snapShot), (std::vector<std::string>{"QuorvexAE2MCA-(null)", "Speaker-(null)",
-                                                      "(null)-MCA", "Haptics-Stats"}));
-  EXPECT_EQ(snapShot.at("(null)-MCA").at("samples").at(0).at("value"), 8);
-  EXPECT_EQ(Texts(log, LogLevel::kInfo),
-            (std::vector<std::string>{
-                "sampling driver QuorvexAE2MCA-(null)", "sampling driver Speaker-(null)",
-                "sampling driver (null)-MCA", "sampling driver Haptics-Stats"}));
-}
 
 TEST_F(DriverUtilityTest, OnlyCountersThatRoseAppearAndNothingChangedIsNone) {
   const int rise = fake.AddChannel("QuorvexAE2MCA", nullopt, "rise", 10);
@@ -354,7 +318,9 @@ TEST_F(DriverUtilityTreeTest, SessionLifetimeReportsWhatRoseInEveryDriver) {
             (std::vector<std::string>{"QuorvexAE2MCA-(null)", "Speaker-(null)", "(null)-MCA",
                                       "Haptics-Stats"}));
   const Dictionary snapShot = utility.getSnapShot();
-  EXPECT_EQ(Keys(snapShot).size(), 4u);
+  EXPECT_EQ(Keys(snapShot), (std::vector<std::string>{"QuorvexAE2MCA-(null)", "Speaker-(null)",
+                                                      "(null)-MCA", "Haptics-Stats"}));
+  EXPECT_EQ(snapShot.at("(null)-MCA").at("samples").size(), 2u);
 
   tree.write("QuorvexAE2MCA/rise", 15);  // replaced by rename: the new value is read
   tree.write("QuorvexAE2MCA/fall", 4);
@@ -397,6 +363,7 @@ TEST_F(DriverUtilityTreeTest, TreeWithoutTheFourGroupsSubscribesNothingButSaysSo
   const Dictionary snapShot = utility.getSnapShot();
   EXPECT_EQ(snapShot, MakeDictionary());
   EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(&snapShot), nullopt);
+  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(nullptr), nullopt);
 }
 
 TEST_F(DriverUtilityTreeTest, MissingRootLogsTheErrorCodeForEveryDriver) {
