@@ -29,8 +29,8 @@ void RuvoReportingKelvaneUtility::handleEvent(const Dictionary& event, uint32_t 
   } else {
     payload["TimestampEnd"] = *timestamp;
   }
-  CurrentPlatform().powerLog->LogRegisteredEvent(kPowerEventAgent, kPowerEventName, payload,
-                                                 nullptr);
+  session.platform().powerLog->LogRegisteredEvent(kPowerEventAgent, kPowerEventName, payload,
+                                                  nullptr);
 }
 
 }  // namespace tavrin

@@ -18,10 +18,10 @@ class RuvoReportingKelvaneUtility {
 
   RuvoReportingKelvaneUtility() = delete;
 
-  // Logs one power event through CurrentPlatform().powerLog when `event` carries "EngineOnTime":
-  // "EngineOnDuration", and, when known, "ApplicationName" (from the session's user info) and
-  // "TimestampEnd" (the message's "ruvoreporting_timestamp"). A missing name or time stamp is
-  // logged as an error; the event is logged anyway. The category and type are not used.
+  // Logs one power event through the session's platform power log when `event` carries
+  // "EngineOnTime": "EngineOnDuration", and, when known, "ApplicationName" (from the session's user
+  // info) and "TimestampEnd" (the message's "ruvoreporting_timestamp"). A missing name or time
+  // stamp is logged as an error; the event is logged anyway. The category and type are not used.
   static void handleEvent(const Dictionary& event, uint32_t category, uint16_t type,
                           const RuvoReportingSession& session);
 };

@@ -18,7 +18,7 @@ void RuvoReportingStratikBridge::handleEvent(const Dictionary& event, uint32_t c
       fmt::format("com.quorvex.tavrin.{}.{}", CategoryName(category), TypeName(type));
   // Nothing changes the payload after this point, so the builder may run on any thread, later.
   auto prepared = std::make_shared<const Dictionary>(std::move(payload));
-  CurrentPlatform().analytics->SendEventLazy(name, [prepared] { return *prepared; });
+  session.platform().analytics->SendEventLazy(name, [prepared] { return *prepared; });
 }
 
 }  // namespace tavrin

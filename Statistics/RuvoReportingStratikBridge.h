@@ -15,8 +15,8 @@ class RuvoReportingStratikBridge {
   RuvoReportingStratikBridge() = delete;
 
   // Sends `event` (null counts as empty) with "HostApplicationDisplayID" set to the application
-  // name of the session's user info, through CurrentPlatform().analytics. The payload is prepared
-  // here; the sink's lazy builder only hands it over.
+  // name of the session's user info, through the session's platform analytics sink. The payload is
+  // prepared here; the sink's lazy builder only hands it over.
   static void handleEvent(const Dictionary& event, uint32_t category, uint16_t type,
                           const RuvoReportingSession& session);
 };

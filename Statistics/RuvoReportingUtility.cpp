@@ -111,23 +111,14 @@ Value ApplicationNameFromUserInfo(const Dictionary* userInfo) {
   return kUnknownName;
 }
 
-bool InternalBuildFlag::Get(DeviceInfoQuery& deviceInfo) {
-  return Get([&deviceInfo]() -> DeviceInfoQuery* { return &deviceInfo; });
-}
-
-bool InternalBuildFlag::Get(const std::function<DeviceInfoQuery*()>& deviceInfo) {
-  std::call_once(once_, [&] {
-    DeviceInfoQuery* query = deviceInfo();
+bool IsInternalBuild(PlatformServices& platform) {
+  DeviceFactOnce& fact = *platform.internalBuild;
+  std::call_once(fact.once, [&] {
     // A platform without the query has no way to say "internal"; the safe answer is no.
-    internal_ = query != nullptr && query->QueryBool(kDeviceInfoInternalBuild, false);
+    fact.value = platform.deviceInfo != nullptr &&
+                 platform.deviceInfo->QueryBool(kDeviceInfoInternalBuild, false);
   });
-  return internal_;
-}
-
-bool IsInternalBuild() {
-  static InternalBuildFlag flag;
-  // The platform is consulted only on the first call, so later calls never depend on it.
-  return flag.Get([]() { return CurrentPlatform().deviceInfo; });
+  return fact.value;
 }
 
 bool RuvoReportingUtilityWait(Condition& condition, bool& flag, std::string_view waitingMessage,

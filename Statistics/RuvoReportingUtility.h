@@ -11,6 +11,7 @@
 #include "platform/Condition.h"
 #include "platform/DeviceInfoQuery.h"
 #include "platform/LogSystem.h"
+#include "platform/Platform.h"
 
 namespace tavrin {
 
@@ -52,21 +53,10 @@ std::string TypeName(uint16_t type);
 // the key is absent or there is no dictionary.
 Value ApplicationNameFromUserInfo(const Dictionary* userInfo);
 
-// Whether the device runs an internal build. Asks the installed platform's DeviceInfoQuery for
-// "InternalBuild" once per process, even when several threads ask first at the same time.
-bool IsInternalBuild();
-
-// The once-only guard behind IsInternalBuild, usable on its own so tests can make fresh ones.
-class InternalBuildFlag {
- public:
-  bool Get(DeviceInfoQuery& deviceInfo);
-  // As above, but `deviceInfo` is called only by the first caller; a null query answers false.
-  bool Get(const std::function<DeviceInfoQuery*()>& deviceInfo);
-
- private:
-  std::once_flag once_;
-  bool internal_ = false;
-};
+// Whether the device runs an internal build: `platform`'s DeviceInfoQuery is asked for
+// "InternalBuild" once per context, even when several threads ask first at the same time; a
+// context without the query answers false.
+bool IsInternalBuild(PlatformServices& platform);
 
 // Waits on `condition` until another thread sets `flag` (under the condition's lock, then
 // signals) or `timeoutSeconds` pass without a signal. Every signal that leaves the flag unset

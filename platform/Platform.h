@@ -1,5 +1,7 @@
 #pragma once
 
+#include <memory>
+#include <mutex>
 #include <string>
 
 namespace tavrin {
@@ -17,9 +19,16 @@ class ProcessInfo;
 class RandomSource;
 class TelvoroService;
 
-// The platform services the core uses, gathered in one place. The service fills one at start-up
-// with the Linux implementations; tests fill one with fakes. Members are never null once
-// installed, and every service outlives the core objects that use it.
+// A boolean fact of the device, asked once even when several threads ask first together.
+struct DeviceFactOnce {
+  std::once_flag once;
+  bool value = false;
+};
+
+// The platform services the core uses, gathered in one place: the context that main builds with
+// the Linux implementations and passes down to every component, and that a test fills with
+// fakes. Nothing reaches the platform any other way. Members are never null once
+// filled, and every service outlives the core objects that use it.
 struct PlatformServices {
   Dispatcher* dispatcher = nullptr;
   RandomSource* random = nullptr;
@@ -35,13 +44,9 @@ struct PlatformServices {
   DefaultsDomain* defaults = nullptr;
   // Summary files go to "<diagnosticDirectory>/Audio/Reporting".
   std::string diagnosticDirectory = "/var/log/tavrin/DiagnosticLogs";
+  // The device's "InternalBuild" fact, asked of `deviceInfo` once and kept: a build does not
+  // change while the service runs. Shared by copies of the context.
+  std::shared_ptr<DeviceFactOnce> internalBuild = std::make_shared<DeviceFactOnce>();
 };
-
-// The process-wide services, for class operations that have no instance to carry them.
-// Aborts with a message when none is installed.
-PlatformServices& CurrentPlatform();
-// Installs `services` (nullptr uninstalls) and returns the previous one. Call at start-up or from a
-// test fixture, never while the core runs.
-PlatformServices* InstallPlatform(PlatformServices* services);
 
 }  // namespace tavrin

@@ -510,7 +510,8 @@ void RuvoReportingServerInstance::sendMessageOnQueue(
   } else {
     TLOG_DEFAULT(log, "no active reporting sessions found, sending as standalone");
     const std::optional<Dictionary> defaults = delegate->getDefaults();
-    RuvoReportingSession::sendSingleMessage(message, category, type, service_type::kStandalone,
+    RuvoReportingSession::sendSingleMessage(platform_, message, category, type,
+                                            service_type::kStandalone,
                                             defaults ? *defaults : Dictionary(), nullptr);
   }
   if (reply) reply(std::nullopt);

@@ -59,8 +59,7 @@ class RuvoReportingServiceDelegate final
   // Registers the front end's log scope, creates the shared work queue (process-wide; a later
   // delegate replaces it), registers for the defaults notification and creates the driver
   // utility. The settings are not read here.
-  static std::shared_ptr<RuvoReportingServiceDelegate> init(
-      PlatformServices& platform = CurrentPlatform());
+  static std::shared_ptr<RuvoReportingServiceDelegate> init(PlatformServices& platform);
   ~RuvoReportingServiceDelegate() override;
 
   // Reads the defaults domain afresh: "device_name" when present, "disable_reporting" always.
@@ -119,7 +118,7 @@ class RuvoReportingServerInstance final
 
   static ServerInstancePtr initWithPID(int32_t pid,
                                        std::weak_ptr<RuvoReportingServiceDelegateProtocol> delegate,
-                                       PlatformServices& platform = CurrentPlatform());
+                                       PlatformServices& platform);
   ~RuvoReportingServerInstance() override;
 
   // Own map first; the other clients too when `acrossAllClients`. Work queue only.

@@ -349,7 +349,7 @@ void RuvoReportingSession::sendMessage(const Dictionary& payload, uint32_t categ
                             : cleaned;
   std::string messageId = messageIdForCategory(category, type);
   appendAggregated(*cleaned);
-  if (IsInternalBuild()) appendNested(NestedPayloadEntry{std::move(messageId), cleaned});
+  if (IsInternalBuild(platform_)) appendNested(NestedPayloadEntry{std::move(messageId), cleaned});
   EmitTracePoint(trace::kMessageSent);
 
   // The state at send time decides the road, even if stop runs before delivery.
@@ -365,7 +365,7 @@ void RuvoReportingSession::deliver(const PayloadPtr& cleaned, const PayloadPtr& 
                                    uint32_t category, uint16_t type, bool startedAtSend) {
   if (!startedAtSend) {
     TLOG_DEBUG(SessionLog(), "session not started, will send as a single message");
-    sendSingleMessage(*cleaned, category, type, serviceType(), userInfo(), nullptr);
+    sendSingleMessage(platform_, *cleaned, category, type, serviceType(), userInfo(), nullptr);
     return;
   }
   if (serviceType() == service_type::kTest) {
@@ -460,7 +460,7 @@ std::optional<Dictionary> RuvoReportingSession::createSummaryEventForSession() {
 }
 
 void RuvoReportingSession::writeSummaryJson() {
-  if (!IsInternalBuild()) return;
+  if (!IsInternalBuild(platform_)) return;
   std::shared_ptr<NestedPayloadList> list = nestedAggregatedPayloadData();
   if (!list) return;
   const Dictionary info = userInfo();
@@ -512,7 +512,7 @@ void RuvoReportingSession::writeSummaryJson() {
 }
 
 bool RuvoReportingSession::shouldReportOrientation() {
-  if (!IsInternalBuild()) return false;
+  if (!IsInternalBuild(platform_)) return false;
   const uint16_t type = serviceType();
   if (type != service_type::kLongFormAudio && type != service_type::kTelephony) return false;
   return platform_.deviceInfo->QueryInt32(kDeviceInfoDeviceClassNumber, 0) !=
@@ -564,12 +564,11 @@ void RuvoReportingSession::orientationChanged(OrientationKind kind,
   appendAggregated(record);
 }
 
-void RuvoReportingSession::sendSingleMessage(const Dictionary& payload, uint32_t category,
-                                             uint16_t type, uint16_t serviceType,
+void RuvoReportingSession::sendSingleMessage(PlatformServices& platform, const Dictionary& payload,
+                                             uint32_t category, uint16_t type, uint16_t serviceType,
                                              const Dictionary& userInfo, Reply reply) {
   // `userInfo` is not sent: single messages carry only the service's own identification.
   (void)userInfo;
-  PlatformServices& platform = CurrentPlatform();
   const int64_t delaySeconds =
       serviceType == service_type::kAlarms
           ? static_cast<int64_t>(platform.random->UniformBelow(kAlarmsDelaySpreadSeconds))

@@ -98,9 +98,9 @@ class RuvoReportingSession : public std::enable_shared_from_this<RuvoReportingSe
 
   // Creates a session (stopped, service type 0xFFFF "unknown") that uses `platform` for its
   // queue, the back-ends, orientation and files. The first call registers the session log scope.
-  static std::shared_ptr<RuvoReportingSession> create(
-      int64_t reporterID, std::vector<int32_t> processIdentifiers,
-      PlatformServices& platform = CurrentPlatform());
+  static std::shared_ptr<RuvoReportingSession> create(int64_t reporterID,
+                                                      std::vector<int32_t> processIdentifiers,
+                                                      PlatformServices& platform);
   ~RuvoReportingSession();
   RuvoReportingSession(const RuvoReportingSession&) = delete;
   RuvoReportingSession& operator=(const RuvoReportingSession&) = delete;
@@ -145,14 +145,16 @@ class RuvoReportingSession : public std::enable_shared_from_this<RuvoReportingSe
   // The standalone path: sends one message without any session on the process's background
   // queue, after 0..59 random whole seconds for "alarms" and at once otherwise. `userInfo` is
   // accepted and not sent. `reply` (optional) gets the platform's error or nil, on the background
-  // queue. Uses CurrentPlatform().
-  static void sendSingleMessage(const Dictionary& payload, uint32_t category, uint16_t type,
-                                uint16_t serviceType, const Dictionary& userInfo, Reply reply);
+  // queue.
+  static void sendSingleMessage(PlatformServices& platform, const Dictionary& payload,
+                                uint32_t category, uint16_t type, uint16_t serviceType,
+                                const Dictionary& userInfo, Reply reply);
 
   // The session log scope ("rvrr"); registered once per process. May be null (default log).
   static const LogHandle& SessionLog();
 
   // Properties.
+  PlatformServices& platform() const { return platform_; }
   int64_t reporterID() const { return reporterID_; }
   std::vector<int32_t> processIdentifiers() const;
   void setProcessIdentifiers(std::vector<int32_t> processIdentifiers);

@@ -250,7 +250,6 @@ int main(int argc, char** argv) {
   services.notifications = &notifications;
   services.defaults = &defaults;
   services.diagnosticDirectory = options.diagnosticDir;
-  InstallPlatform(&services);
 
   // Log verbosity and the analytics policy follow the defaults as the settings do.
   int refreshToken = -1;
@@ -307,7 +306,6 @@ int main(int argc, char** argv) {
   reporting.Shutdown();
   listener.SetDelegate(nullptr);
   delegate.reset();
-  InstallPlatform(nullptr);
   TLOG_DEFAULT(nullptr, "tavrind stopped");
   InstallLogSystem(nullptr);
   return 0;

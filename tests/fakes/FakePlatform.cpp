@@ -13,13 +13,11 @@ FakePlatform::FakePlatform() {
   services.deviceInfo = &deviceInfo;
   services.fileSystem = &fileSystem;
   services.diagnosticDirectory = kDiagnosticDirectory;
-  previous_ = InstallPlatform(&services);
 }
 
 FakePlatform::~FakePlatform() {
   // Callbacks registered by sessions hold them; drop them while the other fakes still exist.
   orientation.Clear();
-  InstallPlatform(previous_);
 }
 
 }  // namespace tavrin::testing

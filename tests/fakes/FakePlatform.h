@@ -14,8 +14,8 @@
 
 namespace tavrin::testing {
 
-// One fake of each platform service, gathered in `services` and installed as the process's
-// platform for the lifetime of the object (the previous one is put back afterwards). Time moves
+// One fake of each platform service, gathered in `services`, the context a test passes to the
+// objects it makes. Time moves
 // only through `dispatcher` (or `clock`); nothing runs until the test runs the dispatcher.
 //
 // Members are declared so that the dispatcher goes first on destruction: work still queued may
@@ -40,9 +40,6 @@ struct FakePlatform {
   FakeDispatcher dispatcher{clock};
   // processInfo, notifications and defaults are left null: fill them in a test that needs them.
   PlatformServices services;
-
- private:
-  PlatformServices* previous_ = nullptr;
 };
 
 }  // namespace tavrin::testing

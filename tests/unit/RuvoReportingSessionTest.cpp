@@ -420,8 +420,8 @@ TEST_F(SessionTest, AfterStopMessagesGoAloneAndReachNoSummary) {
 TEST_F(SessionTest, AlarmsSingleMessagesWaitTheDrawnDelay) {
   platform.random.Script({59});
   int replies = 0;
-  RuvoReportingSession::sendSingleMessage(Dictionary{{"a", 1}}, 1, 1, 4, Dictionary::object(),
-                                          [&](const OptionalError& error) {
+  RuvoReportingSession::sendSingleMessage(platform.services, Dictionary{{"a", 1}}, 1, 1, 4,
+                                          Dictionary::object(), [&](const OptionalError& error) {
                                             EXPECT_FALSE(error.has_value());
                                             ++replies;
                                           });
@@ -437,20 +437,20 @@ TEST_F(SessionTest, AlarmsSingleMessagesWaitTheDrawnDelay) {
   EXPECT_EQ(traces.Count(trace::kMessageSent), 1u);
 
   platform.random.Script({0});
-  RuvoReportingSession::sendSingleMessage(Dictionary{{"a", 2}}, 1, 1, 4, Dictionary::object(),
-                                          nullptr);
+  RuvoReportingSession::sendSingleMessage(platform.services, Dictionary{{"a", 2}}, 1, 1, 4,
+                                          Dictionary::object(), nullptr);
   platform.dispatcher.RunUntilIdle();
   EXPECT_EQ(platform.telvoro.SingleMessages().size(), 2u);
 }
 
 TEST_F(SessionTest, OtherSingleMessagesGoAtOnceWithoutTheClientsUserInfoAndReportFailures) {
   RuvoReportingSession::sendSingleMessage(
-      Dictionary{{"engine on time", 7}}, 0x20000003, 2, 2,
+      platform.services, Dictionary{{"engine on time", 7}}, 0x20000003, 2, 2,
       Dictionary{{"secret", "x"}, {"ServiceName", "mine"}, {"HostApplicationDisplayID", "a"}},
       nullptr);
   // A service type without a name gives no service name.
-  RuvoReportingSession::sendSingleMessage(Dictionary{{"a", 1}}, 1, 1, 13, Dictionary::object(),
-                                          nullptr);
+  RuvoReportingSession::sendSingleMessage(platform.services, Dictionary{{"a", 1}}, 1, 1, 13,
+                                          Dictionary::object(), nullptr);
   EXPECT_TRUE(platform.random.Bounds().empty());
   EXPECT_TRUE(platform.telvoro.SingleMessages().empty());  // never on the caller's stack
   platform.dispatcher.RunUntilIdle();
@@ -472,8 +472,8 @@ TEST_F(SessionTest, OtherSingleMessagesGoAtOnceWithoutTheClientsUserInfoAndRepor
   // A refusal reaches the reply and the log.
   platform.telvoro.FailSends(Error{"com.example", 9, "back-end down"});
   std::optional<OptionalError> answer;
-  RuvoReportingSession::sendSingleMessage(Dictionary{{"a", 1}}, 0xFFFFFFFF, 1, 13,
-                                          Dictionary::object(),
+  RuvoReportingSession::sendSingleMessage(platform.services, Dictionary{{"a", 1}}, 0xFFFFFFFF, 1,
+                                          13, Dictionary::object(),
                                           [&](const OptionalError& error) { answer = error; });
   platform.dispatcher.RunUntilIdle();
   ASSERT_TRUE(answer.has_value() && answer->has_value());

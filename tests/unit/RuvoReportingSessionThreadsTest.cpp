@@ -47,18 +47,11 @@ class SessionThreadsTest : public SessionTestBase {
   SessionThreadsTest() {
     services = platform.services;
     services.dispatcher = &dispatcher;
-    previous_ = InstallPlatform(&services);
   }
-  ~SessionThreadsTest() override {
-    dispatcher.Shutdown();
-    InstallPlatform(previous_);
-  }
+  ~SessionThreadsTest() override { dispatcher.Shutdown(); }
 
   AsioDispatcher dispatcher;
   PlatformServices services;
-
- private:
-  PlatformServices* previous_ = nullptr;
 };
 
 TEST_F(SessionThreadsTest, MessagesKeepTheirOrderWhileOrientationAndStopRunElsewhere) {

@@ -122,17 +122,6 @@ TEST(ApplicationNameFromUserInfoTest, StoredValueComesBackAsItIsWhateverItsType)
 // ---------------------------------------------------------------------------------------------
 // Internal build flag
 
-TEST(InternalBuildFlagTest, MissingFactOrMissingQueryMeansNotInternal) {
-  FakeDeviceInfo device;
-  InternalBuildFlag flag;
-  EXPECT_FALSE(flag.Get(device));
-  EXPECT_EQ(device.QueryCount("InternalBuild"), 1u);
-
-  InternalBuildFlag noQuery;
-  EXPECT_FALSE(noQuery.Get([]() -> DeviceInfoQuery* { return nullptr; }));
-}
-
-// The process-wide flag: the only test in this binary that calls IsInternalBuild.
 TEST(IsInternalBuildTest, SixteenConcurrentFirstCallsAskOnceAndAgree) {
   constexpr int kThreads = 16;
   FakeDeviceInfo device;
@@ -141,7 +130,6 @@ TEST(IsInternalBuildTest, SixteenConcurrentFirstCallsAskOnceAndAgree) {
   device.SetQueryHook([](std::string_view) { std::this_thread::sleep_for(milliseconds(50)); });
   PlatformServices services;
   services.deviceInfo = &device;
-  PlatformServices* previous = InstallPlatform(&services);
 
   std::latch start(kThreads);
   std::vector<int> answers(kThreads, -1);
@@ -149,20 +137,22 @@ TEST(IsInternalBuildTest, SixteenConcurrentFirstCallsAskOnceAndAgree) {
   for (int i = 0; i < kThreads; ++i) {
     threads.emplace_back([&, i] {
       start.arrive_and_wait();
-      answers[i] = IsInternalBuild() ? 1 : 0;
+      answers[i] = IsInternalBuild(services) ? 1 : 0;
     });
   }
   for (auto& thread : threads) thread.join();
-
   EXPECT_EQ(device.QueryCount("InternalBuild"), 1u);
   for (int i = 0; i < kThreads; ++i) EXPECT_EQ(answers[i], 1) << "thread " << i;
 
-  // Later calls neither change their answer nor consult the platform again.
+  // Later calls keep the answer without asking again; another context asks for itself.
   device.SetBool("InternalBuild", false);
-  InstallPlatform(nullptr);
-  EXPECT_TRUE(IsInternalBuild());
-  InstallPlatform(previous);
+  EXPECT_TRUE(IsInternalBuild(services));
   EXPECT_EQ(device.QueryCount("InternalBuild"), 1u);
+  PlatformServices other;
+  other.deviceInfo = &device;
+  EXPECT_FALSE(IsInternalBuild(other));
+  PlatformServices noQuery;
+  EXPECT_FALSE(IsInternalBuild(noQuery));
 }
 
 // ---------------------------------------------------------------------------------------------
