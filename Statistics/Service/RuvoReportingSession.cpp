@@ -300,14 +300,49 @@ void RuvoReportingSession::stop() {
   TLOG_DEBUG(SessionLog(), "ending session {}", reporterID_);
   EmitTracePoint(trace::kSessionStopped);
 
-  if (std::optional<Dictionary> summary = createSummaryEventForSession()) {
-    TLOG_DEFAULT(SessionLog(), "sending summary event for reporter {}", reporterID_);
-    sendMessage(*summary, kSummaryEventCategory, kSummaryEventType, true, nullptr);
+  // What this run gathered is taken out now, with the state it is summarised in; the summary
+  // event, the file and the flush then run on the session's own queue, behind every message
+  // already queued there, so no other client's request waits for them.
+  std::shared_ptr<SummaryTexts> texts;
+  std::shared_ptr<NestedPayloadList> nested;
+  {
+    std::shared_ptr<NestedPayloadList> list = nestedAggregatedPayloadData();
+    std::unique_lock<std::recursive_mutex> listLock;
+    if (list) listLock = std::unique_lock(list->mutex);
+    std::lock_guard lock(propertyMutex_);
+    texts = std::move(summaryTexts_);
+    nested = std::move(nestedAggregatedPayloadData_);
   }
-  writeSummaryJson();
+  const uint16_t stoppedServiceType = serviceType();
+  Dictionary stoppedUserInfo = userInfo();
+  const WallTime stoppedAt = platform_.dispatcher->GetClock().WallNow();
+  // The summary is a message of the session too: it takes its message id in order with the
+  // messages sent before the stop, and is the last entry of the summary file.
+  const bool hasSummary = texts && texts->payloadCount() > 0;
+  std::string summaryId =
+      hasSummary ? messageIdForCategory(kSummaryEventCategory, kSummaryEventType) : std::string();
+  started_.store(false, std::memory_order_release);
 
-  // Behind every message already queued, so the flush covers them all.
-  telvoroQueue_->Async([self = shared_from_this()] {
+  telvoroQueue_->Async([self = shared_from_this(), texts = std::move(texts),
+                        nested = std::move(nested), stoppedServiceType,
+                        stoppedUserInfo = std::move(stoppedUserInfo), stoppedAt, hasSummary,
+                        summaryId = std::move(summaryId)] {
+    TLOG_OPERATION("stop");
+    if (hasSummary) {
+      if (std::optional<Dictionary> summary = texts->Summary(stoppedServiceType)) {
+        TLOG_DEFAULT(SessionLog(), "sending summary event for reporter {}", self->reporterID_);
+        EmitTracePoint(trace::kMessageSent);
+        bool changed = false;
+        auto cleaned = std::make_shared<const Dictionary>(CleanedPayload(*summary, &changed));
+        if (nested && IsInternalBuild(self->platform_)) {
+          std::lock_guard lock(nested->mutex);
+          nested->items.push_back(NestedPayloadEntry{summaryId, cleaned});
+        }
+        self->deliver(cleaned, cleaned, kSummaryEventCategory, kSummaryEventType,
+                      /*startedAtSend=*/true);
+      }
+    }
+    self->writeSummaryFile(nested, stoppedUserInfo, stoppedServiceType, stoppedAt);
     if (self->serviceType() != service_type::kTest) {
       if (TelvoroSessionPtr session = self->telvoroSession()) {
         session->FlushMessages([](const OptionalError& error) {
@@ -317,19 +352,6 @@ void RuvoReportingSession::stop() {
     }
     self->setTelvoroSession(nullptr);
   });
-
-  {
-    std::lock_guard lock(propertyMutex_);
-    summaryTexts_.reset();
-  }
-  {
-    std::shared_ptr<NestedPayloadList> list = nestedAggregatedPayloadData();
-    std::unique_lock<std::recursive_mutex> listLock;
-    if (list) listLock = std::unique_lock(list->mutex);
-    std::lock_guard lock(propertyMutex_);
-    nestedAggregatedPayloadData_.reset();
-  }
-  started_.store(false, std::memory_order_release);
 }
 
 void RuvoReportingSession::sendMessage(const Dictionary& payload, uint32_t category, uint16_t type,
@@ -460,10 +482,15 @@ std::optional<Dictionary> RuvoReportingSession::createSummaryEventForSession() {
 }
 
 void RuvoReportingSession::writeSummaryJson() {
+  writeSummaryFile(nestedAggregatedPayloadData(), userInfo(), serviceType(),
+                   platform_.dispatcher->GetClock().WallNow());
+}
+
+void RuvoReportingSession::writeSummaryFile(const std::shared_ptr<NestedPayloadList>& list,
+                                            const Dictionary& info, uint16_t serviceType,
+                                            WallTime now) {
   if (!IsInternalBuild(platform_)) return;
-  std::shared_ptr<NestedPayloadList> list = nestedAggregatedPayloadData();
   if (!list) return;
-  const Dictionary info = userInfo();
   {
     std::lock_guard lock(list->mutex);
     if (list->items.empty()) return;
@@ -499,9 +526,9 @@ void RuvoReportingSession::writeSummaryJson() {
   const auto application = info.find(kHostApplicationKey);
   const std::string applicationName =
       application != info.end() ? ValueText(*application) : std::string("unknown");
-  const std::string fileName = fmt::format(
-      "{}-{}-{}-{}.json", SummaryFileTime(platform_.dispatcher->GetClock().WallNow()), "tavrin",
-      FileNamePart(applicationName), FileNamePart(NameText(ServiceTypeName(serviceType()))));
+  const std::string fileName =
+      fmt::format("{}-{}-{}-{}.json", SummaryFileTime(now), "tavrin", FileNamePart(applicationName),
+                  FileNamePart(NameText(ServiceTypeName(serviceType))));
   if (contents) {
     if (OptionalError written =
             platform_.fileSystem->WriteFileAtomically(directory + "/" + fileName, *contents)) {

@@ -139,6 +139,9 @@ class RuvoReportingSession : public std::enable_shared_from_this<RuvoReportingSe
   // list as a pretty-printed JSON file into "<diagnosticDirectory>/Audio/Reporting". Failures are
   // logged only.
   void writeSummaryJson();
+  // The same for the list, user info and service type a stop took out, named by its time.
+  void writeSummaryFile(const std::shared_ptr<NestedPayloadList>& list, const Dictionary& info,
+                        uint16_t serviceType, WallTime now);
   // Internal build, service type telephony or longformaudio, and a device class other than 6.
   bool shouldReportOrientation();
 

@@ -65,6 +65,7 @@ TEST_F(SummaryTest, TheFileIsNamedByLocalTimeAppAndServiceInAPrivateDirectory) {
                            c.app ? Dictionary{{"HostApplicationDisplayID", c.app}} : Dictionary());
     session->sendMessage(Dictionary{{"a", 1}}, 1, 1, nullptr);
     session->stop();
+    platform.dispatcher.RunUntilIdle();  // the file is written on the session's queue
     ASSERT_FALSE(platform.fileSystem.WriteCalls().empty());
     EXPECT_EQ(platform.fileSystem.WriteCalls().back(), std::string(kDirectory) + "/" + c.name);
     const auto creates = platform.fileSystem.CreateDirectoriesCalls();
@@ -133,6 +134,7 @@ TEST_F(SummaryTest, GeneratedSessionsMatchThePlainAlgorithm) {
       ASSERT_EQ(summary ? summary->dump() : "none", sent.empty() ? "none" : expected.dump());
       const size_t writes = platform.fileSystem.WriteCalls().size();
       session->stop();
+      platform.dispatcher.RunUntilIdle();
       const auto calls = platform.fileSystem.WriteCalls();
       ASSERT_EQ(calls.size(), writes + (sent.empty() ? 0 : 1));
       if (!sent.empty()) {
