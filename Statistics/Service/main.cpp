@@ -306,7 +306,7 @@ int main(int argc, char** argv) {
   reporting.Shutdown();
   listener.SetDelegate(nullptr);
   delegate.reset();
-  TLOG_DEFAULT(nullptr, "tavrind stopped");
+  TLOG_DEFAULT(nullptr, "tavrind stopped; refusals by limit: {}", listener.RefusalCounts());
   InstallLogSystem(nullptr);
   return 0;
 }

@@ -44,6 +44,16 @@ unsigned Mode(const std::string& path) {
   return ::stat(path.c_str(), &info) == 0 ? (info.st_mode & 07777) : 0xFFFFu;
 }
 
+// Peak resident memory of a process, from /proc.
+size_t PeakRssBytes(pid_t pid) {
+  std::ifstream status("/proc/" + std::to_string(pid) + "/status");
+  std::string line;
+  while (std::getline(status, line)) {
+    if (line.rfind("VmHWM:", 0) == 0) return std::stoul(line.substr(6)) * 1024;
+  }
+  return 0;
+}
+
 // Runs `body` as kOtherUid in a child process and returns its exit status (0: all held).
 int RunAsOtherUser(const std::function<int()>& body) {
   const pid_t child = ::fork();
@@ -176,6 +186,7 @@ TEST(IsolationLimitsE2eTest, WideFramesAndLongReporterListsAreRefusedWithoutStal
   EXPECT_LT(std::chrono::steady_clock::now() - started, 1 * kSlowBuild);
   EXPECT_LT(worstRoundTrip, std::chrono::milliseconds(50) * kSlowBuild.count());
   EXPECT_EQ(service.LogCount("refused request from pid"), 2u) << service.Log();
+  EXPECT_LT(PeakRssBytes(service.pid()), size_t{256} << 20);
 
   // Large frames are decoded aside from the I/O thread; a connection's requests keep their order.
   Dictionary large;
@@ -190,6 +201,9 @@ TEST(IsolationLimitsE2eTest, WideFramesAndLongReporterListsAreRefusedWithoutStal
     EXPECT_EQ(reply->call, expected);
     EXPECT_EQ(reply->status, protocol::Status::kOk);
   }
+  EXPECT_EQ(service.Stop(), 0);
+  EXPECT_EQ(service.LogCount("reporter IDs per message 1, entries per frame 1,"), 1u)
+      << service.Log();
 }
 
 // The frame limit is a setting: a frame over it ends the connection, one under it is answered.
@@ -245,16 +259,8 @@ TEST(IsolationLimitsE2eTest, SessionsPerConnectionAreBounded) {
   EXPECT_EQ(std::count(ids->begin(), ids->end(), 19), 0) << "a refused request had an effect";
   EXPECT_EQ(ids->size(), 17u);  // 15 of this connection's, 18, and the other's 17
   EXPECT_TRUE(service.WaitForLog("(2 from this client)")) << service.Log();
-}
-
-// Peak resident memory of a process, from /proc.
-size_t PeakRssBytes(pid_t pid) {
-  std::ifstream status("/proc/" + std::to_string(pid) + "/status");
-  std::string line;
-  while (std::getline(status, line)) {
-    if (line.rfind("VmHWM:", 0) == 0) return std::stoul(line.substr(6)) * 1024;
-  }
-  return 0;
+  EXPECT_EQ(service.Stop(), 0);
+  EXPECT_EQ(service.LogCount("refusals by limit: sessions per connection 2,"), 1u) << service.Log();
 }
 
 // A crowd of connections is bounded twice: per uid, and by the descriptors kept for the service
@@ -308,9 +314,9 @@ TEST(IsolationLimitsE2eTest, ConnectionCrowdsAreCutAtThePerUidLimitAndTheDescrip
 // more than its socket's kernel buffer takes, so backlogs build up in the service.
 TEST(IsolationLimitsE2eTest, ManyClientsThatNeverReadCannotExhaustTheService) {
   TavrindProcess service;
-  testing::WriteFileAtomically(
-      service.DefaultsPath(),
-      "[limits]\nconnections_per_uid = 1000\nreply_bytes_total = 1048576\n");
+  testing::WriteFileAtomically(service.DefaultsPath(),
+                               "[limits]\nconnections_per_uid = 1000\nreply_bytes_total = 1048576\n"
+                               "sessions_per_connection = 4096\n");
   ASSERT_TRUE(service.Start()) << service.Log();
   TestClient owner(service.SocketPath());
   // Reporter IDs of nine bytes each: every reply below lists 2,000 of them, about 18 KB.
@@ -336,6 +342,8 @@ TEST(IsolationLimitsE2eTest, ManyClientsThatNeverReadCannotExhaustTheService) {
   EXPECT_LT(std::chrono::steady_clock::now() - started, 5 * kSlowBuild);
   EXPECT_LT(PeakRssBytes(service.pid()), size_t{512} << 20);
   EXPECT_GT(service.LogCount("the largest reply backlog"), 0u) << "the total was never enforced";
+  EXPECT_EQ(service.Stop(), 0);
+  EXPECT_EQ(service.LogCount("reply backlog 0"), 0u) << service.Log();
 }
 
 // A store whose file system fills up drops records, says so once with the reason and counts them,

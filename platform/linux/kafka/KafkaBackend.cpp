@@ -118,10 +118,18 @@ bool KafkaProducerBackend::Append(ReportRecordPtr record) {
     eventsPending_ = true;  // a flush may have waited for this one
     wakeup_.notify_one();
   }
-  drops_.Dropped(
-      1, error == RD_KAFKA_RESP_ERR__QUEUE_FULL
-             ? fmt::format("the producer queue is full ({} records)", options_.maxQueuedMessages)
-             : std::string(rd_kafka_err2str(error)));
+  // A record over the producer's message.max.bytes (a summary event of a very long session
+  // can be) is refused here, never sent in part: it is counted with its size, and the store,
+  // which has no such limit, keeps it when it is configured too.
+  std::string reason;
+  if (error == RD_KAFKA_RESP_ERR__QUEUE_FULL) {
+    reason = fmt::format("the producer queue is full ({} records)", options_.maxQueuedMessages);
+  } else if (error == RD_KAFKA_RESP_ERR_MSG_SIZE_TOO_LARGE) {
+    reason = fmt::format("a record of {} bytes is over message.max.bytes", value.size());
+  } else {
+    reason = rd_kafka_err2str(error);
+  }
+  drops_.Dropped(1, reason);
   return false;
 }
 

@@ -122,6 +122,7 @@ class UnixClientConnection final : public ClientConnection,
                "for all clients exceed {} bytes",
                pid_, pendingBytes_, listener_.options_.replyBytesTotal);
     listener_.backlogCutoffs_.fetch_add(1, std::memory_order_relaxed);
+    listener_.CountRefusal(protocol::LimitCode::kReplyBacklog);
     End(/*abnormal=*/true, "reply backlog over the total");
   }
 
@@ -243,6 +244,7 @@ class UnixClientConnection final : public ClientConnection,
   // Answers a request over a limit; the request has no other effect.
   void RefuseOverLimit(const protocol::RequestError& error) {
     listener_.limitRefusals_.fetch_add(1, std::memory_order_relaxed);
+    listener_.CountRefusal(error.limit);
     ++limitRefusals_;
     TLOG_ERROR(nullptr, "refused request from pid {} uid {}: limit {}: {} ({} from this client)",
                pid_, uid_, static_cast<int64_t>(error.limit), error.reason, limitRefusals_);
@@ -278,6 +280,8 @@ class UnixClientConnection final : public ClientConnection,
       TLOG_ERROR(nullptr, "closing connection of pid {}: {} bytes of replies not read", pid_,
                  pendingBytes_);
       listener_.backlogCutoffs_.fetch_add(1, std::memory_order_relaxed);
+      listener_.CountRefusal(protocol::LimitCode::kReplyBacklog);
+      listener_.CountRefusal(protocol::LimitCode::kReplyBacklog);
       End(/*abnormal=*/true, "replies not read");
       return;
     }
@@ -532,9 +536,25 @@ std::optional<std::string> UnixServiceListener::RefusalOf(uint32_t uid) {
   const auto sameUid = std::count_if(connections_.begin(), connections_.end(),
                                      [uid](const auto& c) { return c->Uid() == uid; });
   if (static_cast<size_t>(sameUid) >= options_.connectionsPerUid) {
+    CountRefusal(protocol::LimitCode::kConnectionsPerUid);
     return fmt::format("connection of uid {} closed: it has {} open, the limit", uid, sameUid);
   }
   return std::nullopt;
+}
+
+void UnixServiceListener::CountRefusal(protocol::LimitCode limit) {
+  const auto index = static_cast<size_t>(limit);
+  if (index < refusalsByLimit_.size()) refusalsByLimit_[index].fetch_add(1);
+}
+
+std::string UnixServiceListener::RefusalCounts() const {
+  using protocol::LimitCode;
+  return fmt::format(
+      "sessions per connection {}, reporter IDs per message {}, entries per frame {}, "
+      "connections per uid {}, reply backlog {}",
+      RefusalsOver(LimitCode::kSessionsPerConnection),
+      RefusalsOver(LimitCode::kReporterListTooLong), RefusalsOver(LimitCode::kEntriesPerFrame),
+      RefusalsOver(LimitCode::kConnectionsPerUid), RefusalsOver(LimitCode::kReplyBacklog));
 }
 
 void UnixServiceListener::NoteRefusal(const std::string& why) {

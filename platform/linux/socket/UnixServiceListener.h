@@ -1,5 +1,6 @@
 #pragma once
 
+#include <array>
 #include <atomic>
 #include <chrono>
 #include <cstdint>
@@ -93,6 +94,15 @@ class UnixServiceListener final : public ServiceListener {
   protocol::RequestLimits RequestLimits() const;
   // Requests refused for being over a request limit.
   uint64_t LimitRefusals() const { return limitRefusals_.load(std::memory_order_relaxed); }
+  // Refusals counted under each limit of the protocol (requests over the sessions, reporter-list
+  // and entries limits; connections over the per-uid limit; connections cut off for their reply
+  // backlog, their own or the largest over the total).
+  uint64_t RefusalsOver(protocol::LimitCode limit) const {
+    const auto index = static_cast<size_t>(limit);
+    return index < refusalsByLimit_.size() ? refusalsByLimit_[index].load() : 0;
+  }
+  // One line for the log: each limit's refusals by name.
+  std::string RefusalCounts() const;
   // Connections closed on arrival: over the per-uid limit, or into the descriptor reserve.
   uint64_t ConnectionRefusals() const {
     return connectionRefusals_.load(std::memory_order_relaxed);
@@ -121,6 +131,7 @@ class UnixServiceListener final : public ServiceListener {
   void Forget(const std::shared_ptr<UnixClientConnection>& connection);
   // Why a connection from `uid` may not be kept, or nothing when it may. I/O thread.
   std::optional<std::string> RefusalOf(uint32_t uid);
+  void CountRefusal(protocol::LimitCode limit);
   // Counts one refused connection or failed accept, with at most one log line per second.
   void NoteRefusal(const std::string& why);
   // Cuts off the connections with the largest reply backlogs until the total fits. I/O thread.
@@ -150,6 +161,7 @@ class UnixServiceListener final : public ServiceListener {
   std::atomic<uint64_t> sessionsPerConnection_{
       protocol::RequestLimits::kDefaultSessionsPerConnection};
   std::atomic<uint64_t> limitRefusals_{0};
+  std::array<std::atomic<uint64_t>, 6> refusalsByLimit_{};  // by LimitCode
   std::atomic<uint64_t> connectionRefusals_{0};
   std::atomic<uint64_t> backlogCutoffs_{0};
   size_t descriptorLimit_ = 0;         // RLIMIT_NOFILE at Open()
