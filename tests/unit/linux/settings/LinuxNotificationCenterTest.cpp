@@ -1,311 +1,145 @@
 #include "platform/linux/settings/LinuxNotificationCenter.h"
 
-#include <gtest/gtest.h>
 #include <signal.h>
-#include <stdlib.h>
-#include <unistd.h>
 
 #include <asio/executor_work_guard.hpp>
 #include <asio/io_context.hpp>
-#include <chrono>
-#include <condition_variable>
-#include <deque>
 #include <filesystem>
 #include <fstream>
 #include <functional>
 #include <map>
 #include <mutex>
-#include <optional>
+#include <set>
 #include <thread>
-#include <vector>
 
+#include <gtest/gtest.h>
+
+#include "platform/linux/dispatch/AsioDispatcher.h"
 #include "tests/fakes/FakeLogSystem.h"
+#include "tests/unit/linux/LinuxTestSupport.h"
 
 namespace tavrin {
 namespace {
 
 namespace fs = std::filesystem;
-using namespace std::chrono_literals;
+using testing::WaitFor;
+using testing::WriteBytes;
 
-// Generous: other builds share the machine's two cores.
-constexpr auto kEventTimeout = 10s;
-
-template <typename Predicate>
-bool WaitUntil(Predicate predicate) {
-  const auto deadline = std::chrono::steady_clock::now() + kEventTimeout;
-  while (!predicate()) {
-    if (std::chrono::steady_clock::now() > deadline) return false;
-    std::this_thread::sleep_for(1ms);
-  }
-  return true;
-}
-
-// A serial queue on one thread of its own: enough to see handlers arrive on the queue they were
-// registered with.
-class ThreadQueue final : public WorkQueue {
- public:
-  ThreadQueue() : thread_([this] { Run(); }) {}
-  ~ThreadQueue() override {
-    {
-      std::lock_guard lock(mutex_);
-      stopping_ = true;
-    }
-    wake_.notify_all();
-    thread_.join();
-  }
-  void Async(Work work) override {
-    {
-      std::lock_guard lock(mutex_);
-      items_.push_back(std::move(work));
-    }
-    wake_.notify_all();
-  }
-  void AsyncAfter(Duration, Work) override { ADD_FAILURE() << "the center never delays work"; }
-  const std::string& Label() const override { return label_; }
-  QualityOfService Qos() const override { return QualityOfService::kUserInteractive; }
-
-  std::thread::id ThreadId() const { return thread_.get_id(); }
-  // Returns once everything queued before it has run.
-  void Drain() {
-    std::mutex mutex;
-    std::condition_variable done;
-    bool ran = false;
-    Async([&] {
-      std::lock_guard lock(mutex);
-      ran = true;
-      done.notify_all();
-    });
-    std::unique_lock lock(mutex);
-    ASSERT_TRUE(done.wait_for(lock, kEventTimeout, [&] { return ran; }));
-  }
-
- private:
-  void Run() {
-    std::unique_lock lock(mutex_);
-    for (;;) {
-      wake_.wait(lock, [&] { return stopping_ || !items_.empty(); });
-      if (items_.empty()) return;
-      Work work = std::move(items_.front());
-      items_.pop_front();
-      lock.unlock();
-      work();
-      lock.lock();
-    }
-  }
-
-  const std::string label_ = "test.notifications";
-  std::mutex mutex_;
-  std::condition_variable wake_;
-  std::deque<Work> items_;
-  bool stopping_ = false;
-  std::thread thread_;
-};
-
-// Counts handler calls per token and checks they ran on the queue's thread.
-class Calls {
- public:
-  explicit Calls(const ThreadQueue& queue) : queue_(queue) {}
-  NotificationCenter::Handler Handler() {
-    return [this](int token) {
-      std::lock_guard lock(mutex_);
-      ++counts_[token];
-      if (std::this_thread::get_id() != queue_.ThreadId()) ++offQueue_;
-    };
-  }
-  int Count(int token) const {
-    std::lock_guard lock(mutex_);
-    const auto found = counts_.find(token);
-    return found == counts_.end() ? 0 : found->second;
-  }
-  int OffQueue() const {
-    std::lock_guard lock(mutex_);
-    return offQueue_;
-  }
-
- private:
-  const ThreadQueue& queue_;
-  mutable std::mutex mutex_;
-  std::map<int, int> counts_;
-  int offQueue_ = 0;
-};
-
+// The center's watchers on an I/O thread of their own, its handlers on a serial queue of the real
+// dispatcher.
 class LinuxNotificationCenterTest : public ::testing::Test {
  protected:
-  void SetUp() override {
-    std::string pattern = (fs::temp_directory_path() / "tavrin-notify-XXXXXX").string();
-    ASSERT_NE(::mkdtemp(pattern.data()), nullptr);
-    dir_ = pattern;
-    defaultsPath_ = (dir_ / "com.quorvex.tavrin.toml").string();
-    ioThread_ = std::thread([this] { io_.run(); });
-  }
   void TearDown() override {
     center_.reset();
     work_.reset();
     ioThread_.join();  // returns only once the watchers' last completions have run
-    fs::remove_all(dir_);
   }
-
-  int RegisterDefaults() {
+  // A handler that counts its calls, and those that ran off its queue.
+  int Register(const std::string& name) {
     int token = 0;
-    EXPECT_EQ(center_->RegisterNotificationHandler(kDefaultsNotificationName, &token, queue_,
-                                                   calls_.Handler()),
+    EXPECT_EQ(center_->RegisterNotificationHandler(name, &token, *queue_,
+                                                   [this](int token) {
+                                                     std::lock_guard lock(mutex_);
+                                                     ++calls_[token];
+                                                     offQueue_ += !queue_->IsCurrent();
+                                                   }),
               kNotifyStatusOk);
     return token;
   }
-  void WriteFile(const fs::path& path, const std::string& text) {
-    std::ofstream(path, std::ios::trunc) << text;
+  int Calls(int token) {
+    std::lock_guard lock(mutex_);
+    return calls_[token];
   }
-  // Waits until the watcher has read `events` more inotify events than `before`, then until the
-  // queue has run whatever they posted.
-  void SettleAfterEvents(uint64_t before, uint64_t events) {
-    ASSERT_TRUE(WaitUntil([&] { return center_->GetCounters().fileEvents >= before + events; }))
-        << "saw " << center_->GetCounters().fileEvents - before << " of " << events << " events";
-    queue_.Drain();
-  }
+  bool Drained() { return dispatcher_.WaitUntilDrained(testing::kWaitLimit); }
 
+  std::mutex mutex_;
+  std::map<int, int> calls_;  // guarded by mutex_
+  int offQueue_ = 0;          // guarded by mutex_
   asio::io_context io_;
   asio::executor_work_guard<asio::io_context::executor_type> work_ = asio::make_work_guard(io_);
-  std::thread ioThread_;
-  ThreadQueue queue_;
-  Calls calls_{queue_};
+  std::thread ioThread_{[this] { io_.run(); }};
+  AsioDispatcher dispatcher_{1};
+  SerialQueuePtr queue_ = dispatcher_.CreateSerialQueue("notify", QualityOfService::kDefault);
   std::unique_ptr<LinuxNotificationCenter> center_ = std::make_unique<LinuxNotificationCenter>(io_);
-  fs::path dir_;
-  std::string defaultsPath_;
+  testing::TempDir dir_;
+  const std::string path_ = dir_ / "com.quorvex.tavrin.toml";
 };
 
-TEST_F(LinuxNotificationCenterTest, PostsReachEveryHandlerOfTheNameOnItsQueue) {
-  int first = 0, second = 0, other = 0;
-  ASSERT_EQ(center_->RegisterNotificationHandler("a", &first, queue_, calls_.Handler()), 0);
-  ASSERT_EQ(center_->RegisterNotificationHandler("a", &second, queue_, calls_.Handler()), 0);
-  ASSERT_EQ(center_->RegisterNotificationHandler("b", &other, queue_, calls_.Handler()), 0);
-  EXPECT_NE(first, second);
-  EXPECT_NE(first, other);
-  EXPECT_NE(second, other);
-
+TEST_F(LinuxNotificationCenterTest, PostsReachEveryHandlerOfTheNameOnItsQueueUntilCancelled) {
+  const int first = Register("a"), second = Register("a"), other = Register("b");
+  const int cancelled = Register("a"), queuedThenCancelled = Register("a");
+  EXPECT_EQ((std::set{first, second, other, cancelled, queuedThenCancelled}.size()), 5u);
+  center_->Cancel(cancelled);
+  center_->Cancel(12345);  // unknown tokens are ignored
+  queue_->Suspend();       // the posts are queued, not run, when the next cancel comes
   center_->Post("a");
   center_->Post("a");
   center_->Post("nobody listens");
-  queue_.Drain();
-  EXPECT_EQ(calls_.Count(first), 2);
-  EXPECT_EQ(calls_.Count(second), 2);
-  EXPECT_EQ(calls_.Count(other), 0);
-  EXPECT_EQ(calls_.OffQueue(), 0);
-}
-
-TEST_F(LinuxNotificationCenterTest, CancelledRegistrationIsNotCalled) {
-  int kept = 0, cancelled = 0, queuedThenCancelled = 0;
-  ASSERT_EQ(center_->RegisterNotificationHandler("a", &kept, queue_, calls_.Handler()), 0);
-  ASSERT_EQ(center_->RegisterNotificationHandler("a", &cancelled, queue_, calls_.Handler()), 0);
-  ASSERT_EQ(
-      center_->RegisterNotificationHandler("a", &queuedThenCancelled, queue_, calls_.Handler()), 0);
-  center_->Cancel(cancelled);
-  center_->Cancel(12345);  // unknown tokens are ignored
-
-  // Hold the queue so the post is queued but not run when the cancel comes.
-  std::mutex gate;
-  std::unique_lock hold(gate);
-  queue_.Async([&] { std::lock_guard wait(gate); });
-  center_->Post("a");
   center_->Cancel(queuedThenCancelled);
-  hold.unlock();
-  queue_.Drain();
+  queue_->Resume();
+  ASSERT_TRUE(Drained());
+  std::unique_lock lock(mutex_);
+  EXPECT_EQ(calls_, (std::map<int, int>{{first, 2}, {second, 2}}));
+  EXPECT_EQ(offQueue_, 0);
+  lock.unlock();
+  EXPECT_EQ(center_->GetCounters().posts, 3u);
 
-  EXPECT_EQ(calls_.Count(kept), 1);
-  EXPECT_EQ(calls_.Count(cancelled), 0);
-  EXPECT_EQ(calls_.Count(queuedThenCancelled), 0);
+  int token = 0;
+  auto handler = [](int) {};
+  EXPECT_EQ(center_->RegisterNotificationHandler("", &token, *queue_, handler),
+            kNotifyStatusInvalidName);
+  EXPECT_EQ(center_->RegisterNotificationHandler("a", nullptr, *queue_, handler),
+            kNotifyStatusInvalidRequest);
+  EXPECT_EQ(center_->RegisterNotificationHandler("a", &token, *queue_, nullptr),
+            kNotifyStatusInvalidRequest);
 }
 
-TEST_F(LinuxNotificationCenterTest, WritingTheDefaultsFilePosts) {
-  const int token = RegisterDefaults();
-  ASSERT_EQ(center_->WatchDefaults(defaultsPath_), std::nullopt);
-  WriteFile(defaultsPath_, "disable_reporting = true\n");  // created
-  ASSERT_TRUE(WaitUntil([&] { return calls_.Count(token) >= 1; }));
-  const int afterCreate = calls_.Count(token);
-  WriteFile(defaultsPath_, "disable_reporting = false\n");  // rewritten in place
-  ASSERT_TRUE(WaitUntil([&] { return calls_.Count(token) > afterCreate; }));
-  EXPECT_EQ(calls_.OffQueue(), 0);
-}
+TEST_F(LinuxNotificationCenterTest, EveryChangeOfTheDefaultsFileAndHangupPostButNotOtherFiles) {
+  const int token = Register(kDefaultsNotificationName);
+  ASSERT_EQ(center_->WatchDefaults(path_), std::nullopt);
+  // Events about another file of the directory, or a new file whose writer has not finished,
+  // are read and counted without posting.
+  auto eventsSeenWithoutPost = [&](uint64_t events) {
+    return WaitFor([&] { return center_->GetCounters().fileEvents >= events; }) && Drained() &&
+           Calls(token) == 0;
+  };
+  WriteBytes(dir_ / "sibling.toml", "x");  // created and closed
+  EXPECT_TRUE(eventsSeenWithoutPost(2));
+  std::ofstream writer(path_);
+  EXPECT_TRUE(eventsSeenWithoutPost(3));
 
-TEST_F(LinuxNotificationCenterTest, EditorStyleRenameOverTheFilePosts) {
-  WriteFile(defaultsPath_, "device_name = \"old\"\n");
-  const int token = RegisterDefaults();
-  ASSERT_EQ(center_->WatchDefaults(defaultsPath_), std::nullopt);
-  const fs::path temporary = dir_ / ".com.quorvex.tavrin.toml.swp";
-  WriteFile(temporary, "device_name = \"new\"\n");
-  fs::rename(temporary, defaultsPath_);
-  ASSERT_TRUE(WaitUntil([&] { return calls_.Count(token) >= 1; }));
-
-  // The watch survives the file's inode changing: a second save posts again.
-  const int afterFirst = calls_.Count(token);
-  WriteFile(temporary, "device_name = \"newer\"\n");
-  fs::rename(temporary, defaultsPath_);
-  ASSERT_TRUE(WaitUntil([&] { return calls_.Count(token) > afterFirst; }));
-}
-
-TEST_F(LinuxNotificationCenterTest, RemovingTheFilePosts) {
-  WriteFile(defaultsPath_, "disable_reporting = true\n");
-  const int token = RegisterDefaults();
-  ASSERT_EQ(center_->WatchDefaults(defaultsPath_), std::nullopt);
-  fs::remove(defaultsPath_);
-  ASSERT_TRUE(WaitUntil([&] { return calls_.Count(token) >= 1; }));
-
-  // Moving it away is a removal too.
-  WriteFile(defaultsPath_, "x = 1\n");
-  ASSERT_TRUE(WaitUntil([&] { return calls_.Count(token) >= 2; }));
-  const int beforeMove = calls_.Count(token);
-  fs::rename(defaultsPath_, dir_ / "saved.toml");
-  ASSERT_TRUE(WaitUntil([&] { return calls_.Count(token) > beforeMove; }));
-}
-
-TEST_F(LinuxNotificationCenterTest, HangupSignalPosts) {
-  const int token = RegisterDefaults();
-  ASSERT_EQ(center_->WatchDefaults(defaultsPath_), std::nullopt);
-  ASSERT_EQ(::raise(SIGHUP), 0);
-  ASSERT_TRUE(WaitUntil([&] { return calls_.Count(token) >= 1; }));
-  ASSERT_EQ(::kill(::getpid(), SIGHUP), 0);
-  ASSERT_TRUE(WaitUntil([&] { return calls_.Count(token) >= 2; }));
-  EXPECT_EQ(center_->GetCounters().signalsCaught, 2u);
-  EXPECT_EQ(calls_.OffQueue(), 0);
+  const std::string temporary = dir_ / ".swp";
+  const std::pair<const char*, std::function<void()>> steps[] = {
+      {"closed by its writer", [&] { writer << "a = 1\n", writer.close(); }},
+      {"rewritten in place", [&] { WriteBytes(path_, "a = 2\n"); }},
+      {"renamed over", [&] { WriteBytes(temporary, "a = 3\n"), fs::rename(temporary, path_); }},
+      {"renamed over again",
+       [&] { WriteBytes(temporary, "a = 4\n"), fs::rename(temporary, path_); }},
+      {"removed", [&] { fs::remove(path_); }},
+      {"linked in", [&] { fs::create_symlink(dir_ / "sibling.toml", path_); }},
+      {"moved away", [&] { fs::rename(path_, dir_ / "moved.toml"); }},
+      {"SIGHUP", [] { raise(SIGHUP); }},
+  };
+  for (const auto& [what, step] : steps) {
+    const int before = Calls(token);
+    step();
+    EXPECT_TRUE(WaitFor([&] { return Calls(token) > before; })) << what;
+  }
+  EXPECT_EQ(center_->GetCounters().signalsCaught, 1u);
+  std::lock_guard lock(mutex_);
+  EXPECT_EQ(offQueue_, 0);
 }
 
 TEST_F(LinuxNotificationCenterTest, RemovedDirectoryPostsOnceAndIsReported) {
   testing::FakeLogSystem log;
-  const fs::path sub = dir_ / "etc";
-  fs::create_directory(sub);
-  const int token = RegisterDefaults();
-  ASSERT_EQ(center_->WatchFile((sub / "defaults.toml").string(), kDefaultsNotificationName),
-            std::nullopt);
-  fs::remove(sub);
-  ASSERT_TRUE(WaitUntil([&] { return calls_.Count(token) >= 1; }));
-  ASSERT_TRUE(WaitUntil([&] { return log.Count("stopped watching") == 1; }));
-  EXPECT_EQ(log.Matching("stopped watching")[0].level, LogLevel::kError);
-}
-
-TEST_F(LinuxNotificationCenterTest, ConcurrentPostsAndRegistrationsLoseNothing) {
-  constexpr int kPosters = 4;
-  constexpr int kPostsEach = 200;
-  int stable = 0;
-  ASSERT_EQ(center_->RegisterNotificationHandler("a", &stable, queue_, calls_.Handler()), 0);
-  std::atomic<bool> stop{false};
-  std::thread churn([&] {
-    while (!stop.load()) {
-      int token = 0;
-      center_->RegisterNotificationHandler("a", &token, queue_, [](int) {});
-      center_->Cancel(token);
-    }
-  });
-  std::vector<std::thread> posters;
-  for (int i = 0; i < kPosters; ++i) {
-    posters.emplace_back([&] {
-      for (int n = 0; n < kPostsEach; ++n) center_->Post("a");
-    });
-  }
-  for (auto& poster : posters) poster.join();
-  stop = true;
-  churn.join();
-  queue_.Drain();
-  EXPECT_EQ(calls_.Count(stable), kPosters * kPostsEach);
-  EXPECT_EQ(center_->GetCounters().posts, uint64_t(kPosters * kPostsEach));
+  const int token = Register("settings");
+  fs::create_directory(dir_ / "etc");
+  ASSERT_EQ(center_->WatchFile(dir_ / "etc/defaults.toml", "settings"), std::nullopt);
+  fs::remove(dir_ / "etc");
+  ASSERT_TRUE(WaitFor([&] { return log.Count("stopped watching", LogLevel::kError) == 1; }));
+  ASSERT_TRUE(Drained());
+  EXPECT_EQ(Calls(token), 1);
+  EXPECT_TRUE(center_->WatchFile(dir_ / "gone/defaults.toml", "settings").has_value());
 }
 
 }  // namespace
