@@ -160,6 +160,27 @@ TEST_P(DispatcherContractTest, DelayedWorkRunsOnItsQueueNoSoonerThanItsDelay) {
   EXPECT_GE(at_["q30"] - at_["q20"], 10ms);
 }
 
+// Deferred work waits for its delay like delayed work, is counted while it waits, and runs at
+// once when it is asked to (the service asks when it stops); its own expiry then runs nothing.
+TEST_P(DispatcherContractTest, DeferredWorkRunsAtItsDelayOrWhenAskedButOnce) {
+  auto queue = Queue();
+  dispatcher_.AsyncDeferred(*queue, 30ms, Note("d30", queue));
+  ASSERT_TRUE(SeenCount(1));
+  ExpectStartedAfter("d30", 30ms);
+  EXPECT_EQ(dispatcher_.DeferredCount(), 0u);
+
+  dispatcher_.AsyncDeferred(*queue, 500ms, Note("d500", queue));
+  dispatcher_.AsyncDeferred(dispatcher_.BackgroundQueue(), 500ms, Note("g500"));
+  EXPECT_EQ(dispatcher_.DeferredCount(), 2u);
+  EXPECT_EQ(dispatcher_.RunDeferredNow(), 2u);
+  EXPECT_EQ(dispatcher_.DeferredCount(), 0u);
+  ASSERT_TRUE(SeenCount(3));
+  EXPECT_EQ(Seen('d'), (Events{"d30", "d500"}));
+  driver_->Pass(700ms);  // past their own expiry
+  EXPECT_EQ(Seen().size(), 3u);
+  EXPECT_EQ(dispatcher_.RunDeferredNow(), 0u);
+}
+
 // A re-armed timer forgets its earlier arming, a cancelled one fires no more, both can be armed
 // again. Expired with its work already waiting on the (suspended) queue, then re-armed, cancelled
 // or destroyed: that work belongs to an arming that no longer exists and never runs.

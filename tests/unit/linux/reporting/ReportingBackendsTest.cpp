@@ -492,6 +492,20 @@ TEST_F(ReportingBackendsTest, KafkaDropsWhatFindsTheQueueFullOrOutlivesItsTimeAn
   EXPECT_EQ(backend.Stats().dropped, 14u);
 }
 
+// A record over the producer's message size (a summary event of a very long session can be) is
+// refused whole and counted with its size; the records around it go on.
+TEST_F(ReportingBackendsTest, KafkaRefusesARecordOverTheMessageSizeAndCountsIt) {
+  KafkaProducerBackend backend(KafkaOptions());
+  ASSERT_EQ(FlushAnswer(backend), "");
+  EXPECT_FALSE(backend.Append(Event("summary", {{"texts", std::string(1'100'000, '1')}})));
+  EXPECT_TRUE(backend.Append(Event(1)));
+  EXPECT_EQ(backend.DroppedRecords(), 1u);
+  EXPECT_EQ(logs_.Count("bytes is over message.max.bytes", LogLevel::kError), 1u);
+  clock_.Advance(DropReporter::kDropLogInterval);
+  EXPECT_NE(FlushAnswer(backend).find("dropped 1 record(s)"), std::string::npos);
+  EXPECT_EQ(backend.Stats().committed, 1u);
+}
+
 TEST_F(ReportingBackendsTest, KafkaBadSettingLeavesTheBackendDownAndItStillAnswersFlushes) {
   KafkaBackendOptions options = KafkaOptions();
   options.extraConfig.push_back({"no.such.setting", "1"});
