@@ -155,6 +155,11 @@ TEST_F(ServiceDelegateTest, DisabledReportingRefusesMessagesAndHidesOtherClients
   a->service().createReportingSession(7, a->Bool("create"));
   a->service().setServiceType(2, 7, a->Bool("type"));
   Run();
+  // While reporting is enabled, another client's lookup finds the session.
+  std::optional<uint16_t> seen;
+  b->service().getServiceNameForReporterID(7, [&](uint16_t type) { seen = type; });
+  Run();
+  EXPECT_EQ(seen, 2u);
 
   defaults.Set("disable_reporting", true);
   PostDefaults();
