@@ -5,17 +5,21 @@
 
 #include <algorithm>
 #include <chrono>
+#include <condition_variable>
 #include <csignal>
 #include <cstdint>
 #include <cstdio>
 #include <filesystem>
 #include <memory>
+#include <mutex>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include <CLI/CLI.hpp>
 
 #include "Statistics/Service/RuvoReportingServiceDelegate.h"
+#include "Statistics/Service/ServiceWatchdog.h"
 #include "platform/LogSystem.h"
 #include "platform/Platform.h"
 #include "platform/linux/dispatch/AsioDispatcher.h"
@@ -24,6 +28,7 @@
 #include "platform/linux/log/SpdlogLogSystem.h"
 #include "platform/linux/orientation/OrientationRegistries.h"
 #include "platform/linux/process/LinuxProcessInfo.h"
+#include "platform/linux/process/SystemdNotify.h"
 #include "platform/linux/reporting/ReportingBackends.h"
 #include "platform/linux/settings/LinuxNotificationCenter.h"
 #include "platform/linux/settings/TomlDefaultsDomain.h"
@@ -44,6 +49,9 @@ constexpr uint64_t kMaxQueuedWorkItems = 16384;
 // How long a stop waits for queued work: longer than a session's wait for its back-ends (9 s), so
 // that messages queued behind a waiting session are still delivered.
 constexpr std::chrono::seconds kShutdownDrainLimit{10};
+// How long the start waits for a back-end to come up before it tells the service manager it is
+// ready all the same.
+constexpr std::chrono::seconds kReadyWaitLimit{5};
 
 struct Options {
   std::string root;
@@ -290,7 +298,48 @@ int main(int argc, char** argv) {
 
   TLOG_DEFAULT(nullptr, "tavrind listening on {}{}; store in {}", options.socket,
                listener.SocketActivated() ? " (socket activation)" : "", options.stateDir);
+
+  // The service manager hears READY once the socket listens and a back-end is up (or, when none
+  // comes up within a few seconds, ready all the same: it then counts what it drops), and the
+  // watchdog only while the work queue turns.
+  const auto statusLine = [&] {
+    return fmt::format(
+        "serving; {} queued work items, {} held-back messages, store backlog {:.0f}%",
+        dispatcher.QueuedItems(), dispatcher.DeferredCount(), 100 * reporting.BacklogShare());
+  };
+  const auto upBy = std::chrono::steady_clock::now() + kReadyWaitLimit;
+  while (!choices->empty() && !reporting.UpBackends() && std::chrono::steady_clock::now() < upBy) {
+    std::this_thread::sleep_for(std::chrono::milliseconds(10));
+  }
+  systemd_notify::Ready(statusLine());
+  std::mutex watchdogMutex;
+  std::condition_variable watchdogWake;
+  bool stopping = false;
+  std::thread watchdogThread;
+  if (const std::optional<Duration> interval = systemd_notify::WatchdogInterval()) {
+    watchdogThread = std::thread([&, interval = *interval] {
+      pthread_setname_np(pthread_self(), "tavrin-watchdog");
+      ServiceWatchdog watchdog(RuvoReportingServiceDelegate::WorkQueue(), SystemClock(), interval,
+                               systemd_notify::WatchdogPing);
+      std::unique_lock lock(watchdogMutex);
+      do {
+        watchdog.Tick();
+        systemd_notify::Status(statusLine());
+      } while (!watchdogWake.wait_for(lock, interval / 2, [&] { return stopping; }));
+    });
+  }
   listener.Resume();
+
+  if (watchdogThread.joinable()) {
+    {
+      std::lock_guard lock(watchdogMutex);
+      stopping = true;
+    }
+    watchdogWake.notify_all();
+    watchdogThread.join();
+  }
+  systemd_notify::Status("stopping: sending held-back messages and committing the store");
+  systemd_notify::ExtendTimeout(kShutdownDrainLimit + std::chrono::seconds(10));
 
   // Orderly stop: client clean-ups and queued deliveries run, including messages held behind a
   // session that still waits for its back-ends, then the store commits everything it accepted.

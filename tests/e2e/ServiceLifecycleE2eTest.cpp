@@ -4,8 +4,15 @@
 
 #include <gtest/gtest.h>
 
+#include <sys/socket.h>
+#include <sys/time.h>
+#include <sys/un.h>
+
 #include <csignal>
+#include <cstdio>
+#include <cstdlib>
 #include <filesystem>
+#include <functional>
 
 #include "tests/support/StoreFiles.h"
 #include "tests/support/TavrindProcess.h"
@@ -45,6 +52,54 @@ TEST(ServiceLifecycleE2eTest, SigtermSendsTheAlarmsMessagesStillHeldBack) {
             (std::vector<std::vector<std::string>>{{std::to_string(kMessages)}}))
       << service.Log();
   EXPECT_EQ(service.LogCount("held-back single message(s) now"), 1u) << service.Log();
+}
+
+// Under a service manager (a datagram socket standing in for systemd's): READY with a status
+// line once it serves, watchdog pings while it runs, and a longer stop time asked for at SIGTERM.
+TEST(ServiceLifecycleE2eTest, TellsTheServiceManagerItIsReadyAliveAndStopping) {
+  const std::string directory = testing::MakeTempDirectory("tavrin-notify-");
+  const std::string path = directory + "/notify.sock";
+  const int manager = ::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  std::snprintf(address.sun_path, sizeof address.sun_path, "%s", path.c_str());
+  ASSERT_EQ(::bind(manager, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+  const timeval wait{0, 100'000};
+  ::setsockopt(manager, SOL_SOCKET, SO_RCVTIMEO, &wait, sizeof wait);
+  std::string heard;
+  // Collects what the service says until `enough` holds or 20 s pass.
+  auto listen = [&](const std::function<bool()>& enough) {
+    const auto until = std::chrono::steady_clock::now() + std::chrono::seconds(20);
+    char buffer[512];
+    while (!enough() && std::chrono::steady_clock::now() < until) {
+      const ssize_t size = ::recv(manager, buffer, sizeof buffer, 0);
+      if (size > 0) heard += std::string(buffer, size_t(size)) + "\n";
+    }
+  };
+  auto count = [&](const std::string& needle) {
+    size_t n = 0;
+    for (size_t at = heard.find(needle); at != std::string::npos; at = heard.find(needle, at + 1)) {
+      ++n;
+    }
+    return n;
+  };
+
+  TavrindProcess service;
+  ::setenv("NOTIFY_SOCKET", path.c_str(), 1);
+  ::setenv("WATCHDOG_USEC", "200000", 1);
+  const bool started = service.Start();
+  ::unsetenv("NOTIFY_SOCKET");
+  ::unsetenv("WATCHDOG_USEC");
+  ASSERT_TRUE(started) << service.Log();
+  listen([&] { return count("WATCHDOG=1") >= 3; });
+  EXPECT_EQ(count("READY=1\nSTATUS=serving; "), 1u) << heard;
+  EXPECT_GE(count("WATCHDOG=1"), 3u) << heard;
+  EXPECT_GE(count("STATUS=serving; 0 queued work items"), 1u) << heard;
+  ASSERT_EQ(service.Stop(), 0) << service.Log();
+  listen([&] { return count("EXTEND_TIMEOUT_USEC=") > 0; });
+  EXPECT_EQ(count("EXTEND_TIMEOUT_USEC=20000000"), 1u) << heard;
+  ::close(manager);
+  std::filesystem::remove_all(directory);
 }
 
 TEST(ServiceLifecycleE2eTest, SocketActivationServesThePassedSocketAndLeavesItsOwnPathAlone) {
