@@ -1,5 +1,7 @@
 #include "Statistics/Service/RuvoReportingServiceDelegate.h"
 
+#include "Statistics/RuvoReportingUtility.h"
+
 #include <gtest/gtest.h>
 
 #include <chrono>
@@ -264,11 +266,15 @@ TEST_F(ServiceDelegateTest, StopSendsThePositiveDriverDeltaIntoTheSessionFirst) 
   Run();
   ASSERT_EQ(platform.telvoro.Sessions().size(), 1u);
   auto messages = platform.telvoro.Sessions()[0]->Messages();
-  ASSERT_GE(messages.size(), 1u);
+  ASSERT_EQ(messages.size(), 2u) << "the delta, then the summary of the stop";
   EXPECT_EQ(messages[0].category, 9);
   EXPECT_EQ(messages[0].type, 0);
   EXPECT_EQ(messages[0].payload, (Dictionary{{"Speaker_xruns", 3}}));
+  EXPECT_EQ(messages[1].type, kSummaryEventType);  // the category reaches it masked to 16 bits
   EXPECT_EQ(log.Count("fetching driver logs {\"Speaker_xruns\":3}"), 1u);
+  RuvoReportingSessionPtr session = delegate->findReportingSessionForID(7);
+  ASSERT_TRUE(session);
+  EXPECT_FALSE(session->started());
 }
 
 TEST_F(ServiceDelegateTest, DisconnectStopsRunningSessionsAndRemovesTheClientOnce) {
