@@ -307,6 +307,28 @@ TEST(IsolationLimitsE2eTest, ConnectionCrowdsAreCutAtThePerUidLimitAndTheDescrip
   }
 }
 
+// One client that never reads its replies is cut off at its own backlog bound (a setting), with
+// a line naming it; the service and another client go on.
+TEST(IsolationLimitsE2eTest, AClientThatNeverReadsIsCutOffAtItsOwnBacklogBound) {
+  TavrindProcess service;
+  testing::WriteFileAtomically(service.DefaultsPath(),
+                               "[limits]\nreply_bytes_per_connection = 65536\n");
+  ASSERT_TRUE(service.Start()) << service.Log();
+  TestClient silent(service.SocketPath());
+  for (int64_t id = 1; id <= 1000; ++id) {
+    silent.SendNoReply(protocol::CreateReportingSession{(int64_t{1} << 40) + id});
+  }
+  // Each reply lists 1,000 IDs of nine bytes: 200 of them are far more than the socket buffers.
+  for (uint64_t call = 1; call <= 200; ++call) silent.Send(call, protocol::GetAllReporters{});
+  EXPECT_TRUE(service.WaitForLog("bytes of replies not read")) << service.Log();
+  EXPECT_TRUE(silent.WaitForClose(std::chrono::seconds(10)));
+  TestClient other(service.SocketPath());
+  other.Send(1, protocol::GetAllReporters{});
+  EXPECT_TRUE(other.Read());
+  EXPECT_EQ(service.Stop(), 0);
+  EXPECT_EQ(service.LogCount("reply backlog 1"), 1u) << service.Log();
+}
+
 // Clients that send requests and never read their replies once took the service to 2.8 GB and
 // SIGABRT. Each backlog is bounded, and so is their total: the largest backlogs are cut off. The
 // total is lowered here to 1 MiB so that 200 silent clients overrun it

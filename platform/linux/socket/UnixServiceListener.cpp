@@ -281,7 +281,6 @@ class UnixClientConnection final : public ClientConnection,
                  pendingBytes_);
       listener_.backlogCutoffs_.fetch_add(1, std::memory_order_relaxed);
       listener_.CountRefusal(protocol::LimitCode::kReplyBacklog);
-      listener_.CountRefusal(protocol::LimitCode::kReplyBacklog);
       End(/*abnormal=*/true, "replies not read");
       return;
     }
