@@ -52,6 +52,7 @@ TEST(ServiceLifecycleE2eTest, SigtermSendsTheAlarmsMessagesStillHeldBack) {
             (std::vector<std::vector<std::string>>{{std::to_string(kMessages)}}))
       << service.Log();
   EXPECT_EQ(service.LogCount("held-back single message(s) now"), 1u) << service.Log();
+  EXPECT_EQ(service.LogCount("still queued"), 0u) << "an orderly stop drained everything";
 }
 
 // Under a service manager (a datagram socket standing in for systemd's): READY with a status
