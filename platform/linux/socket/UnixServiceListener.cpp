@@ -231,7 +231,7 @@ class UnixClientConnection final : public ClientConnection,
       }
       return true;
     }
-    if (!TrackSessions(request, listener_.RequestLimits().sessionsPerConnection)) return true;
+    if (!TrackSessions(request)) return true;
     std::shared_ptr<RuvoReportingServiceProtocol> object = object_;
     if (!object) return true;
     std::weak_ptr<UnixClientConnection> weakSelf = weak_from_this();
@@ -254,9 +254,10 @@ class UnixClientConnection final : public ClientConnection,
   // Keeps the reporter IDs this connection's sessions live under, as the service's session map
   // for the client does: creating adds or replaces, destroying removes (ID 0 is never removed).
   // False when a new session would be over the limit; it has been refused then.
-  bool TrackSessions(const protocol::Request& request, uint64_t limit) {
+  bool TrackSessions(const protocol::Request& request) {
     if (const auto* create = std::get_if<protocol::CreateReportingSession>(&request.arguments)) {
-      if (!sessionIDs_.contains(create->reporterID) && sessionIDs_.size() >= limit) {
+      if (!sessionIDs_.contains(create->reporterID) &&
+          sessionIDs_.size() >= listener_.sessionsPerConnection_.load(std::memory_order_relaxed)) {
         RefuseOverLimit({protocol::RequestError::Kind::kOverLimit, request.call,
                          protocol::RejectCode::kUnknownOp,
                          fmt::format("this connection already has {} sessions, the most it may "
