@@ -2,6 +2,7 @@
 
 #include <cstddef>
 #include <map>
+#include <memory>
 #include <mutex>
 #include <optional>
 #include <string>
@@ -25,9 +26,18 @@ class FakeFileSystem final : public FileSystem {
   static constexpr int64_t kIsADirectory = 21;   // EISDIR
 
   OptionalError CreateDirectories(const std::string& path, unsigned mode) override;
-  OptionalError WriteFileAtomically(const std::string& path, std::string_view contents) override;
+  // The file appears whole at Commit, which is where write errors are reported.
+  std::unique_ptr<WritableFile> BeginAtomicWrite(const std::string& path,
+                                                 OptionalError* error) override;
+  std::unique_ptr<WritableFile> OpenForAppend(const std::string& path, unsigned mode,
+                                              OptionalError* error) override;
+  // Reads the file as it was when opened.
+  std::unique_ptr<ReadableFile> OpenForReading(const std::string& path,
+                                               OptionalError* error) override;
+  OptionalError RemoveFile(const std::string& path) override;
+  std::vector<std::string> ListFiles(const std::string& path) override;
 
-  // Every CreateDirectories or WriteFileAtomically call fails with `error` while it is set (and
+  // Every CreateDirectories call, or every committed write, fails with `error` while it is set (and
   // changes nothing).
   void FailCreateDirectories(OptionalError error);
   void FailWrites(OptionalError error);
@@ -47,7 +57,10 @@ class FakeFileSystem final : public FileSystem {
   static std::string Normalize(std::string_view path);
 
  private:
+  class Writer;
   void AddDirectoryLocked(const std::string& path, unsigned mode);
+  // Checks a write of `path` and records the call.
+  OptionalError CheckWriteLocked(const std::string& path);
 
   mutable std::mutex mutex_;
   std::map<std::string, std::string> files_;                   // guarded by mutex_
