@@ -19,6 +19,9 @@ inline constexpr const char* kTelvoroSessionInfoSessionID = "SessionID";
 inline constexpr const char* kTelvoroSessionInfoBatchEvent = "BatchEvent";
 inline constexpr const char* kTelvoroSessionInfoHierarchyToken = "HierarchyToken";
 inline constexpr const char* kTelvoroSessionInfoContainsRealtimeEvents = "ContainsRealtimeEvents";
+// True for the session of a summary sent on a later start, from what a session that was open
+// when the service ended had spooled.
+inline constexpr const char* kTelvoroSessionInfoRecovered = "Recovered";
 inline constexpr const char* kTelvoroUserInfoClientName = "ClientName";
 inline constexpr const char* kTelvoroUserInfoServiceName = "ServiceName";
 

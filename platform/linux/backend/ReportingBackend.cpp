@@ -14,7 +14,8 @@ struct JsonOf {
                  {"session_info", r.sessionInfo},
                  {"user_info", r.userInfo},
                  {"created_at", r.createdAt},
-                 {"flushed_at", r.flushedAt ? Value(*r.flushedAt) : Value(nullptr)}};
+                 {"flushed_at", r.flushedAt ? Value(*r.flushedAt) : Value(nullptr)},
+                 {"recovered", r.recovered}};
   }
   Value operator()(const SessionMessageRecord& r) const {
     return Value{{"session_row", r.sessionRow}, {"reporter_id", OptionalNumber(r.reporterId)},

@@ -29,6 +29,9 @@ struct SessionRecord {
   Dictionary userInfo;
   double createdAt = 0;
   std::optional<double> flushedAt;
+  // Session info "Recovered" is true: the session only carries the summary of a session that was
+  // open when an earlier run of the service ended.
+  bool recovered = false;
 };
 
 // One row of `session_messages`.

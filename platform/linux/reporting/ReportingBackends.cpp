@@ -33,6 +33,12 @@ std::optional<int64_t> ReporterIdOf(const Dictionary& sessionInfo) {
   return std::nullopt;
 }
 
+bool IsRecovered(const Dictionary& sessionInfo) {
+  if (!sessionInfo.is_object()) return false;
+  const auto found = sessionInfo.find(kTelvoroSessionInfoRecovered);
+  return found != sessionInfo.end() && found->is_boolean() && found->get<bool>();
+}
+
 double Seconds(const Clock& clock) { return SecondsSinceEpoch(clock.WallNow()); }
 
 }  // namespace
@@ -198,7 +204,8 @@ TelvoroSessionPtr BackendReportingService::CreateTelvoroSession(const Dictionary
                        sessionInfo,
                        userInfo,
                        Seconds(clock_),
-                       std::nullopt};
+                       std::nullopt,
+                       IsRecovered(sessionInfo)};
   Deliver(std::make_shared<const ReportRecord>(record));
   return std::make_shared<Session>(*this, std::move(record));
 }

@@ -35,7 +35,8 @@ bool NeedsReopen(int rc) {
 
 constexpr const char* kSchema = R"sql(
 CREATE TABLE IF NOT EXISTS sessions(row INTEGER PRIMARY KEY, reporter_id INTEGER,
-  session_info TEXT, user_info TEXT, created_at REAL, flushed_at REAL);
+  session_info TEXT, user_info TEXT, created_at REAL, flushed_at REAL,
+  recovered INTEGER NOT NULL DEFAULT 0);
 CREATE TABLE IF NOT EXISTS session_messages(row INTEGER PRIMARY KEY, session_row INTEGER,
   reporter_id INTEGER, category INTEGER, type INTEGER, payload TEXT, received_at REAL);
 CREATE TABLE IF NOT EXISTS single_messages(row INTEGER PRIMARY KEY, session_info TEXT,
@@ -46,10 +47,13 @@ CREATE TABLE IF NOT EXISTS power_events(row INTEGER PRIMARY KEY, agent INTEGER, 
   payload TEXT, received_at REAL);
 )sql";
 
+constexpr const char* kAddRecoveredColumn =
+    "ALTER TABLE sessions ADD COLUMN recovered INTEGER NOT NULL DEFAULT 0";
+
 // A session's row is handed over twice: at creation, and with flushed_at when it is flushed.
 constexpr const char* kInsertSession =
-    "INSERT INTO sessions(row, reporter_id, session_info, user_info, created_at, flushed_at) "
-    "VALUES(?1, ?2, ?3, ?4, ?5, ?6) "
+    "INSERT INTO sessions(row, reporter_id, session_info, user_info, created_at, flushed_at, "
+    "recovered) VALUES(?1, ?2, ?3, ?4, ?5, ?6, ?7) "
     "ON CONFLICT(row) DO UPDATE SET flushed_at = excluded.flushed_at";
 constexpr const char* kInsertSessionMessage =
     "INSERT INTO session_messages(session_row, reporter_id, category, type, payload, "
@@ -237,6 +241,9 @@ int SqliteStore::OpenDatabase(std::string* reason) {
   if (rc != SQLITE_OK) return failed(rc);
   rc = sqlite3_exec(db_, kSchema, nullptr, nullptr, nullptr);
   if (rc != SQLITE_OK) return failed(rc);
+  // Stores made before sessions could be recovered lack the column; SQLite has no
+  // "ADD COLUMN IF NOT EXISTS", so the duplicate-column error is the "already there" answer.
+  sqlite3_exec(db_, kAddRecoveredColumn, nullptr, nullptr, nullptr);
 
   rc = sqlite3_prepare_v2(db_, "SELECT COALESCE(MAX(row), 0) FROM sessions", -1, &statement,
                           nullptr);
@@ -483,6 +490,7 @@ int SqliteStore::WriteRecord(const ReportRecord& record) {
     } else {
       sqlite3_bind_null(insertSession_, 6);
     }
+    sqlite3_bind_int(insertSession_, 7, r->recovered ? 1 : 0);
     return Step(insertSession_);
   }
   if (const auto* r = std::get_if<SingleMessageRecord>(&record)) {

@@ -6,7 +6,8 @@
 // Tables (a contract; columns may be added, never changed). JSON columns hold dictionaries as
 // JSON text; times are seconds since the epoch:
 //   sessions(row INTEGER PRIMARY KEY, reporter_id INTEGER, session_info TEXT, user_info TEXT,
-//            created_at REAL, flushed_at REAL)
+//            created_at REAL, flushed_at REAL, recovered INTEGER: 1 for the session of a summary
+//            sent on a later start for a session that was open when the service ended)
 //   session_messages(row INTEGER PRIMARY KEY, session_row INTEGER, reporter_id INTEGER,
 //                    category INTEGER, type INTEGER, payload TEXT, received_at REAL)
 //   single_messages(row INTEGER PRIMARY KEY, session_info TEXT, user_info TEXT,

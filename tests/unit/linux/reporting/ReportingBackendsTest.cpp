@@ -238,8 +238,8 @@ TEST_F(ReportingBackendsTest, StoreEachRecordLandsInTheColumnsOfItsTable) {
   SqliteStore store(StoreOptions());
   const Dictionary big = {{"t", 1ull << 63}}, json = {{"k", {1, "v"}}};
   for (const auto& record :
-       {Record(SessionRecord{7, 42, big, json, 1000.25, std::nullopt}),
-        Record(SessionRecord{7, 42, big, json, 1000.25, 1010.5}),
+       {Record(SessionRecord{7, 42, big, json, 1000.25, std::nullopt, true}),
+        Record(SessionRecord{7, 42, big, json, 1000.25, 1010.5, true}),
         Record(SessionMessageRecord{7, 42, 0xFFFF, 3, json, 1001.5}),
         Record(SessionMessageRecord{8, std::nullopt, 1, 1, json, 1005}),
         Record(SingleMessageRecord{big, json, 2, 1, json, 1002.75}), Event("Session.Start", json),
@@ -257,13 +257,13 @@ TEST_F(ReportingBackendsTest, StoreEachRecordLandsInTheColumnsOfItsTable) {
                    "session_messages|row INTEGER, session_row INTEGER, reporter_id INTEGER, "
                    "category INTEGER, type INTEGER, payload TEXT, received_at REAL",
                    "sessions|row INTEGER, reporter_id INTEGER, session_info TEXT, user_info TEXT, "
-                   "created_at REAL, flushed_at REAL",
+                   "created_at REAL, flushed_at REAL, recovered INTEGER",
                    "single_messages|row INTEGER, session_info TEXT, user_info TEXT, category "
                    "INTEGER, type INTEGER, payload TEXT, received_at REAL"}));
   // Dictionaries as compact JSON text, the 64-bit value unchanged.
   const std::string b = JsonText(big), j = JsonText(json);
   EXPECT_EQ(reader.Query("SELECT * FROM sessions"),
-            Lines{"7|42|" + b + "|" + j + "|1000.25|1010.5"});
+            Lines{"7|42|" + b + "|" + j + "|1000.25|1010.5|1"});
   EXPECT_EQ(reader.Query("SELECT * FROM session_messages"),
             (Lines{"1|7|42|65535|3|" + j + "|1001.5", "2|8|NULL|1|1|" + j + "|1005.0"}));
   EXPECT_EQ(reader.Query("SELECT * FROM single_messages"),
@@ -412,7 +412,7 @@ TEST_F(ReportingBackendsTest, KafkaRecordsArriveAsJsonOnTheirTopicsAndTheFlushAn
   const Dictionary payload = {{"list", {1, "two"}}};
   const std::pair<ReportRecord, std::string> records[] = {
       {SessionRecord{3, -7, info, {{"ClientName", "c"}}, 100.5, std::nullopt},
-       R"(sessions -7 {"row":3,"reporter_id":-7,"session_info":{"SessionID":-7,"HierarchyToken":18446744073709551615},"user_info":{"ClientName":"c"},"created_at":100.5,"flushed_at":null})"},
+       R"(sessions -7 {"row":3,"reporter_id":-7,"session_info":{"SessionID":-7,"HierarchyToken":18446744073709551615},"user_info":{"ClientName":"c"},"created_at":100.5,"flushed_at":null,"recovered":false})"},
       {SessionMessageRecord{3, -7, 258, 9, payload, 101.25},
        R"(session_messages -7 {"session_row":3,"reporter_id":-7,"category":258,"type":9,"payload":{"list":[1,"two"]},"received_at":101.25})"},
       {SingleMessageRecord{{{"SessionID", -1}}, {{"ServiceName", "alarms"}}, 1, 2, payload, 102},
