@@ -44,6 +44,8 @@ struct PlatformServices {
   DefaultsDomain* defaults = nullptr;
   // Summary files go to "<diagnosticDirectory>/Audio/Reporting".
   std::string diagnosticDirectory = "/var/log/tavrin/DiagnosticLogs";
+  // Started sessions spool what they gather here ("<state-dir>/spool").
+  std::string spoolDirectory = "/var/lib/tavrin/spool";
   // The device's "InternalBuild" fact, asked of `deviceInfo` once and kept: a build does not
   // change while the service runs. Shared by copies of the context.
   std::shared_ptr<DeviceFactOnce> internalBuild = std::make_shared<DeviceFactOnce>();

@@ -17,6 +17,8 @@ namespace {
 constexpr const char* kSummaryEventKey = "Ruvo_Session_Summary_Event";
 constexpr const char* kHostApplicationKey = "HostApplicationDisplayID";
 constexpr const char* kSummaryDirectory = "/Audio/Reporting";
+// Ends the name of a summary file written for a recovered session, before ".json".
+constexpr const char* kRecoveredFileMark = "-recovered";
 // Never world-writable: on a shared machine that would let any local user forge or delete
 // summaries. The service's group may read them.
 constexpr unsigned kSummaryDirectoryMode = 0750;
@@ -83,6 +85,35 @@ std::string SummaryFileTime(WallTime now) {
   return std::string(text, length);
 }
 
+// One element of the summary file as pretty printing puts it inside the top-level array: indented
+// by one level, without its separator. Throws for text that is not UTF-8.
+std::string SummaryFileElement(Value element) {
+  Value wrapper = Value::array();
+  wrapper.push_back(std::move(element));
+  // Strict: invalid UTF-8 in a client's string is an error here, not silently replaced.
+  const std::string text =
+      wrapper.dump(kSummaryJsonIndent, ' ', false, Value::error_handler_t::strict);
+  // "[\n" + element + "\n]"
+  return text.substr(2, text.size() - 4);
+}
+
+// The entry of one spooled message in the summary file: {message id: payload}.
+Value MessageEntry(const Value& record) {
+  Value entry = MakeDictionary();
+  entry[record[1].get<std::string>()] = record[2];
+  return entry;
+}
+
+bool IsMessageRecord(const Value& record) {
+  return record.size() == 3 && record[0] == "m" && record[1].is_string();
+}
+
+// The kind of a message id "<category>_<type>_<n>": what its count is kept under.
+std::string MessageKind(const std::string& messageId) {
+  const size_t last = messageId.rfind('_');
+  return last == std::string::npos ? messageId : messageId.substr(0, last);
+}
+
 // A name part of a file name must not leave the directory.
 std::string FileNamePart(std::string text) {
   for (char& c : text) {
@@ -92,14 +123,6 @@ std::string FileNamePart(std::string text) {
 }
 
 }  // namespace
-
-Value NestedPayloadEntry::ToValue() const {
-  const Value& value = payload ? *payload : Value();
-  if (!messageId) return value;
-  Value entry = MakeDictionary();
-  entry[*messageId] = value;
-  return entry;
-}
 
 struct RuvoReportingSession::BackendWait {
   std::mutex mutex;
@@ -135,7 +158,6 @@ RuvoReportingSession::RuvoReportingSession(int64_t reporterID,
       userInfo_(MakeDictionary()),
       serviceName_("unknown"),
       summaryTexts_(std::make_shared<SummaryTexts>()),
-      nestedAggregatedPayloadData_(std::make_shared<NestedPayloadList>()),
       messageTypeCounts_(MakeDictionary()) {
   TLOG_INFO(SessionLog(), "created reporting session for ID: {}", reporterID_);
   EmitTracePoint(trace::kSessionCreated);
@@ -149,9 +171,14 @@ RuvoReportingSession::~RuvoReportingSession() {
 void RuvoReportingSession::setServiceType(uint16_t serviceType) {
   serviceType_.store(serviceType, std::memory_order_release);
   std::optional<std::string> name = ServiceTypeName(serviceType);
+  std::shared_ptr<SessionSpool> running;
   {
     std::lock_guard lock(propertyMutex_);
     serviceName_ = name;
+    running = spool_;
+  }
+  if (running) {
+    telvoroQueue_->Async([running, serviceType] { running->AppendServiceType(serviceType); });
   }
   TLOG_INFO(SessionLog(), "setting service type {}", NameText(name));
 }
@@ -163,8 +190,20 @@ void RuvoReportingSession::setConfiguration(const Dictionary& configuration) {
                JsonText(configuration));
     return;
   }
-  std::lock_guard lock(propertyMutex_);
-  for (const auto& item : configuration.items()) userInfo_[item.key()] = item.value();
+  std::shared_ptr<SessionSpool> running;
+  Dictionary info;
+  {
+    std::lock_guard lock(propertyMutex_);
+    for (const auto& item : configuration.items()) userInfo_[item.key()] = item.value();
+    running = spool_;
+    if (running) info = userInfo_;
+  }
+  if (running) spoolUserInfo(running, std::move(info));
+}
+
+void RuvoReportingSession::spoolUserInfo(const std::shared_ptr<SessionSpool>& running,
+                                         Dictionary info) {
+  telvoroQueue_->Async([running, info = std::move(info)] { running->AppendUserInfo(info); });
 }
 
 void RuvoReportingSession::updateDefaults(const Dictionary& defaults) {
@@ -178,10 +217,15 @@ void RuvoReportingSession::start() {
     return;
   }
   started_.store(true, std::memory_order_release);
+  const int64_t startedAt = std::chrono::duration_cast<std::chrono::nanoseconds>(
+                                platform_.dispatcher->GetClock().WallNow().time_since_epoch())
+                                .count();
+  auto spool =
+      SessionSpool::Create(*platform_.fileSystem, platform_.spoolDirectory, reporterID_, startedAt);
   {
     std::lock_guard lock(propertyMutex_);
-    summaryTexts_ = std::make_shared<SummaryTexts>();
-    nestedAggregatedPayloadData_ = std::make_shared<NestedPayloadList>();
+    summaryTexts_ = std::make_shared<SummaryTexts>(spool);
+    spool_ = spool;
   }
   EmitTracePoint(trace::kSessionStarted);
 
@@ -190,7 +234,9 @@ void RuvoReportingSession::start() {
   // The user info is read when the queued step runs, so configuration given meanwhile counts.
   std::optional<std::string> name = serviceName();
   const uint16_t type = serviceType();
-  telvoroQueue_->Async([self = shared_from_this(), name = std::move(name), type] {
+  telvoroQueue_->Async([self = shared_from_this(), spool = std::move(spool),
+                        counts = messageTypeCounts(), name = std::move(name), type] {
+    spool->AppendHeader(self->reporterID_, type, self->userInfo(), counts);
     self->createTelvoroSessionOnQueue(name, type);
   });
 }
@@ -216,6 +262,7 @@ void RuvoReportingSession::createTelvoroSessionOnQueue(
   sessionInfo[kTelvoroSessionInfoBatchEvent] = serviceType != service_type::kApiUsage;
   sessionInfo[kTelvoroSessionInfoHierarchyToken] = token ? Value(token->value) : Value();
   sessionInfo[kTelvoroSessionInfoContainsRealtimeEvents] = serviceType == service_type::kApiUsage;
+  if (recovered_) sessionInfo[kTelvoroSessionInfoRecovered] = true;
 
   Dictionary telvoroUserInfo = MakeDictionary();
   telvoroUserInfo[kTelvoroUserInfoClientName] = kClientName;
@@ -304,17 +351,16 @@ void RuvoReportingSession::stop() {
   // event, the file and the flush then run on the session's own queue, behind every message
   // already queued there, so no other client's request waits for them.
   std::shared_ptr<SummaryTexts> texts;
-  std::shared_ptr<NestedPayloadList> nested;
+  std::shared_ptr<SessionSpool> spool;
+  std::vector<Dictionary> leading;
   {
-    std::shared_ptr<NestedPayloadList> list = nestedAggregatedPayloadData();
-    std::unique_lock<std::recursive_mutex> listLock;
-    if (list) listLock = std::unique_lock(list->mutex);
     std::lock_guard lock(propertyMutex_);
     texts = std::move(summaryTexts_);
-    nested = std::move(nestedAggregatedPayloadData_);
+    spool = std::move(spool_);
+    leading = std::exchange(leadingEntries_, {});
+    leading.insert(leading.begin(), userInfo_);
   }
   const uint16_t stoppedServiceType = serviceType();
-  Dictionary stoppedUserInfo = userInfo();
   const WallTime stoppedAt = platform_.dispatcher->GetClock().WallNow();
   // The summary is a message of the session too: it takes its message id in order with the
   // messages sent before the stop, and is the last entry of the summary file.
@@ -324,31 +370,42 @@ void RuvoReportingSession::stop() {
   started_.store(false, std::memory_order_release);
 
   telvoroQueue_->Async([self = shared_from_this(), texts = std::move(texts),
-                        nested = std::move(nested), stoppedServiceType,
-                        stoppedUserInfo = std::move(stoppedUserInfo), stoppedAt, hasSummary,
-                        summaryId = std::move(summaryId)] {
+                        spool = std::move(spool), leading = std::move(leading), stoppedServiceType,
+                        stoppedAt, hasSummary, summaryId = std::move(summaryId)] {
     TLOG_OPERATION("stop");
+    Value lastEntry;
     if (hasSummary) {
       if (std::optional<Dictionary> summary = texts->Summary(stoppedServiceType)) {
         TLOG_DEFAULT(SessionLog(), "sending summary event for reporter {}", self->reporterID_);
         EmitTracePoint(trace::kMessageSent);
         bool changed = false;
         auto cleaned = std::make_shared<const Dictionary>(CleanedPayload(*summary, &changed));
-        if (nested && IsInternalBuild(self->platform_)) {
-          std::lock_guard lock(nested->mutex);
-          nested->items.push_back(NestedPayloadEntry{summaryId, cleaned});
-        }
+        lastEntry = MakeDictionary();
+        lastEntry[summaryId] = *cleaned;
         self->deliver(cleaned, cleaned, kSummaryEventCategory, kSummaryEventType,
                       /*startedAtSend=*/true);
       }
     }
-    self->writeSummaryFile(nested, stoppedUserInfo, stoppedServiceType, stoppedAt);
-    if (self->serviceType() != service_type::kTest) {
-      if (TelvoroSessionPtr session = self->telvoroSession()) {
-        session->FlushMessages([](const OptionalError& error) {
-          if (error) TLOG_ERROR(SessionLog(), "flush error {}", error->LocalizedDescription());
-        });
-      }
+    self->writeSummaryFile(spool, leading, stoppedServiceType, stoppedAt,
+                           lastEntry.is_null() ? nullptr : &lastEntry);
+    // The spool goes once the summary is committed: until then a crash still has it to recover
+    // from.
+    TelvoroSessionPtr session =
+        self->serviceType() != service_type::kTest ? self->telvoroSession() : nullptr;
+    if (session && spool) {
+      session->FlushMessages([spool](const OptionalError& error) {
+        if (error) {
+          TLOG_ERROR(SessionLog(), "flush error {}", error->LocalizedDescription());
+          return;
+        }
+        spool->Remove();
+      });
+    } else if (session) {
+      session->FlushMessages([](const OptionalError& error) {
+        if (error) TLOG_ERROR(SessionLog(), "flush error {}", error->LocalizedDescription());
+      });
+    } else if (spool) {
+      spool->Remove();
     }
     self->setTelvoroSession(nullptr);
   });
@@ -370,14 +427,24 @@ void RuvoReportingSession::sendMessage(const Dictionary& payload, uint32_t categ
                             ? std::make_shared<const Dictionary>(payload)
                             : cleaned;
   std::string messageId = messageIdForCategory(category, type);
-  appendAggregated(*cleaned);
-  if (IsInternalBuild(platform_)) appendNested(NestedPayloadEntry{std::move(messageId), cleaned});
+  std::shared_ptr<SummaryTexts> texts;
+  std::shared_ptr<SessionSpool> spool;
+  {
+    std::lock_guard lock(propertyMutex_);
+    texts = summaryTexts_;
+    spool = spool_;
+  }
+  if (texts) texts->Add(*cleaned);
   EmitTracePoint(trace::kMessageSent);
 
-  // The state at send time decides the road, even if stop runs before delivery.
+  // The state at send time decides the road, even if stop runs before delivery. The message
+  // reaches the spool before the back-ends, so whatever they commit a crash can recover.
   const bool startedAtSend = started();
+  if (!startedAtSend) spool.reset();
   telvoroQueue_->Async([self = shared_from_this(), cleaned = std::move(cleaned),
-                        received = std::move(received), category, type, startedAtSend] {
+                        received = std::move(received), messageId = std::move(messageId),
+                        spool = std::move(spool), category, type, startedAtSend] {
+    if (spool) spool->AppendMessage(messageId, *cleaned);
     self->deliver(cleaned, received, category, type, startedAtSend);
   });
   if (reply) reply(std::nullopt);
@@ -428,6 +495,8 @@ void RuvoReportingSession::appendAggregated(const Dictionary& payload) {
   if (std::shared_ptr<SummaryTexts> texts = summaryTexts()) texts->Add(payload);
 }
 
+SummaryTexts::SummaryTexts(std::shared_ptr<SessionSpool> spool) : spool_(std::move(spool)) {}
+
 void SummaryTexts::Add(const Dictionary& payload) {
   std::lock_guard lock(mutex_);
   if (texts_.empty()) {
@@ -438,15 +507,21 @@ void SummaryTexts::Add(const Dictionary& payload) {
   if (!payload.is_object()) return;
   for (const auto& item : payload.items()) {
     auto [slot, added] = indexOfKey_.try_emplace(item.key(), texts_.size());
+    const size_t index = slot->second;
     if (added) {
       texts_.emplace_back(item.key(), ValueText(item.value()));
-      continue;
+    } else {
+      // The summary key's text gets the service type in front at the end, so its values too
+      // each follow a ",".
+      std::string& text = texts_[index].second;
+      text += ',';
+      text += ValueText(item.value());
     }
-    // The summary key's text gets the service type in front at the end, so its values too each
-    // follow a ",".
-    std::string& text = texts_[slot->second].second;
-    text += ',';
-    text += ValueText(item.value());
+    std::string& text = texts_[index].second;
+    if (spool_ && text.size() > kSpillBytes && spool_->AppendTextPiece(index, text)) {
+      text = std::string();
+      spilled_ = true;
+    }
   }
 }
 
@@ -458,21 +533,26 @@ size_t SummaryTexts::payloadCount() const {
 std::optional<Dictionary> SummaryTexts::Summary(uint16_t serviceType) const {
   std::lock_guard lock(mutex_);
   if (payloadCount_ == 0) return std::nullopt;
+  // Spilled pieces come first: a key's text is its pieces in spool order, then what is in memory.
+  std::vector<std::string> pieces(texts_.size());
+  if (spilled_) {
+    OptionalError error = spool_->Replay([&](const Value& record) {
+      if (record.size() == 3 && record[0] == "k" && record[1].is_number_unsigned() &&
+          record[2].is_string() && record[1].get<size_t>() < pieces.size()) {
+        pieces[record[1].get<size_t>()] += record[2].get_ref<const std::string&>();
+      }
+    });
+    if (error) {
+      TLOG_ERROR(RuvoReportingSession::SessionLog(), "summary texts: {}",
+                 error->LocalizedDescription());
+    }
+  }
   Dictionary summary = MakeDictionary();
   for (size_t i = 0; i < texts_.size(); ++i) {
-    summary[texts_[i].first] =
-        i == 0 ? std::to_string(serviceType) + texts_[i].second : texts_[i].second;
+    std::string text = std::move(pieces[i]) + texts_[i].second;
+    summary[texts_[i].first] = i == 0 ? std::to_string(serviceType) + text : std::move(text);
   }
   return summary;
-}
-
-void RuvoReportingSession::appendNested(NestedPayloadEntry entry) {
-  std::shared_ptr<NestedPayloadList> locked = nestedAggregatedPayloadData();
-  std::unique_lock<std::recursive_mutex> lock;
-  if (locked) lock = std::unique_lock(locked->mutex);
-  if (std::shared_ptr<NestedPayloadList> list = nestedAggregatedPayloadData()) {
-    list->items.push_back(std::move(entry));
-  }
 }
 
 std::optional<Dictionary> RuvoReportingSession::createSummaryEventForSession() {
@@ -482,39 +562,31 @@ std::optional<Dictionary> RuvoReportingSession::createSummaryEventForSession() {
 }
 
 void RuvoReportingSession::writeSummaryJson() {
-  writeSummaryFile(nestedAggregatedPayloadData(), userInfo(), serviceType(),
-                   platform_.dispatcher->GetClock().WallNow());
+  std::vector<Dictionary> leading;
+  std::shared_ptr<SessionSpool> spool;
+  {
+    std::lock_guard lock(propertyMutex_);
+    spool = spool_;
+    // The user info goes first only into a list that has entries.
+    if (leadingEntries_.empty() && !(spool && spool->messageCount() > 0)) return;
+    leadingEntries_.insert(leadingEntries_.begin(), userInfo_);
+    leading = leadingEntries_;
+  }
+  writeSummaryFile(spool, leading, serviceType(), platform_.dispatcher->GetClock().WallNow(),
+                   nullptr);
 }
 
-void RuvoReportingSession::writeSummaryFile(const std::shared_ptr<NestedPayloadList>& list,
-                                            const Dictionary& info, uint16_t serviceType,
-                                            WallTime now) {
+void RuvoReportingSession::writeSummaryFile(const std::shared_ptr<SessionSpool>& spool,
+                                            const std::vector<Dictionary>& leading,
+                                            uint16_t serviceType, WallTime now, const Value* last) {
   if (!IsInternalBuild(platform_)) return;
-  if (!list) return;
-  {
-    std::lock_guard lock(list->mutex);
-    if (list->items.empty()) return;
-    list->items.insert(list->items.begin(),
-                       NestedPayloadEntry{std::nullopt, std::make_shared<const Dictionary>(info)});
-  }
+  if (!spool) return;
+  // The leading user info stands alone in a file of nothing else.
+  if (spool->messageCount() == 0 && last == nullptr && leading.size() <= 1) return;
 
-  // One error slot for the three steps, never cleared between them: an earlier error is reported
+  // One error slot for the steps, never cleared between them: an earlier error is reported
   // again by the last step.
   OptionalError error;
-  std::optional<std::string> contents;
-  {
-    std::lock_guard lock(list->mutex);
-    Value array = Value::array();
-    for (const NestedPayloadEntry& entry : list->items) array.push_back(entry.ToValue());
-    try {
-      // Strict: invalid UTF-8 in a client's string is an error here, not silently replaced.
-      contents = array.dump(kSummaryJsonIndent, ' ', false, Value::error_handler_t::strict);
-    } catch (const Value::exception& e) {
-      error = Error{kGeneralErrorDomain, e.id, e.what()};
-      TLOG_ERROR(SessionLog(), "dataWithJSONObject: {}", error->LocalizedDescription());
-    }
-  }
-
   const std::string directory = platform_.diagnosticDirectory + kSummaryDirectory;
   if (OptionalError created =
           platform_.fileSystem->CreateDirectories(directory, kSummaryDirectoryMode)) {
@@ -523,19 +595,108 @@ void RuvoReportingSession::writeSummaryFile(const std::shared_ptr<NestedPayloadL
                error->LocalizedDescription());
   }
 
+  const Dictionary& info = leading.front();
   const auto application = info.find(kHostApplicationKey);
   const std::string applicationName =
       application != info.end() ? ValueText(*application) : std::string("unknown");
-  const std::string fileName =
-      fmt::format("{}-{}-{}-{}.json", SummaryFileTime(now), "tavrin", FileNamePart(applicationName),
-                  FileNamePart(NameText(ServiceTypeName(serviceType))));
-  if (contents) {
-    if (OptionalError written =
-            platform_.fileSystem->WriteFileAtomically(directory + "/" + fileName, *contents)) {
-      error = std::move(written);
+  const std::string fileName = fmt::format(
+      "{}-{}-{}-{}{}.json", SummaryFileTime(now), "tavrin", FileNamePart(applicationName),
+      FileNamePart(NameText(ServiceTypeName(serviceType))), recovered_ ? kRecoveredFileMark : "");
+
+  // Streamed from the spool: the file never has to fit in memory.
+  OptionalError writeError;
+  std::unique_ptr<WritableFile> file =
+      platform_.fileSystem->BeginAtomicWrite(directory + "/" + fileName, &writeError);
+  bool first = true;
+  auto write = [&](Value element) {
+    if (!file) return;
+    std::string text = first ? "[\n" : ",\n";
+    first = false;
+    text += SummaryFileElement(std::move(element));
+    if (OptionalError appended = file->Append(text)) {
+      writeError = std::move(appended);
+      file.reset();
     }
+  };
+  try {
+    for (const Dictionary& entry : leading) write(entry);
+    OptionalError replayed = spool->Replay([&](const Value& record) {
+      if (IsMessageRecord(record)) write(MessageEntry(record));
+    });
+    if (replayed) writeError = std::move(replayed);
+    if (last) write(*last);
+  } catch (const Value::exception& e) {
+    error = Error{kGeneralErrorDomain, e.id, e.what()};
+    TLOG_ERROR(SessionLog(), "dataWithJSONObject: {}", error->LocalizedDescription());
+    file.reset();
   }
+  if (file && !writeError) {
+    writeError = file->Append("\n]");
+    if (!writeError) writeError = file->Commit();
+  }
+  if (writeError) error = std::move(writeError);
   if (error) TLOG_ERROR(SessionLog(), "jsonOutput writeToURL: {}", error->LocalizedDescription());
+}
+
+void RuvoReportingSession::recover(PlatformServices& platform, const std::string& spoolPath) {
+  TLOG_OPERATION("recover");
+  std::shared_ptr<SessionSpool> spool = SessionSpool::Existing(*platform.fileSystem, spoolPath);
+  std::optional<int64_t> reporterID;
+  uint16_t serviceType = service_type::kUnknown;
+  Dictionary info = MakeDictionary();
+  Dictionary counts = MakeDictionary();
+  auto texts = std::make_shared<SummaryTexts>();
+  uint64_t messages = 0;
+  OptionalError error = spool->Replay([&](const Value& record) {
+    const std::string& kind = record[0].get_ref<const std::string&>();
+    if (kind == "h" && record.size() == 5 && record[1].is_number_integer() &&
+        record[2].is_number_unsigned() && record[4].is_object()) {
+      reporterID = record[1].get<int64_t>();
+      serviceType = record[2].get<uint16_t>();
+      info = record[3];
+      counts = record[4];
+    } else if (IsMessageRecord(record)) {
+      texts->Add(record[2]);
+      ++messages;
+      Value& count = counts[MessageKind(record[1].get<std::string>())];
+      count = count.is_number_integer() ? count.get<int64_t>() + 1 : 1;
+    } else if (kind == "a" && record.size() == 2) {
+      texts->Add(record[1]);
+    } else if (kind == "u" && record.size() == 2) {
+      info = record[1];
+    } else if (kind == "t" && record.size() == 2 && record[1].is_number_unsigned()) {
+      serviceType = record[1].get<uint16_t>();
+    }
+  });
+  if (error) TLOG_ERROR(SessionLog(), "{}", error->LocalizedDescription());
+  if (!reporterID || texts->payloadCount() == 0) {
+    TLOG_DEFAULT(SessionLog(), "nothing to recover from {}, removing it", spoolPath);
+    spool->Remove();
+    return;
+  }
+  TLOG_DEFAULT(SessionLog(), "recovering the summary of reporter {} from {} ({} messages)",
+               *reporterID, spoolPath, messages);
+  spool->setMessageCount(messages);
+
+  std::shared_ptr<RuvoReportingSession> session = create(*reporterID, {}, platform);
+  session->recovered_ = true;
+  session->setServiceType(serviceType);
+  session->setUserInfo(info);
+  {
+    std::lock_guard lock(session->countsMutex_);
+    session->messageTypeCounts_ = std::move(counts);
+  }
+  {
+    std::lock_guard lock(session->propertyMutex_);
+    session->summaryTexts_ = std::move(texts);
+    session->spool_ = std::move(spool);
+  }
+  session->started_.store(true, std::memory_order_release);
+  std::optional<std::string> name = session->serviceName();
+  session->telvoroQueue_->Async([session, name = std::move(name), serviceType] {
+    session->createTelvoroSessionOnQueue(name, serviceType);
+  });
+  session->stop();
 }
 
 bool RuvoReportingSession::shouldReportOrientation() {
@@ -589,6 +750,9 @@ void RuvoReportingSession::orientationChanged(OrientationKind kind,
   record[device ? "device_orientation" : "ui_orientation"] = text;
   record[device ? "device_orientation_time" : "ui_orientation_time"] = time;
   appendAggregated(record);
+  if (std::shared_ptr<SessionSpool> running = spool()) {
+    telvoroQueue_->Async([running, record] { running->AppendAggregated(record); });
+  }
 }
 
 void RuvoReportingSession::sendSingleMessage(PlatformServices& platform, const Dictionary& payload,
@@ -660,8 +824,13 @@ Dictionary RuvoReportingSession::userInfo() const {
 
 void RuvoReportingSession::setUserInfo(Dictionary userInfo) {
   if (userInfo.is_null()) userInfo = MakeDictionary();
-  std::lock_guard lock(propertyMutex_);
-  userInfo_ = std::move(userInfo);
+  std::shared_ptr<SessionSpool> running;
+  {
+    std::lock_guard lock(propertyMutex_);
+    userInfo_ = userInfo;
+    running = spool_;
+  }
+  if (running) spoolUserInfo(running, std::move(userInfo));
 }
 
 Dictionary RuvoReportingSession::messageTypeCounts() const {
@@ -689,9 +858,14 @@ std::shared_ptr<SummaryTexts> RuvoReportingSession::summaryTexts() const {
   return summaryTexts_;
 }
 
-std::shared_ptr<NestedPayloadList> RuvoReportingSession::nestedAggregatedPayloadData() const {
+std::shared_ptr<SessionSpool> RuvoReportingSession::spool() const {
   std::lock_guard lock(propertyMutex_);
-  return nestedAggregatedPayloadData_;
+  return spool_;
+}
+
+std::vector<Dictionary> RuvoReportingSession::leadingEntries() const {
+  std::lock_guard lock(propertyMutex_);
+  return leadingEntries_;
 }
 
 TelvoroSessionPtr RuvoReportingSession::telvoroSession() const {

@@ -11,6 +11,7 @@
 #include <utility>
 #include <vector>
 
+#include "Statistics/Service/SessionSpool.h"
 #include "base/Dictionary.h"
 #include "base/Error.h"
 #include "platform/Clock.h"
@@ -26,36 +27,16 @@ namespace tavrin {
 // delivery queued for it (nothing modifies it after it is made).
 using PayloadPtr = std::shared_ptr<const Dictionary>;
 
-// One entry of the nested aggregation list: {messageId: payload} for a message, or a bare value
-// (the user info that the summary file puts first) when `messageId` is absent.
-struct NestedPayloadEntry {
-  std::optional<std::string> messageId;
-  PayloadPtr payload;
-
-  // The entry as it appears in the summary file.
-  Value ToValue() const;
-};
-
-// A list shared between the caller's queue, orientation callbacks and stop. The lock belongs to
-// the list object itself, so a stop that swaps the session's list for none leaves a writer that
-// already holds the old list's lock appending to an object nobody reads any more.
-template <typename T>
-struct LockedList {
-  std::recursive_mutex mutex;
-  std::vector<T> items;  // guarded by mutex
-
-  std::vector<T> Snapshot() {
-    std::lock_guard lock(mutex);
-    return items;
-  }
-};
-using NestedPayloadList = LockedList<NestedPayloadEntry>;
-
 // The summary event's texts, built as messages arrive so that a session's memory grows with its
-// distinct keys and their texts, not with copies of every payload: per key, the text forms of its
-// values joined with ",", keys in the order first seen, the summary key first.
+// distinct keys, not with its messages: per key, the text forms of its values joined with ",",
+// keys in the order first seen, the summary key first. A key's text that grows past kSpillBytes
+// goes to the spool in pieces and is put together again for the summary.
 class SummaryTexts {
  public:
+  static constexpr size_t kSpillBytes = 4096;
+
+  // Without a spool every text stays in memory.
+  explicit SummaryTexts(std::shared_ptr<SessionSpool> spool = nullptr);
   void Add(const Dictionary& payload);
   // Payloads added so far (an empty one counts).
   size_t payloadCount() const;
@@ -63,9 +44,11 @@ class SummaryTexts {
   std::optional<Dictionary> Summary(uint16_t serviceType) const;
 
  private:
+  const std::shared_ptr<SessionSpool> spool_;
   mutable std::mutex mutex_;
   size_t payloadCount_ = 0;                                 // guarded by mutex_
   std::vector<std::pair<std::string, std::string>> texts_;  // guarded by mutex_
+  bool spilled_ = false;                                    // guarded by mutex_
   std::unordered_map<std::string, size_t> indexOfKey_;      // guarded by mutex_
 };
 
@@ -112,14 +95,21 @@ class RuvoReportingSession : public std::enable_shared_from_this<RuvoReportingSe
   void setConfiguration(const Dictionary& configuration);
   void updateDefaults(const Dictionary& defaults);
 
-  // Starts the session: fresh aggregation lists, orientation tracking when it applies, and, on
+  // Starts the session: fresh aggregation and spool, orientation tracking when it applies, and, on
   // telvoroQueue, a TelvoroSession that waits up to kBackendWaitSeconds for its back-ends while the
   // queue is suspended (messages sent meanwhile wait behind it, in order). Returns at once. A
   // started session only logs "<id> is already started".
   void start();
-  // Ends orientation tracking (always), and for a started session: sends the summary event,
-  // writes the summary file, queues the flush behind every queued message and drops the lists.
+  // Ends orientation tracking (always), and for a started session takes its aggregation and
+  // spool out and hands the rest to telvoroQueue, behind every queued message: the summary
+  // event, the summary file, the flush, and the spool's removal once the flush is done.
   void stop();
+
+  // Sends the summary of a session that was open when an earlier run of the service ended, from
+  // the spool it left at `spoolPath`: through the back-ends as an ordinary stop would, marked as
+  // recovered, with its summary file on internal builds; then removes the spool. A spool without
+  // a session's header or without anything aggregated is only removed.
+  static void recover(PlatformServices& platform, const std::string& spoolPath);
 
   // Counts the message, aggregates it while started and queues its delivery: through the
   // TelvoroSession when the session was started at the time of the call, else as a single
@@ -136,12 +126,15 @@ class RuvoReportingSession : public std::enable_shared_from_this<RuvoReportingSe
   // aggregated. Does not change the session.
   std::optional<Dictionary> createSummaryEventForSession();
   // On internal builds: puts userInfo first in the nested list (a lasting change) and writes the
-  // list as a pretty-printed JSON file into "<diagnosticDirectory>/Audio/Reporting". Failures are
-  // logged only.
+  // list, read from the spool, as a pretty-printed JSON file into
+  // "<diagnosticDirectory>/Audio/Reporting". Failures are logged only.
   void writeSummaryJson();
-  // The same for the list, user info and service type a stop took out, named by its time.
-  void writeSummaryFile(const std::shared_ptr<NestedPayloadList>& list, const Dictionary& info,
-                        uint16_t serviceType, WallTime now);
+  // The same for the spool and service type a stop took out, named by its time: `leading` (the
+  // user info first) before the spooled messages, `last` (the summary entry) after them when
+  // given.
+  void writeSummaryFile(const std::shared_ptr<SessionSpool>& spool,
+                        const std::vector<Dictionary>& leading, uint16_t serviceType, WallTime now,
+                        const Value* last);
   // Internal build, service type telephony or longformaudio, and a device class other than 6.
   bool shouldReportOrientation();
 
@@ -170,10 +163,14 @@ class RuvoReportingSession : public std::enable_shared_from_this<RuvoReportingSe
   uint16_t serviceType() const { return serviceType_.load(std::memory_order_acquire); }
   std::optional<std::string> orientationCallbackID() const;
   std::optional<SteadyTime> startDate() const;
-  // The aggregation, or null while the session is stopped. The nested list is kept only on
-  // internal builds, the only ones that write it; lock its own mutex to read it.
+  // The aggregation and the spool that holds the nested list, or null while the session is
+  // stopped.
   std::shared_ptr<SummaryTexts> summaryTexts() const;
-  std::shared_ptr<NestedPayloadList> nestedAggregatedPayloadData() const;
+  std::shared_ptr<SessionSpool> spool() const;
+  // The user info entries that writeSummaryJson put first in the nested list, latest first.
+  std::vector<Dictionary> leadingEntries() const;
+  // Recovered sessions say so in their session info and in their summary file's name.
+  bool recovered() const { return recovered_; }
   TelvoroSessionPtr telvoroSession() const;
   TelvoroTokenPtr telvoroAgentToken() const;
   const SerialQueuePtr& telvoroQueue() const { return telvoroQueue_; }
@@ -204,7 +201,8 @@ class RuvoReportingSession : public std::enable_shared_from_this<RuvoReportingSe
   void registerOrientationCallbacks();
   void orientationChanged(OrientationKind kind, const OrientationValue& orientation);
   void appendAggregated(const Dictionary& payload);
-  void appendNested(NestedPayloadEntry entry);
+  // Records the user info in the spool, in order with the messages.
+  void spoolUserInfo(const std::shared_ptr<SessionSpool>& running, Dictionary info);
   void setTelvoroSession(TelvoroSessionPtr session);
 
   PlatformServices& platform_;
@@ -214,6 +212,7 @@ class RuvoReportingSession : public std::enable_shared_from_this<RuvoReportingSe
   std::atomic<bool> started_{false};
   std::atomic<bool> telvoroSessionStarted_{false};
   std::atomic<uint16_t> serviceType_;
+  bool recovered_ = false;  // set before the session is shared
 
   // Guards the properties below that are not atomics or lists. Never held while calling out.
   mutable std::mutex propertyMutex_;
@@ -223,7 +222,8 @@ class RuvoReportingSession : public std::enable_shared_from_this<RuvoReportingSe
   std::optional<std::string> orientationCallbackID_;
   std::optional<SteadyTime> startDate_;
   std::shared_ptr<SummaryTexts> summaryTexts_;
-  std::shared_ptr<NestedPayloadList> nestedAggregatedPayloadData_;
+  std::shared_ptr<SessionSpool> spool_;
+  std::vector<Dictionary> leadingEntries_;
   TelvoroSessionPtr telvoroSession_;
   TelvoroTokenPtr telvoroAgentToken_;
   Dictionary driverSnapShot_;

@@ -19,7 +19,9 @@
 #include <CLI/CLI.hpp>
 
 #include "Statistics/Service/RuvoReportingServiceDelegate.h"
+#include "Statistics/Service/RuvoReportingSession.h"
 #include "Statistics/Service/ServiceWatchdog.h"
+#include "Statistics/Service/SessionSpool.h"
 #include "platform/LogSystem.h"
 #include "platform/Platform.h"
 #include "platform/linux/dispatch/AsioDispatcher.h"
@@ -155,6 +157,21 @@ void ApplyListenerSettings(tavrin::UnixServiceListener& listener,
   listener.SetKillUids(std::move(settings.killUids));
 }
 
+// Sessions that were open when the service last ended left their spools: their summaries are
+// sent now, before any new session spools beside them.
+void RecoverSpooledSessions(tavrin::PlatformServices& services) {
+  TLOG_OPERATION("recover");
+  if (tavrin::OptionalError error = services.fileSystem->CreateDirectories(
+          services.spoolDirectory, tavrin::SessionSpool::kDirectoryMode)) {
+    TLOG_ERROR(nullptr, "sessions cannot spool: {}", error->LocalizedDescription());
+    return;
+  }
+  for (const std::string& name : services.fileSystem->ListFiles(services.spoolDirectory)) {
+    if (!name.ends_with(tavrin::SessionSpool::kFileSuffix)) continue;
+    tavrin::RuvoReportingSession::recover(services, services.spoolDirectory + "/" + name);
+  }
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -258,6 +275,8 @@ int main(int argc, char** argv) {
   services.notifications = &notifications;
   services.defaults = &defaults;
   services.diagnosticDirectory = options.diagnosticDir;
+  services.spoolDirectory = options.stateDir + "/spool";
+  RecoverSpooledSessions(services);
 
   // Log verbosity and the analytics policy follow the defaults as the settings do.
   int refreshToken = -1;

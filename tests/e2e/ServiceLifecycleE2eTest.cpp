@@ -12,6 +12,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <filesystem>
+#include <fstream>
 #include <functional>
 
 #include "tests/support/StoreFiles.h"
@@ -53,6 +54,73 @@ TEST(ServiceLifecycleE2eTest, SigtermSendsTheAlarmsMessagesStillHeldBack) {
       << service.Log();
   EXPECT_EQ(service.LogCount("held-back single message(s) now"), 1u) << service.Log();
   EXPECT_EQ(service.LogCount("still queued"), 0u) << "an orderly stop drained everything";
+}
+
+// A session open when the service is killed: the next start sends its summary, marked as
+// recovered in the store and in the summary file's name, covering every message the store had
+// committed, and removes the spool it came from.
+TEST(ServiceLifecycleE2eTest, AfterSigkillTheNextStartSendsTheOpenSessionsSummary) {
+  const std::string root = testing::MakeTempDirectory("tavrin-e2e-");
+  testing::WriteFileAtomically(root + "/etc/device.toml", "InternalBuild = true\n");
+  TavrindProcess service({}, root);
+  ASSERT_TRUE(service.Start()) << service.Log();
+  constexpr int kMessages = 300;
+  // The client stays connected: a client that goes away has its sessions stopped.
+  TestClient client(service.SocketPath());
+  {
+    client.Send(1, protocol::CreateReportingSession{21});
+    client.Send(2, protocol::SetServiceType{3, 21});
+    client.Send(3, protocol::StartReportingSessionForID{21});
+    for (int i = 0; i < kMessages; ++i) {
+      client.Send(10 + i,
+                  protocol::SendMessage{Dictionary{{"n", i}, {"text", std::string(600, 'x')}}, 1, 0,
+                                        std::vector<int64_t>{21}});
+    }
+    // The start's answer is held until the session stops, which it never does here.
+    for (int i = 0; i < 2 + kMessages; ++i) ASSERT_TRUE(client.Read()) << service.Log();
+  }
+  const std::string count =
+      "SELECT count(*) FROM session_messages WHERE reporter_id = 21 AND category = 1";
+  ASSERT_TRUE(testing::WaitUntil([&] {
+    return testing::QueryStoreColumn(service.DatabasePath(), count) ==
+           std::vector<std::string>{std::to_string(kMessages)};
+  })) << testing::QueryStoreColumn(service.DatabasePath(), count)[0]
+      << service.Log();
+  ::kill(service.pid(), SIGKILL);
+  ASSERT_EQ(service.WaitForExit(), 128 + SIGKILL);
+
+  ASSERT_TRUE(service.Start()) << service.Log();
+  const std::string summary =
+      "SELECT m.payload FROM session_messages m JOIN sessions s ON m.session_row = s.row "
+      "WHERE s.recovered = 1 AND s.reporter_id = 21 AND m.type = 65535";
+  ASSERT_TRUE(testing::WaitUntil([&] {
+    return !testing::QueryStoreColumn(service.DatabasePath(), summary).empty();
+  })) << service.Log();
+  EXPECT_EQ(service.Stop(), 0) << service.Log();
+
+  const auto rows = testing::QueryStoreColumn(service.DatabasePath(), summary);
+  ASSERT_EQ(rows.size(), 1u);
+  const Value event = Value::parse(rows[0]);
+  std::string numbers;
+  for (int i = 0; i < kMessages; ++i) numbers += (i ? "," : "") + std::to_string(i);
+  EXPECT_EQ(event["n"], numbers);
+  EXPECT_EQ(event["Ruvo_Session_Summary_Event"], "3");
+  EXPECT_EQ(testing::QueryStoreColumn(service.DatabasePath(),
+                                      "SELECT count(*) FROM sessions WHERE recovered = 1"),
+            std::vector<std::string>{"1"});
+
+  std::vector<std::string> files;
+  for (const auto& entry :
+       std::filesystem::directory_iterator(root + "/log/DiagnosticLogs/Audio/Reporting")) {
+    files.push_back(entry.path().filename().string());
+  }
+  ASSERT_EQ(files.size(), 1u);
+  EXPECT_TRUE(files[0].ends_with("-tavrin-unknown-haptics-recovered.json")) << files[0];
+  std::ifstream in(root + "/log/DiagnosticLogs/Audio/Reporting/" + files[0]);
+  const Value file = Value::parse(in);
+  ASSERT_EQ(file.size(), size_t(kMessages + 2));
+  EXPECT_EQ(file[kMessages + 1], (Value{{"Undefined_Unknown_1", event}}));
+  EXPECT_TRUE(std::filesystem::is_empty(root + "/lib/spool"));
 }
 
 // Under a service manager (a datagram socket standing in for systemd's): READY with a status

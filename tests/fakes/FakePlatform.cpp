@@ -13,6 +13,8 @@ FakePlatform::FakePlatform() {
   services.deviceInfo = &deviceInfo;
   services.fileSystem = &fileSystem;
   services.diagnosticDirectory = kDiagnosticDirectory;
+  services.spoolDirectory = kSpoolDirectory;
+  fileSystem.AddDirectory(kSpoolDirectory);
 }
 
 FakePlatform::~FakePlatform() {

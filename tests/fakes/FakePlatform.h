@@ -27,6 +27,7 @@ struct FakePlatform {
   FakePlatform& operator=(const FakePlatform&) = delete;
 
   static constexpr const char* kDiagnosticDirectory = "/fake/log/DiagnosticLogs";
+  static constexpr const char* kSpoolDirectory = "/fake/lib/spool";
 
   FakeClock clock;
   FakeRandom random;

@@ -70,10 +70,13 @@ class SessionTestBase : public ::testing::Test {
   static size_t Aggregated(const std::shared_ptr<SummaryTexts>& texts) {
     return texts ? texts->payloadCount() : 0;
   }
-  static std::vector<Value> Entries(const std::shared_ptr<NestedPayloadList>& list) {
+  // The messages in a spool as the summary file lists them: {message id: payload}.
+  static std::vector<Value> Entries(const std::shared_ptr<SessionSpool>& spool) {
     std::vector<Value> entries;
-    if (!list) return entries;
-    for (const auto& entry : list->Snapshot()) entries.push_back(entry.ToValue());
+    if (!spool) return entries;
+    spool->Replay([&](const Value& record) {
+      if (record[0] == "m") entries.push_back(Value{{record[1].get<std::string>(), record[2]}});
+    });
     return entries;
   }
 

@@ -89,7 +89,7 @@ TEST_F(OrientationTest, TimesAreRoundedToWholeMilliseconds) {
   EXPECT_EQ(session->createSummaryEventForSession()->dump(), summary.dump());
   // Records are not messages: not counted, not in the nested list.
   EXPECT_EQ(session->messageTypeCounts(), Dictionary::object());
-  EXPECT_TRUE(Entries(session->nestedAggregatedPayloadData()).empty());
+  EXPECT_TRUE(Entries(session->spool()).empty());
 
   for (const char* line :
        {"mode=ui orientation=\"landscape-left\" app=\"com.example.call\", time=0.013",

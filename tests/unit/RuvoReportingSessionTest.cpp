@@ -279,7 +279,7 @@ TEST_F(SessionTest, BeforeStartMessagesGoAloneStopDoesNothingAndStartDropsTheAgg
   // ...which start empties.
   StartAndRun(session);
   EXPECT_EQ(Aggregated(session->summaryTexts()), 0u);
-  EXPECT_TRUE(Entries(session->nestedAggregatedPayloadData()).empty());
+  EXPECT_TRUE(Entries(session->spool()).empty());
 }
 
 TEST_F(SessionTest, StopFlushesAfterEveryQueuedMessageAndDropsTheLists) {
@@ -290,7 +290,7 @@ TEST_F(SessionTest, StopFlushesAfterEveryQueuedMessageAndDropsTheLists) {
   session->stop();
   EXPECT_FALSE(session->started());
   EXPECT_EQ(session->summaryTexts(), nullptr);
-  EXPECT_EQ(session->nestedAggregatedPayloadData(), nullptr);
+  EXPECT_EQ(session->spool(), nullptr);
   EXPECT_EQ(traces.Count(trace::kSessionStopped), 1u);
   auto fake = platform.telvoro.LastSession();
   EXPECT_TRUE(fake->MessagesAtFlush().empty());  // still behind the wait
@@ -369,8 +369,9 @@ TEST_F(SessionTest, MessageIdsCountPerCategoryAndType) {
   auto session = Started();
   for (int i = 0; i < 3; ++i) session->sendMessage(Dictionary{{"n", i}}, 0x80000001, 1, nullptr);
   session->sendMessage(Dictionary{{"n", 3}}, 0x80000001, 2, nullptr);
+  platform.dispatcher.RunUntilIdle();
   std::vector<std::string> ids;
-  for (const auto& entry : Entries(session->nestedAggregatedPayloadData())) {
+  for (const auto& entry : Entries(session->spool())) {
     ids.push_back(entry.begin().key());
   }
   EXPECT_EQ(ids, (std::vector<std::string>{"Toolbox_Generic_Start_1", "Toolbox_Generic_Start_2",

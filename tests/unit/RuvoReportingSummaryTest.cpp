@@ -144,15 +144,84 @@ TEST_F(SummaryTest, GeneratedSessionsMatchThePlainAlgorithm) {
   }
 }
 
+// A key whose text outgrows memory goes to the spool in pieces; the summary puts them together
+// again in order, the key order unchanged.
+TEST_F(SummaryTest, LongTextsSpillToTheSpoolAndComeBackWhole) {
+  auto session = Started(3);
+  Dictionary expected{{"Ruvo_Session_Summary_Event", "3"}, {"long", ""}, {"short", ""}};
+  for (int i = 0; i < 400; ++i) {
+    const std::string text = std::string(size_t(i % 50), 'a' + char(i % 26)) + std::to_string(i);
+    session->sendMessage(Dictionary{{"long", text}, {"short", i % 2}}, 1, 1, nullptr);
+    for (const auto& [key, value] :
+         {std::pair<std::string, std::string>{"long", text}, {"short", std::to_string(i % 2)}}) {
+      std::string& joined = expected[key].get_ref<std::string&>();
+      joined += (i ? "," : "") + value;
+    }
+  }
+  platform.dispatcher.RunUntilIdle();
+  size_t pieces = 0;
+  session->spool()->Replay([&](const Value& record) { pieces += record[0] == "k" ? 1 : 0; });
+  EXPECT_GE(pieces, 2u);
+  EXPECT_EQ(session->createSummaryEventForSession(), expected);
+}
+
+// What a crash leaves: the spool of an open session. Recovery sends its summary through a session
+// marked as recovered, with the file named so, and removes the spool; a torn last record only
+// loses that record, and a spool without its header is removed with nothing sent.
+TEST_F(SummaryTest, ASpoolLeftByACrashBecomesARecoveredSummary) {
+  auto session = Started(3, Dictionary{{"HostApplicationDisplayID", "app"}});
+  for (int i = 0; i < 3; ++i) session->sendMessage(Dictionary{{"n", i}}, 1, 1, nullptr);
+  platform.dispatcher.RunUntilIdle();
+  const std::string spooled = *platform.fileSystem.ReadFile(session->spool()->path());
+  const std::string directory = FakePlatform::kSpoolDirectory;
+  // Records are a 4-byte little-endian length and their bytes; the header comes first.
+  const size_t headerBytes = 4 + (uint8_t(spooled[0]) | size_t(uint8_t(spooled[1])) << 8);
+  const struct {
+    std::string name, contents, numbers;
+  } cases[] = {
+      {"whole", spooled, "0,1,2"},
+      {"torn", spooled.substr(0, spooled.size() - 3), "0,1"},
+      {"headless", spooled.substr(headerBytes), ""},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.name);
+    const std::string path = directory + "/" + c.name + ".spool";
+    ASSERT_EQ(platform.fileSystem.WriteFileAtomically(path, c.contents), std::nullopt);
+    const size_t sessions = platform.telvoro.Sessions().size();
+    RuvoReportingSession::recover(platform.services, path);
+    platform.dispatcher.RunUntilIdle();
+    EXPECT_FALSE(platform.fileSystem.ReadFile(path)) << "the spool is removed";
+    if (c.numbers.empty()) {
+      EXPECT_EQ(platform.telvoro.Sessions().size(), sessions);
+      continue;
+    }
+    ASSERT_EQ(platform.telvoro.Sessions().size(), sessions + 1);
+    const auto recovered = platform.telvoro.LastSession();
+    EXPECT_EQ(recovered->SessionInfo()["Recovered"], true);
+    EXPECT_EQ(recovered->SessionInfo()["SessionID"], 42);
+    const auto messages = recovered->Messages();
+    ASSERT_EQ(messages.size(), 1u);
+    EXPECT_EQ(messages[0].payload,
+              (Dictionary{{"Ruvo_Session_Summary_Event", "3"}, {"n", c.numbers}}));
+    const std::string file = platform.fileSystem.WriteCalls().back();
+    EXPECT_TRUE(file.ends_with("-tavrin-app-haptics-recovered.json")) << file;
+    const Value entries = Value::parse(*platform.fileSystem.ReadFile(file));
+    EXPECT_EQ(entries.front(), (Dictionary{{"HostApplicationDisplayID", "app"}}));
+    // The summary continues the session's count of its kind.
+    EXPECT_EQ(entries.back().begin().key(), "Undefined_Unknown_1");
+  }
+}
+
 TEST_F(SummaryTest, WritingPutsTheUserInfoFirstEveryTime) {
   auto session = Started(3, Dictionary{{"k", "v"}});
   session->sendMessage(Dictionary{{"a", 1}}, 1, 1, nullptr);
+  platform.dispatcher.RunUntilIdle();
   session->writeSummaryJson();
   session->writeSummaryJson();
-  const auto entries = Entries(session->nestedAggregatedPayloadData());
-  ASSERT_EQ(entries.size(), 3u);
-  EXPECT_EQ(entries[0], (Dictionary{{"k", "v"}}));
-  EXPECT_EQ(entries[1], (Dictionary{{"k", "v"}}));
+  const Value info{{"k", "v"}};
+  const Value file = Value::array({info, info, Value{{"Generic_Start_1", Value{{"a", 1}}}}});
+  ASSERT_FALSE(platform.fileSystem.WriteCalls().empty());
+  EXPECT_EQ(platform.fileSystem.ReadFile(platform.fileSystem.WriteCalls().back()), file.dump(2));
 }
 
 // The serialisation, directory and write steps share one error slot: the last line reports the
@@ -179,6 +248,7 @@ TEST_F(SummaryTest, FileErrorsAreLoggedAndTheStepsAfterThemStillRun) {
   for (const auto& c : cases) {
     SCOPED_TRACE(c.errors.front());
     FakeFileSystem files;
+    files.AddDirectory(FakePlatform::kSpoolDirectory);
     if (c.directoryExists) files.AddDirectory(kDirectory);
     files.FailCreateDirectories(failure(c.createError));
     files.FailWrites(failure(c.writeError));
