@@ -141,69 +141,50 @@ std::vector<IntegerCase> IntegerCases() {
   };
 }
 
-// Expects `body` accepted when `fits`, else refused with code 4 and call 77.
-void ExpectFitsOrOutOfRange(const Bytes& body, bool fits, const std::string& where) {
-  auto decoded = DecodeRequest(body);
-  if (fits) {
-    EXPECT_TRUE(std::holds_alternative<Request>(decoded)) << where;
-    return;
-  }
-  ASSERT_TRUE(std::holds_alternative<RequestError>(decoded)) << where;
-  const auto& error = std::get<RequestError>(decoded);
-  EXPECT_EQ(error.kind, RequestError::Kind::kReject) << where;
-  EXPECT_EQ(error.code, RejectCode::kIntegerOutOfRange) << where << ": " << error.reason;
-  EXPECT_EQ(error.call, 77u) << where;
+// The arguments of `body` when it `fits`; otherwise expects it refused with code 4 and call 77.
+std::optional<Arguments> FitsOrOutOfRange(const Bytes& body, bool fits) {
+  if (fits) return Accepted(body).arguments;
+  const RequestError error = Refused(body);
+  EXPECT_EQ(error.kind, RequestError::Kind::kReject);
+  EXPECT_EQ(error.code, RejectCode::kIntegerOutOfRange) << error.reason;
+  EXPECT_EQ(error.call, 77u);
+  return std::nullopt;
 }
 
 TEST(CodecTest, IntegersAtEveryFormatsEdgesFitTheirArgumentTypeByValue) {
   for (const IntegerCase& c : IntegerCases()) {
-    const std::string where =
-        "format " + std::to_string(static_cast<int>(c.format)) + " bits " + std::to_string(c.bits);
+    SCOPED_TRACE("format " + std::to_string(static_cast<int>(c.format)) + " bits " +
+                 std::to_string(c.bits));
     const Bytes n = Pack().integer(c.format, c.bits);
-
-    // reporterID (signed 64-bit), and the value that arrives.
-    const Bytes create = RequestBytes(1, Pack().uint(1), n);
-    ExpectFitsOrOutOfRange(create, c.fitsInt64, where + " as reporterID");
-    if (c.fitsInt64) {
-      EXPECT_EQ(std::get<CreateReportingSession>(Accepted(create).arguments).reporterID,
-                static_cast<int64_t>(c.bits))
-          << where;
+    // In each integer argument, with the value that arrives: reporterID (signed 64-bit),
+    // serviceType (unsigned 16-bit; type converts the same way), category (unsigned 32-bit) and an
+    // element of reporterIDs.
+    if (auto a = FitsOrOutOfRange(RequestBytes(1, Pack().uint(1), n), c.fitsInt64)) {
+      EXPECT_EQ(std::get<CreateReportingSession>(*a).reporterID, static_cast<int64_t>(c.bits));
     }
-    // serviceType (unsigned 16-bit)
-    const Bytes setType = RequestBytes(2, Pack().uint(2), Pack().append(n).uint(1));
-    ExpectFitsOrOutOfRange(setType, c.fitsUint16, where + " as serviceType");
-    if (c.fitsUint16) {
-      EXPECT_EQ(std::get<SetServiceType>(Accepted(setType).arguments).serviceType,
-                static_cast<uint16_t>(c.bits))
-          << where;
+    if (auto a = FitsOrOutOfRange(RequestBytes(2, Pack().uint(2), Pack().append(n).uint(1)),
+                                  c.fitsUint16)) {
+      EXPECT_EQ(std::get<SetServiceType>(*a).serviceType, static_cast<uint16_t>(c.bits));
     }
-    // category (unsigned 32-bit), an element of reporterIDs (type converts as serviceType does)
-    const Bytes category = RequestBytes(4, Pack().uint(6), Pack().map(0).append(n).uint(0).nil());
-    ExpectFitsOrOutOfRange(category, c.fitsUint32, where + " as category");
-    if (c.fitsUint32) {
-      EXPECT_EQ(std::get<SendMessage>(Accepted(category).arguments).category,
-                static_cast<uint32_t>(c.bits))
-          << where;
+    if (auto a = FitsOrOutOfRange(
+            RequestBytes(4, Pack().uint(6), Pack().map(0).append(n).uint(0).nil()), c.fitsUint32)) {
+      EXPECT_EQ(std::get<SendMessage>(*a).category, static_cast<uint32_t>(c.bits));
     }
     const Bytes ids =
         RequestBytes(4, Pack().uint(6), Pack().map(0).uint(0).uint(0).array(2).uint(1).append(n));
-    ExpectFitsOrOutOfRange(ids, c.fitsInt64, where + " in reporterIDs");
-    if (c.fitsInt64) {
-      EXPECT_EQ(std::get<SendMessage>(Accepted(ids).arguments).reporterIDs,
-                (std::vector<int64_t>{1, static_cast<int64_t>(c.bits)}))
-          << where;
+    if (auto a = FitsOrOutOfRange(ids, c.fitsInt64)) {
+      EXPECT_EQ(std::get<SendMessage>(*a).reporterIDs,
+                (std::vector<int64_t>{1, static_cast<int64_t>(c.bits)}));
     }
 
     // As the call: any integer >= 0 is echoed, a negative one makes the frame undecodable.
     const bool negative = c.format == IntFormat::kNegativeFixint ||
                           (c.format >= IntFormat::kInt8 && static_cast<int64_t>(c.bits) < 0);
-    auto asCall = DecodeRequest(Pack().array(2).append(n).uint(10));
+    const Bytes asCall = Pack().array(2).append(n).uint(10);
     if (negative) {
-      ASSERT_TRUE(std::holds_alternative<RequestError>(asCall)) << where;
-      EXPECT_EQ(std::get<RequestError>(asCall).kind, RequestError::Kind::kCloseConnection);
+      EXPECT_EQ(Refused(asCall).kind, RequestError::Kind::kCloseConnection);
     } else {
-      ASSERT_TRUE(std::holds_alternative<Request>(asCall)) << where;
-      EXPECT_EQ(std::get<Request>(asCall).call, c.bits) << where;
+      EXPECT_EQ(Accepted(asCall).call, c.bits);
     }
   }
 }
