@@ -68,11 +68,15 @@ class TestClient {
     std::snprintf(address.sun_path, sizeof(address.sun_path), "%s", socketPath.c_str());
     connected_ = ::connect(fd_, reinterpret_cast<sockaddr*>(&address), sizeof(address)) == 0;
   }
-  ~TestClient() { ::close(fd_); }
+  ~TestClient() { Close(); }
   TestClient(const TestClient&) = delete;
   TestClient& operator=(const TestClient&) = delete;
 
   bool connected() const { return connected_; }
+  void Close() {
+    if (fd_ >= 0) ::close(fd_);
+    fd_ = -1;
+  }
 
   bool SendBytes(const std::vector<uint8_t>& bytes) {
     size_t sent = 0;
