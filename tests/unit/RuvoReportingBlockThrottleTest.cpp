@@ -217,25 +217,6 @@ TEST_F(ThrottleDeliveryTest, KeysFireInFireDateOrderAndAShorterDuplicateMovesThe
   EXPECT_TRUE(onQueue_);
 }
 
-// Each callback runs only once a full throttle time has passed since it was added.
-TEST_F(ThrottleDeliveryTest, StreamOfDuplicatesNeverDeliversBeforeTheThrottleTime) {
-  std::vector<Duration> added;
-  for (int i = 0; i < 60; ++i) {
-    added.push_back(dispatcher_.Time().Now() - start_);
-    Add(i, 9, 0.03);
-    dispatcher_.AdvanceBy(milliseconds(i % 3 == 0 ? 35 : 5));
-  }
-  dispatcher_.AdvanceBy(seconds(1));
-  ASSERT_GT(labels_.size(), 1u);
-  EXPECT_EQ(labels_.back(), 59);
-  for (size_t i = 0; i < labels_.size(); ++i) {
-    if (i > 0) {
-      EXPECT_GT(labels_[i], labels_[i - 1]);
-    }
-    EXPECT_GE(at_[i] - added[labels_[i]], milliseconds(29)) << labels_[i];
-  }
-}
-
 // Two keys are due at once, so both expiries are queued before either callback runs. While the
 // first runs, a duplicate moves the second key's date: the expiry already queued for it must not
 // deliver the new callback early.
