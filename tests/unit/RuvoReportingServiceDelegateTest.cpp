@@ -323,21 +323,6 @@ TEST_F(ServiceDelegateTest, DestroyStopsARunningSessionAndReportersAreListedInOr
                                                   "destroy0=YES"}));
 }
 
-TEST_F(ServiceDelegateTest, EntryLinesAreDebugOnlyWhenVerboseAndLinesNameTheOperation) {
-  log.SetVerbose(false);
-  auto client = Connect(100);
-  client->service().createReportingSession(7, client->Bool("create"));
-  Run();
-  EXPECT_EQ(log.Count("creating session for reporter 7"), 0u);
-  log.SetVerbose(true);
-  client->service().createReportingSession(8, client->Bool("create"));
-  Run();
-  EXPECT_EQ(log.Count("creating session for reporter 8", LogLevel::kDebug), 1u);
-  // Lines written from the queued work name the operation, not the lambda that runs it.
-  EXPECT_EQ(log.Count(":createReportingSession: session created for reporter 8"), 1u);
-  EXPECT_EQ(log.Count("operator()"), 0u);
-}
-
 // Pings only while probes come back through the work queue within the interval; a stuck queue
 // stops them, holds one probe at the most, and they resume once it turns again.
 TEST(ServiceWatchdogTest, PingsOnlyWhileTheQueueTurns) {
