@@ -226,23 +226,19 @@ TEST(IsolationLimitsE2eTest, WideFramesAndLongReporterListsAreRefusedWithoutStal
       << service.Log();
 }
 
-// The frame limit is a setting: a frame over it ends the connection, one under it is answered.
-TEST(IsolationLimitsE2eTest, FrameLimitComesFromTheSettings) {
+// Both limits below are settings. A frame over the frame limit ends its connection, one under it
+// is answered. A connection keeps a bounded number of sessions: one more is refused with code 1
+// and creates nothing; re-creating an ID it has is no new session, destroying one frees a place,
+// and another connection has places of its own.
+TEST(IsolationLimitsE2eTest, FrameAndSessionsPerConnectionLimitsComeFromTheSettings) {
   TavrindProcess service;
-  ASSERT_TRUE(StartWith(service, "[limits]\nframe_bytes = 70000\n")) << service.Log();
+  ASSERT_TRUE(StartWith(service, "[limits]\nframe_bytes = 70000\nsessions_per_connection = 3\n"))
+      << service.Log();
   for (auto [text, answered] : {std::pair{69'000, true}, {71'000, false}}) {
-    TestClient client(service.SocketPath());
-    EXPECT_EQ(Ask(client, 1, Message({{"t", std::string(text, 'x')}}), 2s).has_value(), answered);
+    TestClient sender(service.SocketPath());
+    EXPECT_EQ(Ask(sender, 1, Message({{"t", std::string(text, 'x')}}), 2s).has_value(), answered);
   }
   EXPECT_TRUE(service.WaitForLog("outside 1..70000")) << service.Log();
-}
-
-// A connection keeps a bounded number of sessions: one more is refused with code 1 and creates
-// nothing; re-creating an ID it has is no new session, destroying one frees a place, and another
-// connection has places of its own.
-TEST(IsolationLimitsE2eTest, SessionsPerConnectionAreBounded) {
-  TavrindProcess service;
-  ASSERT_TRUE(StartWith(service, "[limits]\nsessions_per_connection = 3\n")) << service.Log();
   TestClient client(service.SocketPath());
   TestClient other(service.SocketPath());
   uint64_t call = 0;
