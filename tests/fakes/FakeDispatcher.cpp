@@ -57,22 +57,16 @@ class FakeQueue final : public SerialQueue {
   void Async(Work work) override {
     auto state = state_.lock();
     if (!state || !work) return;
-    std::unique_lock lock(state->mutex);
-    if (state->closed) {
-      lock.unlock();  // the work's captures may call back in as they are released
-      return;
-    }
-    items.emplace_back(state->nextSequence++, std::move(work));
+    // Released before `work`, a parameter, is: its captures may call back in as they go.
+    std::lock_guard lock(state->mutex);
+    if (!state->closed) items.emplace_back(state->nextSequence++, std::move(work));
   }
 
   void AsyncAfter(Duration delay, Work work) override {
     auto state = state_.lock();
     if (!state || !work) return;
-    std::unique_lock lock(state->mutex);
-    if (state->closed) {
-      lock.unlock();
-      return;
-    }
+    std::lock_guard lock(state->mutex);
+    if (state->closed) return;
     // The fire function holds the queue, as a pending timer does in the real dispatcher.
     state->delayed.emplace(state->NextKeyLocked(delay),
                            [self = shared_from_this_queue(), work = std::move(work)]() mutable {
