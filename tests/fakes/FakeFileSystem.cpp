@@ -53,7 +53,7 @@ OptionalError FakeFileSystem::WriteFileAtomically(const std::string& path,
   if (directories_.count(normalized) > 0) {
     return FileError(kIsADirectory, "Is a directory", normalized);
   }
-  if (requireParents_ && directories_.count(Parent(normalized)) == 0) {
+  if (directories_.count(Parent(normalized)) == 0) {
     return FileError(kNoSuchFile, "No such file or directory", normalized);
   }
   files_[normalized] = std::string(contents);
@@ -68,11 +68,6 @@ void FakeFileSystem::FailCreateDirectories(OptionalError error) {
 void FakeFileSystem::FailWrites(OptionalError error) {
   std::lock_guard lock(mutex_);
   writeError_ = std::move(error);
-}
-
-void FakeFileSystem::SetRequireParents(bool require) {
-  std::lock_guard lock(mutex_);
-  requireParents_ = require;
 }
 
 void FakeFileSystem::AddDirectory(const std::string& path, unsigned mode) {
