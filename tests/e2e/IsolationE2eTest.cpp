@@ -363,7 +363,7 @@ TEST(IsolationLimitsE2eTest, ManyClientsThatNeverReadCannotExhaustTheService) {
   const auto started = std::chrono::steady_clock::now();
   EXPECT_EQ(Ask(newcomer, 1, protocol::GetAllReporters{}, 60s), protocol::Status::kOk)
       << service.Log();
-  EXPECT_LT(std::chrono::steady_clock::now() - started, 5 * kSlowBuild);
+  EXPECT_LT(std::chrono::steady_clock::now() - started, 15 * kSlowBuild);
   EXPECT_LT(PeakRssBytes(service.pid()), size_t{512} << 20);
   EXPECT_GT(service.LogCount("the largest reply backlog"), 0u) << "the total was never enforced";
   EXPECT_EQ(service.Stop(), 0);
