@@ -3,6 +3,7 @@
 
 #include <atomic>
 #include <csignal>
+#include <filesystem>
 #include <thread>
 
 #include "tests/support/StoreFiles.h"
@@ -14,6 +15,12 @@ namespace {
 using testing::QueryStore;
 using testing::TavrindProcess;
 using testing::TestClient;
+
+protocol::Reply MustRead(TestClient& client, const TavrindProcess& service) {
+  auto reply = client.Read();
+  EXPECT_TRUE(reply) << service.Log();
+  return reply.value_or(protocol::Reply{});
+}
 
 TEST(ClientsE2eTest, ClientKilledMidSessionIsCleanedUpOnceAndItsUptimeRecorded) {
   TavrindProcess service;
@@ -103,6 +110,46 @@ TEST(ClientsE2eTest, FiftyConcurrentClientsLoseNoMessageAndGetStartBeforeStop) {
     EXPECT_EQ(row[1], std::to_string(kMessages)) << "reporter " << row[0];
     EXPECT_EQ(row[2], std::to_string(kMessages)) << "reporter " << row[0];
   }
+}
+
+// What the running service adds to a client's session: the driver counters it reads under its
+// root at start and stop, and the summary file of an internal build.
+TEST(ClientsE2eTest, AStoppedSessionCarriesTheDriverCountersAndAnInternalBuildWritesItsSummary) {
+  const std::string root = testing::MakeTempDirectory("tavrin-e2e-");
+  testing::WriteFileAtomically(root + "/driverstats/Speaker/xruns", "5\n");
+  testing::WriteFileAtomically(root + "/driverstats/Haptics/Stats/actuations", "100\n");
+  testing::WriteFileAtomically(root + "/etc/device.toml", "InternalBuild = true\n");
+  TavrindProcess service({}, root);
+  ASSERT_TRUE(service.Start()) << service.Log();
+  TestClient client(service.SocketPath());
+  client.Send(1, protocol::CreateReportingSession{21});
+  client.Send(2, protocol::SetServiceType{3, 21});
+  client.Send(4, protocol::StartReportingSessionForID{21});
+  // Requests run in order: once this one is answered, the start has taken its snapshot.
+  client.Send(40, protocol::GetAllReporters{});
+  for (uint64_t call : {1, 2, 40}) EXPECT_EQ(MustRead(client, service).call, call);
+  testing::WriteFileAtomically(root + "/driverstats/Speaker/xruns",
+                               "9\n");  // +4; actuations unchanged
+  client.Send(5, protocol::SendMessage{Dictionary{{"a", 1}}, 1, 0, std::vector<int64_t>{21}});
+  client.Send(6, protocol::StopReportingSessionForID{21});
+  for (uint64_t call : {5, 4, 6}) EXPECT_EQ(MustRead(client, service).call, call);
+  EXPECT_TRUE(testing::WaitUntil([&] {
+    return !testing::QueryStoreColumn(service.DatabasePath(),
+                                      "SELECT 1 FROM session_messages WHERE category = 9")
+                .empty();
+  })) << service.Log();
+  EXPECT_EQ(service.Stop(SIGTERM), 0);
+
+  EXPECT_EQ(testing::QueryStoreColumn(
+                service.DatabasePath(),
+                "SELECT payload FROM session_messages WHERE category = 9 AND type = 0"),
+            (std::vector<std::string>{"{\"Speaker_xruns\":4}"}));
+  // One summary file, in a directory no other local user can write to, so none can forge or
+  // delete summaries (its name and content are checked through tavrinctl's e2e suite).
+  const std::string summaries = root + "/log/DiagnosticLogs/Audio/Reporting";
+  EXPECT_EQ(std::distance(std::filesystem::directory_iterator(summaries), {}), 1);
+  EXPECT_EQ(std::filesystem::status(summaries).permissions() & std::filesystem::perms::all,
+            std::filesystem::perms(0750));
 }
 
 }  // namespace

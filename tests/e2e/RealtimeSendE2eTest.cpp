@@ -8,8 +8,6 @@
 #include <dlfcn.h>
 #include <gtest/gtest.h>
 #include <pthread.h>
-#include <sys/socket.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -143,12 +141,8 @@ TEST(RealtimeSendE2eTest, AServiceThatNeverReadsOnlyFillsTheQueue) {
   // queue fills, and the audio thread's sends keep returning at once.
   const std::string directory = testing::MakeTempDirectory("tavrin-rt-");
   const std::string path = directory + "/reporting.sock";
-  const int listener = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  std::snprintf(address.sun_path, sizeof(address.sun_path), "%s", path.c_str());
-  ASSERT_EQ(::bind(listener, reinterpret_cast<sockaddr*>(&address), sizeof(address)), 0);
-  ASSERT_EQ(::listen(listener, 4), 0);
+  const int listener = testing::BindUnixSocket(path, true);
+  ASSERT_GE(listener, 0);
   tavrin_client* client = tavrin_open(path.c_str(), 64, nullptr);
   ASSERT_NE(client, nullptr);
   const int accepted = ::accept(listener, nullptr, nullptr);

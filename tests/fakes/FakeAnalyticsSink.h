@@ -61,13 +61,6 @@ class FakeAnalyticsSink final : public AnalyticsSink {
     std::lock_guard lock(mutex_);
     return events_;
   }
-  std::vector<Event> EventsNamed(const std::string& name) const {
-    std::vector<Event> found;
-    for (auto& event : Events()) {
-      if (event.name == name) found.push_back(event);
-    }
-    return found;
-  }
 
  private:
   bool RunBuilder(size_t index) {

@@ -41,12 +41,6 @@ class FakeClock final : public Clock {
     wallNow_ += duration;
   }
 
-  // Sets the calendar time alone, as a clock adjustment would; the monotonic time is unchanged.
-  void SetWallNow(WallTime wallNow) {
-    std::lock_guard lock(mutex_);
-    wallNow_ = wallNow;
-  }
-
  private:
   mutable std::mutex mutex_;
   SteadyTime now_ = kStartSteadyTime;  // guarded by mutex_

@@ -7,6 +7,7 @@
 #include <mutex>
 #include <thread>
 #include <utility>
+#include <vector>
 
 #include <gtest/gtest.h>
 
@@ -35,7 +36,6 @@ struct FakeDispatcher::State {
   std::shared_ptr<FakeQueue> background;
   // Hands a due item to its queue; called without the lock.
   std::map<FireKey, std::function<void()>> delayed;
-  std::vector<Duration> timerDelays;
   // AsyncDeferred items not handed over yet, in the order given.
   std::map<uint64_t, std::pair<WorkQueue*, Work>> deferred;
   bool running = false;  // inside RunUntilIdle
@@ -58,23 +58,16 @@ class FakeQueue final : public SerialQueue {
   void Async(Work work) override {
     auto state = state_.lock();
     if (!state || !work) return;
-    std::unique_lock lock(state->mutex);
-    if (state->closed) {
-      lock.unlock();  // the work's captures may call back in as they are released
-      return;
-    }
-    items.emplace_back(state->nextSequence++, std::move(work));
+    // Released before `work`, a parameter, is: its captures may call back in as they go.
+    std::lock_guard lock(state->mutex);
+    if (!state->closed) items.emplace_back(state->nextSequence++, std::move(work));
   }
 
   void AsyncAfter(Duration delay, Work work) override {
     auto state = state_.lock();
     if (!state || !work) return;
-    std::unique_lock lock(state->mutex);
-    delays.push_back(delay);
-    if (state->closed) {
-      lock.unlock();
-      return;
-    }
+    std::lock_guard lock(state->mutex);
+    if (state->closed) return;
     // The fire function holds the queue, as a pending timer does in the real dispatcher.
     state->delayed.emplace(state->NextKeyLocked(delay),
                            [self = shared_from_this_queue(), work = std::move(work)]() mutable {
@@ -118,7 +111,6 @@ class FakeQueue final : public SerialQueue {
   // Guarded by State::mutex.
   std::deque<std::pair<uint64_t, Work>> items;
   unsigned suspensions = 0;
-  std::vector<Duration> delays;
 
  private:
   const std::weak_ptr<FakeDispatcher::State> state_;
@@ -156,7 +148,6 @@ class FakeTimer final : public Timer {
     const uint64_t generation = ++state_->generation;
     if (!dispatcher) return;
     std::lock_guard lock(dispatcher->mutex);
-    dispatcher->timerDelays.push_back(delay);
     if (state_->entry) dispatcher->delayed.erase(*state_->entry);
     state_->entry.reset();
     if (dispatcher->closed) return;
@@ -382,18 +373,6 @@ size_t FakeDispatcher::PendingCount(const WorkQueue& queue) const {
   return fake->items.size();
 }
 
-size_t FakeDispatcher::PendingCount() const {
-  std::lock_guard lock(state_->mutex);
-  size_t count = state_->background->items.size();
-  for (const auto& queue : state_->queues) count += queue->items.size();
-  return count;
-}
-
-size_t FakeDispatcher::DelayedCount() const {
-  std::lock_guard lock(state_->mutex);
-  return state_->delayed.size();
-}
-
 std::optional<Duration> FakeDispatcher::NextFireDelay() const {
   std::lock_guard lock(state_->mutex);
   if (state_->delayed.empty()) return std::nullopt;
@@ -407,31 +386,12 @@ bool FakeDispatcher::IsSuspended(const WorkQueue& queue) const {
   return fake->suspensions > 0;
 }
 
-std::vector<FakeDispatcher::QueueInfo> FakeDispatcher::CreatedQueues() const {
-  std::lock_guard lock(state_->mutex);
-  std::vector<QueueInfo> infos;
-  for (const auto& queue : state_->queues) infos.push_back({queue->Label(), queue->Qos()});
-  return infos;
-}
-
 SerialQueuePtr FakeDispatcher::FindQueue(std::string_view label) const {
   std::lock_guard lock(state_->mutex);
   for (auto it = state_->queues.rbegin(); it != state_->queues.rend(); ++it) {
     if ((*it)->Label() == label) return *it;
   }
   return nullptr;
-}
-
-std::vector<Duration> FakeDispatcher::AsyncAfterDelays(const WorkQueue& queue) const {
-  const FakeQueue* fake = AsFakeQueue(queue, state_.get());
-  if (!fake) return {};
-  std::lock_guard lock(state_->mutex);
-  return fake->delays;
-}
-
-std::vector<Duration> FakeDispatcher::TimerDelays() const {
-  std::lock_guard lock(state_->mutex);
-  return state_->timerDelays;
 }
 
 }  // namespace tavrin::testing

@@ -5,7 +5,6 @@
 #include <optional>
 #include <string>
 #include <string_view>
-#include <vector>
 
 #include "platform/Dispatcher.h"
 #include "tests/fakes/FakeClock.h"
@@ -54,27 +53,11 @@ class FakeDispatcher final : public Dispatcher {
 
   // Items queued on `queue` and not yet run (held by suspension or not).
   size_t PendingCount(const WorkQueue& queue) const;
-  // Items queued on every queue of this dispatcher.
-  size_t PendingCount() const;
-  // AsyncAfter items and armed timers that have not fallen due yet.
-  size_t DelayedCount() const;
   // How long from now until the earliest delayed item or armed timer falls due.
   std::optional<Duration> NextFireDelay() const;
   bool IsSuspended(const WorkQueue& queue) const;
-
-  struct QueueInfo {
-    std::string label;
-    QualityOfService qos;
-  };
-  // Serial queues created so far, in creation order (the background queue is not among them).
-  std::vector<QueueInfo> CreatedQueues() const;
   // The most recently created serial queue with `label`, or nullptr.
   SerialQueuePtr FindQueue(std::string_view label) const;
-  // The delays asked of `queue`'s AsyncAfter, in call order.
-  std::vector<Duration> AsyncAfterDelays(const WorkQueue& queue) const;
-  std::vector<Duration> BackgroundDelays() const { return AsyncAfterDelays(background_); }
-  // Every delay given to a timer's ScheduleAfter, in call order.
-  std::vector<Duration> TimerDelays() const;
 
   struct State;
 

@@ -31,11 +31,6 @@ void FakeDriverStatsService::SetValue(int id, int64_t value) {
   channels_.at(size_t(id)).value = value;
 }
 
-void FakeDriverStatsService::RemoveChannel(int id) {
-  std::lock_guard lock(mutex_);
-  channels_.at(size_t(id)).removed = true;
-}
-
 void FakeDriverStatsService::FailCopyChannels(Name group, Name subgroup, Failure failure) {
   std::lock_guard lock(mutex_);
   copyFailures_[{std::move(group), std::move(subgroup)}] = failure;
@@ -59,11 +54,6 @@ void FakeDriverStatsService::AnswerNoChannels(Name group, Name subgroup) {
 std::vector<FakeDriverStatsService::DeltaCall> FakeDriverStatsService::DeltaCalls() const {
   std::lock_guard lock(mutex_);
   return deltaCalls_;
-}
-
-int FakeDriverStatsService::CreateSamplesCalls() const {
-  std::lock_guard lock(mutex_);
-  return createSamplesCalls_;
 }
 
 int FakeDriverStatsService::CreateSubscriptionCalls() const {
@@ -102,7 +92,6 @@ std::optional<DriverChannels> FakeDriverStatsService::CopyChannelsInGroup(
   Value list = Value::array();
   for (size_t id = 0; id < channels_.size(); ++id) {
     const Channel& channel = channels_[id];
-    if (channel.removed) continue;
     if (!Matches(group, channel.group) || !Matches(subgroup, channel.subgroup)) continue;
     list.push_back(Value{{"id", id}, {"name", NameValue(channel.name)}});
   }
@@ -130,7 +119,6 @@ DriverSubscription FakeDriverStatsService::CreateSubscription(const DriverChanne
 std::optional<DriverSampleSet> FakeDriverStatsService::CreateSamples(
     DriverSubscription subscription, const DriverChannels& subscribed, OptionalError* error) {
   std::lock_guard lock(mutex_);
-  ++createSamplesCalls_;
   const auto known = subscriptions_.find(subscription);
   if (known == subscriptions_.end()) {
     if (error != nullptr) *error = Error{kErrorDomain, 22, "unknown subscription"};
@@ -141,7 +129,7 @@ std::optional<DriverSampleSet> FakeDriverStatsService::CreateSamples(
   Value samples = Value::array();
   for (const auto& entry : subscribed.at("channels")) {
     const auto id = entry.at("id").get<size_t>();
-    if (id >= channels_.size() || channels_[id].removed) continue;
+    if (id >= channels_.size()) continue;
     samples.push_back(
         Value{{"id", id}, {"name", NameValue(channels_[id].name)}, {"value", channels_[id].value}});
   }

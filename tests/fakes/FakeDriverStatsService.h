@@ -28,8 +28,6 @@ class FakeDriverStatsService final : public DriverStatsService {
   // Adds a channel and returns its id. `name` may be absent (a channel without a name).
   int AddChannel(Name group, Name subgroup, Name name, int64_t value);
   void SetValue(int id, int64_t value);
-  // A removed channel is no longer listed nor sampled.
-  void RemoveChannel(int id);
 
   // An injected failure of one operation. `code` goes into the Error; `withResult` also returns
   // the result the operation would have given; `times` failures (-1: every call).
@@ -54,7 +52,6 @@ class FakeDriverStatsService final : public DriverStatsService {
     DriverSampleSet current;
   };
   std::vector<DeltaCall> DeltaCalls() const;
-  int CreateSamplesCalls() const;
   int CreateSubscriptionCalls() const;
   // The queries CopyChannelsInGroup was asked, in order.
   std::vector<std::pair<Name, Name>> Queries() const;
@@ -83,7 +80,6 @@ class FakeDriverStatsService final : public DriverStatsService {
   struct Channel {
     Name group, subgroup, name;
     int64_t value = 0;
-    bool removed = false;
   };
   using Query = std::pair<Name, Name>;
   // True (and *error filled) when the scripted failure for `query` fires now; consumes one use.
@@ -99,7 +95,6 @@ class FakeDriverStatsService final : public DriverStatsService {
   DriverSubscription nextSubscription_ = 100;
   std::vector<DeltaCall> deltaCalls_;
   std::vector<Query> queries_;
-  int createSamplesCalls_ = 0;
   int createSubscriptionCalls_ = 0;
 };
 

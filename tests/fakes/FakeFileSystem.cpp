@@ -80,7 +80,7 @@ OptionalError FakeFileSystem::CheckWriteLocked(const std::string& path) {
   writeCalls_.push_back(path);
   if (writeError_) return writeError_;
   if (directories_.count(path) > 0) return FileError(kIsADirectory, "Is a directory", path);
-  if (requireParents_ && directories_.count(Parent(path)) == 0) {
+  if (directories_.count(Parent(path)) == 0) {
     return FileError(kNoSuchFile, "No such file or directory", path);
   }
   return std::nullopt;
@@ -96,8 +96,7 @@ std::unique_ptr<WritableFile> FakeFileSystem::OpenForAppend(const std::string& p
                                                             OptionalError* error) {
   const std::string normalized = Normalize(path);
   std::lock_guard lock(mutex_);
-  if (directories_.count(normalized) > 0 ||
-      (requireParents_ && directories_.count(Parent(normalized)) == 0)) {
+  if (directories_.count(normalized) > 0 || directories_.count(Parent(normalized)) == 0) {
     *error = FileError(kNoSuchFile, "No such file or directory", normalized);
     return nullptr;
   }
@@ -154,11 +153,6 @@ void FakeFileSystem::FailCreateDirectories(OptionalError error) {
 void FakeFileSystem::FailWrites(OptionalError error) {
   std::lock_guard lock(mutex_);
   writeError_ = std::move(error);
-}
-
-void FakeFileSystem::SetRequireParents(bool require) {
-  std::lock_guard lock(mutex_);
-  requireParents_ = require;
 }
 
 void FakeFileSystem::AddDirectory(const std::string& path, unsigned mode) {

@@ -15,7 +15,7 @@
 namespace tavrin::testing {
 
 // Files and directories in memory, with errors that can be injected per operation. Like a real
-// file system, a write needs its parent directory (unless SetRequireParents(false)), and a path
+// file system, a write needs its parent directory, and a path
 // cannot be both a file and a directory. Paths are absolute; repeated and trailing "/" are
 // ignored. Thread-safe.
 class FakeFileSystem final : public FileSystem {
@@ -41,7 +41,6 @@ class FakeFileSystem final : public FileSystem {
   // changes nothing).
   void FailCreateDirectories(OptionalError error);
   void FailWrites(OptionalError error);
-  void SetRequireParents(bool require);
 
   // Adds a directory (and its parents) directly, as if it had been there before.
   void AddDirectory(const std::string& path, unsigned mode = 0755);
@@ -67,7 +66,6 @@ class FakeFileSystem final : public FileSystem {
   std::map<std::string, unsigned> directories_{{"/", 0755}};   // guarded by mutex_
   OptionalError createError_;                                  // guarded by mutex_
   OptionalError writeError_;                                   // guarded by mutex_
-  bool requireParents_ = true;                                 // guarded by mutex_
   std::vector<std::pair<std::string, unsigned>> createCalls_;  // guarded by mutex_
   std::vector<std::string> writeCalls_;                        // guarded by mutex_
 };

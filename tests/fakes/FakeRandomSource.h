@@ -24,10 +24,6 @@ class FakeRandom final : public RandomSource {
     std::lock_guard lock(mutex_);
     scripted_.insert(scripted_.end(), values.begin(), values.end());
   }
-  void SetDefault(uint64_t fallback) {
-    std::lock_guard lock(mutex_);
-    fallback_ = fallback;
-  }
 
   uint64_t UniformBelow(uint64_t bound) override {
     std::lock_guard lock(mutex_);
@@ -53,16 +49,12 @@ class FakeRandom final : public RandomSource {
     std::lock_guard lock(mutex_);
     return bounds_;
   }
-  size_t ScriptedLeft() const {
-    std::lock_guard lock(mutex_);
-    return scripted_.size();
-  }
 
  private:
   mutable std::mutex mutex_;
   std::deque<uint64_t> scripted_;  // guarded by mutex_
-  uint64_t fallback_;              // guarded by mutex_
-  std::vector<uint64_t> bounds_;   // guarded by mutex_
+  const uint64_t fallback_;
+  std::vector<uint64_t> bounds_;  // guarded by mutex_
 };
 
 }  // namespace tavrin::testing

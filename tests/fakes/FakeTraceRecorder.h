@@ -19,10 +19,6 @@ class RecordingTraceRecorder final : public TraceRecorder {
     std::lock_guard lock(mutex_);
     codes_.push_back(code);
   }
-  std::vector<uint32_t> Codes() const {
-    std::lock_guard lock(mutex_);
-    return codes_;
-  }
   size_t Count(uint32_t code) const {
     std::lock_guard lock(mutex_);
     return static_cast<size_t>(std::count(codes_.begin(), codes_.end(), code));

@@ -26,32 +26,6 @@ enum class IntFormat {
   kInt64,
 };
 
-inline std::string_view IntFormatName(IntFormat format) {
-  switch (format) {
-    case IntFormat::kPositiveFixint:
-      return "positive fixint";
-    case IntFormat::kNegativeFixint:
-      return "negative fixint";
-    case IntFormat::kUint8:
-      return "uint8";
-    case IntFormat::kUint16:
-      return "uint16";
-    case IntFormat::kUint32:
-      return "uint32";
-    case IntFormat::kUint64:
-      return "uint64";
-    case IntFormat::kInt8:
-      return "int8";
-    case IntFormat::kInt16:
-      return "int16";
-    case IntFormat::kInt32:
-      return "int32";
-    case IntFormat::kInt64:
-      return "int64";
-  }
-  return "?";
-}
-
 class Pack {
  public:
   const std::vector<uint8_t>& bytes() const { return bytes_; }
@@ -129,10 +103,6 @@ class Pack {
     if (pairs <= 15) return raw({static_cast<uint8_t>(0x80 | pairs)});
     if (pairs <= 0xffff) return big(0xde, pairs, 2);
     return big(0xdf, pairs, 4);
-  }
-  Pack& zeros(size_t count) {
-    bytes_.insert(bytes_.end(), count, 0);
-    return *this;
   }
   // A format byte followed by `size` bytes of `value`, big-endian.
   Pack& big(uint8_t format, uint64_t value, int size) {  // size 1 to 8

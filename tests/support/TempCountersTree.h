@@ -35,28 +35,20 @@ class TempCountersTree {
   // Writes `text` to <root>/<rel> the way exporters do: a dot-named temporary file in the same
   // directory, renamed over the counter.
   void write(const std::string& rel, const std::string& text) const {
-    const std::filesystem::path target = base_ / "tree" / rel;
+    const std::filesystem::path target = path(rel);
     std::filesystem::create_directories(target.parent_path());
-    const std::filesystem::path temp =
-        target.parent_path() / ("." + target.filename().string() + ".tmp");
-    {
-      std::ofstream out(temp, std::ios::binary | std::ios::trunc);
-      out << text;
-    }
+    const auto temp = target.parent_path() / ("." + target.filename().string() + ".tmp");
+    std::ofstream(temp, std::ios::binary | std::ios::trunc) << text;  // closed before the rename
     std::filesystem::rename(temp, target);
   }
   void write(const std::string& rel, long long value) const {
     write(rel, std::to_string(value) + "\n");
   }
-  void makeDirectory(const std::string& rel) const {
-    std::filesystem::create_directories(base_ / "tree" / rel);
-  }
-  void remove(const std::string& rel) const { std::filesystem::remove_all(base_ / "tree" / rel); }
+  void remove(const std::string& rel) const { std::filesystem::remove_all(path(rel)); }
   // A symbolic link at <root>/<rel> holding `target` as given (relative or absolute).
   void link(const std::string& target, const std::string& rel) const {
-    const std::filesystem::path at = base_ / "tree" / rel;
-    std::filesystem::create_directories(at.parent_path());
-    std::filesystem::create_symlink(target, at);
+    std::filesystem::create_directories(std::filesystem::path(path(rel)).parent_path());
+    std::filesystem::create_symlink(target, path(rel));
   }
 
  private:

@@ -27,10 +27,8 @@ inline constexpr auto kE2eTimeout = std::chrono::seconds(20);
 
 inline std::string MakeTempDirectory(const char* prefix) {
   std::string pattern = (std::filesystem::temp_directory_path() / prefix).string() + "XXXXXX";
-  std::vector<char> buffer(pattern.begin(), pattern.end());
-  buffer.push_back('\0');
-  if (mkdtemp(buffer.data()) == nullptr) std::abort();
-  return buffer.data();
+  if (mkdtemp(pattern.data()) == nullptr) std::abort();
+  return pattern;
 }
 
 // A unix socket bound at `path`, listening when `listen` is set (-1 on failure). Closed unheard,

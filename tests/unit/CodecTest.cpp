@@ -15,7 +15,6 @@ namespace {
 
 using Bytes = std::vector<uint8_t>;
 using tavrin::testing::IntFormat;
-using tavrin::testing::IntFormatName;
 using tavrin::testing::Pack;
 
 constexpr int64_t kInt64Min = std::numeric_limits<int64_t>::min();
@@ -102,46 +101,6 @@ TEST(CodecTest, RequestWireFormIsCallOpThenArgumentsInOrder) {
   EXPECT_EQ(EncodeRequest({2, GetAllReporters{}}), Pack().array(2).uint(2).uint(10).bytes());
 }
 
-TEST(CodecTest, NilCallMeansNoReplyWanted) {
-  const Request request = Accepted(Pack().array(3).nil().uint(9).uint(4));
-  EXPECT_FALSE(request.call.has_value());
-  EXPECT_EQ(request.arguments, Arguments(ReporterIDValid{4}));
-}
-
-TEST(CodecTest, ForeignEncodingsOfSmallNumbersAreAccepted) {
-  // A client may write the op and small numbers in signed or wide formats.
-  const Request request = Accepted(Pack()
-                                       .array(4)
-                                       .integer(IntFormat::kInt64, 12)
-                                       .integer(IntFormat::kInt8, 2)
-                                       .integer(IntFormat::kUint64, 7)
-                                       .integer(IntFormat::kInt16, 8));
-  EXPECT_EQ(request.call, 12u);
-  EXPECT_EQ(request.arguments, Arguments(SetServiceType{7, 8}));
-}
-
-TEST(CodecTest, DictionaryArgumentsKeepTheirOrderAndValueKinds) {
-  const Request request = Accepted(Pack()
-                                       .array(4)
-                                       .uint(1)
-                                       .uint(4)
-                                       .map(4)
-                                       .str("z")
-                                       .float32(1.5f)
-                                       .str("a")
-                                       .integer(IntFormat::kInt32, static_cast<uint64_t>(-7))
-                                       .str("m")
-                                       .array(2)
-                                       .str("x")
-                                       .nil()
-                                       .str("b")
-                                       .boolean(true)
-                                       .uint(3));
-  const auto& args = std::get<SetConfiguration>(request.arguments);
-  EXPECT_EQ(args.configuration.dump(), R"({"z":1.5,"a":-7,"m":["x",null],"b":true})");
-  EXPECT_EQ(args.reporterID, 3);
-}
-
 // ---------------------------------------------------------------------------------------------
 // Integers at every format's edges, in every argument position that takes an integer
 
@@ -182,71 +141,50 @@ std::vector<IntegerCase> IntegerCases() {
   };
 }
 
-// Expects `body` accepted when `fits`, else refused with code 4 and call 77.
-void ExpectFitsOrOutOfRange(const Bytes& body, bool fits, const std::string& where) {
-  auto decoded = DecodeRequest(body);
-  if (fits) {
-    EXPECT_TRUE(std::holds_alternative<Request>(decoded)) << where;
-    return;
-  }
-  ASSERT_TRUE(std::holds_alternative<RequestError>(decoded)) << where;
-  const auto& error = std::get<RequestError>(decoded);
-  EXPECT_EQ(error.kind, RequestError::Kind::kReject) << where;
-  EXPECT_EQ(error.code, RejectCode::kIntegerOutOfRange) << where << ": " << error.reason;
-  EXPECT_EQ(error.call, 77u) << where;
+// The arguments of `body` when it `fits`; otherwise expects it refused with code 4 and call 77.
+std::optional<Arguments> FitsOrOutOfRange(const Bytes& body, bool fits) {
+  if (fits) return Accepted(body).arguments;
+  const RequestError error = Refused(body);
+  EXPECT_EQ(error.kind, RequestError::Kind::kReject);
+  EXPECT_EQ(error.code, RejectCode::kIntegerOutOfRange) << error.reason;
+  EXPECT_EQ(error.call, 77u);
+  return std::nullopt;
 }
 
 TEST(CodecTest, IntegersAtEveryFormatsEdgesFitTheirArgumentTypeByValue) {
   for (const IntegerCase& c : IntegerCases()) {
-    const std::string where =
-        std::string(IntFormatName(c.format)) + " bits " + std::to_string(c.bits);
+    SCOPED_TRACE("format " + std::to_string(static_cast<int>(c.format)) + " bits " +
+                 std::to_string(c.bits));
     const Bytes n = Pack().integer(c.format, c.bits);
-
-    // reporterID (signed 64-bit), and the value that arrives.
-    const Bytes create = RequestBytes(1, Pack().uint(1), n);
-    ExpectFitsOrOutOfRange(create, c.fitsInt64, where + " as reporterID");
-    if (c.fitsInt64) {
-      EXPECT_EQ(std::get<CreateReportingSession>(Accepted(create).arguments).reporterID,
-                static_cast<int64_t>(c.bits))
-          << where;
+    // In each integer argument, with the value that arrives: reporterID (signed 64-bit),
+    // serviceType (unsigned 16-bit; type converts the same way), category (unsigned 32-bit) and an
+    // element of reporterIDs.
+    if (auto a = FitsOrOutOfRange(RequestBytes(1, Pack().uint(1), n), c.fitsInt64)) {
+      EXPECT_EQ(std::get<CreateReportingSession>(*a).reporterID, static_cast<int64_t>(c.bits));
     }
-    // serviceType (unsigned 16-bit)
-    const Bytes setType = RequestBytes(2, Pack().uint(2), Pack().append(n).uint(1));
-    ExpectFitsOrOutOfRange(setType, c.fitsUint16, where + " as serviceType");
-    if (c.fitsUint16) {
-      EXPECT_EQ(std::get<SetServiceType>(Accepted(setType).arguments).serviceType,
-                static_cast<uint16_t>(c.bits))
-          << where;
+    if (auto a = FitsOrOutOfRange(RequestBytes(2, Pack().uint(2), Pack().append(n).uint(1)),
+                                  c.fitsUint16)) {
+      EXPECT_EQ(std::get<SetServiceType>(*a).serviceType, static_cast<uint16_t>(c.bits));
     }
-    // category (unsigned 32-bit), type (unsigned 16-bit), an element of reporterIDs
-    const Bytes category = RequestBytes(4, Pack().uint(6), Pack().map(0).append(n).uint(0).nil());
-    ExpectFitsOrOutOfRange(category, c.fitsUint32, where + " as category");
-    if (c.fitsUint32) {
-      EXPECT_EQ(std::get<SendMessage>(Accepted(category).arguments).category,
-                static_cast<uint32_t>(c.bits))
-          << where;
+    if (auto a = FitsOrOutOfRange(
+            RequestBytes(4, Pack().uint(6), Pack().map(0).append(n).uint(0).nil()), c.fitsUint32)) {
+      EXPECT_EQ(std::get<SendMessage>(*a).category, static_cast<uint32_t>(c.bits));
     }
-    const Bytes type = RequestBytes(4, Pack().uint(6), Pack().map(0).uint(0).append(n).nil());
-    ExpectFitsOrOutOfRange(type, c.fitsUint16, where + " as type");
     const Bytes ids =
         RequestBytes(4, Pack().uint(6), Pack().map(0).uint(0).uint(0).array(2).uint(1).append(n));
-    ExpectFitsOrOutOfRange(ids, c.fitsInt64, where + " in reporterIDs");
-    if (c.fitsInt64) {
-      EXPECT_EQ(std::get<SendMessage>(Accepted(ids).arguments).reporterIDs,
-                (std::vector<int64_t>{1, static_cast<int64_t>(c.bits)}))
-          << where;
+    if (auto a = FitsOrOutOfRange(ids, c.fitsInt64)) {
+      EXPECT_EQ(std::get<SendMessage>(*a).reporterIDs,
+                (std::vector<int64_t>{1, static_cast<int64_t>(c.bits)}));
     }
 
     // As the call: any integer >= 0 is echoed, a negative one makes the frame undecodable.
     const bool negative = c.format == IntFormat::kNegativeFixint ||
                           (c.format >= IntFormat::kInt8 && static_cast<int64_t>(c.bits) < 0);
-    auto asCall = DecodeRequest(Pack().array(2).append(n).uint(10));
+    const Bytes asCall = Pack().array(2).append(n).uint(10);
     if (negative) {
-      ASSERT_TRUE(std::holds_alternative<RequestError>(asCall)) << where;
-      EXPECT_EQ(std::get<RequestError>(asCall).kind, RequestError::Kind::kCloseConnection);
+      EXPECT_EQ(Refused(asCall).kind, RequestError::Kind::kCloseConnection);
     } else {
-      ASSERT_TRUE(std::holds_alternative<Request>(asCall)) << where;
-      EXPECT_EQ(std::get<Request>(asCall).call, c.bits) << where;
+      EXPECT_EQ(Accepted(asCall).call, c.bits);
     }
   }
 }
@@ -260,8 +198,8 @@ struct RejectCase {
   RejectCode code;
 };
 
+// One row per branch that rejects; integers out of range are in the integer table above.
 std::vector<RejectCase> RejectCases() {
-  const Bytes deep12k = Pack().map(1).str("k").append(Nested(12 * 1024));
   return {
       // 1: op not an integer from 1 to 11
       {"op 0", RequestBytes(0, Pack().uint(0), {}), RejectCode::kUnknownOp},
@@ -270,74 +208,29 @@ std::vector<RejectCase> RejectCases() {
       {"op -1", RequestBytes(0, Pack().integer(IntFormat::kNegativeFixint, -1), {}),
        RejectCode::kUnknownOp},
       {"op \"1\"", RequestBytes(1, Pack().str("1"), Pack().uint(1)), RejectCode::kUnknownOp},
-      {"op nil", RequestBytes(0, Pack().nil(), {}), RejectCode::kUnknownOp},
-      // 2: argument count
+      // 2: argument count, one short and one over
       {"create without ID", RequestBytes(0, Pack().uint(1), {}), RejectCode::kWrongArgumentCount},
       {"create with 2", RequestBytes(2, Pack().uint(1), Pack().uint(1).uint(2)),
-       RejectCode::kWrongArgumentCount},
-      {"sendMessage with 3", RequestBytes(3, Pack().uint(6), Pack().map(0).uint(1).uint(1)),
-       RejectCode::kWrongArgumentCount},
-      {"sendMessage with 5",
-       RequestBytes(5, Pack().uint(6), Pack().map(0).uint(1).uint(1).nil().nil()),
-       RejectCode::kWrongArgumentCount},
-      {"killService with 1", RequestBytes(1, Pack().uint(11), Pack().uint(0)),
        RejectCode::kWrongArgumentCount},
       // 3: argument of the wrong type
       {"reporterID string", RequestBytes(1, Pack().uint(1), Pack().str("5")),
        RejectCode::kWrongArgumentType},
-      {"reporterID float32", RequestBytes(1, Pack().uint(7), Pack().float32(5.0f)),
-       RejectCode::kWrongArgumentType},
-      {"reporterID nil", RequestBytes(1, Pack().uint(9), Pack().nil()),
-       RejectCode::kWrongArgumentType},
-      {"serviceType float", RequestBytes(2, Pack().uint(2), Pack().float64(1.5).uint(1)),
-       RejectCode::kWrongArgumentType},
       {"configuration array", RequestBytes(2, Pack().uint(4), Pack().array(0).uint(1)),
-       RejectCode::kWrongArgumentType},
-      {"message string", RequestBytes(4, Pack().uint(6), Pack().str("m").uint(1).uint(1).nil()),
-       RejectCode::kWrongArgumentType},
-      {"category boolean",
-       RequestBytes(4, Pack().uint(6), Pack().map(0).boolean(false).uint(1).nil()),
        RejectCode::kWrongArgumentType},
       {"reporterIDs map", RequestBytes(4, Pack().uint(6), Pack().map(0).uint(1).uint(1).map(0)),
        RejectCode::kWrongArgumentType},
       {"reporterIDs element float",
        RequestBytes(4, Pack().uint(6), Pack().map(0).uint(1).uint(1).array(2).uint(1).float64(2)),
        RejectCode::kWrongArgumentType},
-      {"reporterIDs element nil",
-       RequestBytes(4, Pack().uint(6), Pack().map(0).uint(1).uint(1).array(1).nil()),
-       RejectCode::kWrongArgumentType},
       {"integer map key",
        RequestBytes(4, Pack().uint(6), Pack().map(1).uint(1).str("v").uint(1).uint(1).nil()),
        RejectCode::kWrongArgumentType},
-      {"nested nil map key",
-       RequestBytes(2, Pack().uint(4), Pack().map(1).str("a").map(1).nil().uint(1).uint(1)),
-       RejectCode::kWrongArgumentType},
-      // 4: out of range
-      {"reporterID 2^63", RequestBytes(1, Pack().uint(1), Pack().uint(uint64_t{1} << 63)),
-       RejectCode::kIntegerOutOfRange},
-      {"serviceType 65536", RequestBytes(2, Pack().uint(2), Pack().uint(65536).uint(1)),
-       RejectCode::kIntegerOutOfRange},
-      {"serviceType -1",
-       RequestBytes(2, Pack().uint(2), Pack().integer(IntFormat::kNegativeFixint, -1).uint(1)),
-       RejectCode::kIntegerOutOfRange},
-      {"category 2^32",
-       RequestBytes(4, Pack().uint(6), Pack().map(0).uint(uint64_t{1} << 32).uint(1).nil()),
-       RejectCode::kIntegerOutOfRange},
-      {"type 65536", RequestBytes(4, Pack().uint(6), Pack().map(0).uint(1).uint(65536).nil()),
-       RejectCode::kIntegerOutOfRange},
       // 5: nesting
-      {"12 KB of nesting in a message",
-       RequestBytes(4, Pack().uint(6), Pack().append(deep12k).uint(1).uint(1).nil()),
-       RejectCode::kTooDeep},
       {"65 levels", RequestBytes(1, Pack().uint(1), Nested(64)), RejectCode::kTooDeep},
       // 6: bin and ext
       {"bin8 in a message",
        RequestBytes(4, Pack().uint(6),
                     Pack().map(1).str("b").raw({0xc4, 1, 0}).uint(1).uint(1).nil()),
-       RejectCode::kUnsupportedType},
-      {"fixext1 as reporterID", RequestBytes(1, Pack().uint(1), Pack().raw({0xd4, 1, 0})),
-       RejectCode::kUnsupportedType},
-      {"ext32 as op", RequestBytes(0, Pack().big(0xc9, 1, 4).raw({1, 2}), {}),
        RejectCode::kUnsupportedType},
   };
 }
@@ -423,22 +316,12 @@ TEST(CodecTest, UndecodableFramesCloseTheConnection) {
   Bytes deepCut = SendWithDepth(70);
   deepCut.pop_back();
   const std::vector<std::pair<std::string, Bytes>> cases = {
-      {"empty", {}},
-      {"truncated", Bytes(valid.begin(), valid.end() - 1)},
+      // Other form faults are MessagePackTest's; every truncation is below.
       {"trailing byte", trailing},
-      {"two requests in one frame", Pack().append(valid).append(valid)},
-      {"invalid byte", Pack().array(2).uint(1).raw({0xc1})},
       {"a map", Pack().map(1).str("call").uint(1)},
-      {"a scalar", Pack().uint(1)},
-      {"an empty array", Pack().array(0)},
       {"call alone", Pack().array(1).uint(1)},
-      {"negative call", Pack().array(2).integer(IntFormat::kInt8, -5).uint(10)},
       {"string call", Pack().array(2).str("1").uint(10)},
-      {"float call", Pack().array(2).float64(1).uint(10)},
-      {"boolean call", Pack().array(2).boolean(false).uint(10)},
       {"bin call", Pack().array(2).raw({0xc4, 0}).uint(10)},
-      {"str32 of 4 GB", Pack().array(3).uint(1).uint(1).big(0xdb, 0xffffffff, 4).raw({'a'})},
-      {"array32 of 4G", Pack().array(3).uint(1).uint(6).big(0xdd, 0xffffffff, 4)},
       // A form fault wins over what the scan found before it.
       {"too deep and truncated", deepCut},
       {"bin and truncated", Pack().array(3).uint(1).raw({0xc4, 5, 1})},
@@ -521,9 +404,8 @@ TEST(CodecTest, ReplyWireFormIsCallStatusValue) {
 }
 
 TEST(CodecTest, EveryReplyRoundTripsThroughTheClientSide) {
+  // Call, status and an operation error's domain and code through dispatch: DispatchTest.
   const Reply yes = DecodedReply(EncodeBoolReply(1, true));
-  EXPECT_EQ(yes.call, 1u);
-  EXPECT_EQ(yes.status, Status::kOk);
   EXPECT_EQ(BoolReplyValue(yes.value), true);
   EXPECT_EQ(BoolReplyValue(DecodedReply(EncodeBoolReply(2, false)).value), false);
   EXPECT_FALSE(ReplyError(yes));
@@ -547,14 +429,6 @@ TEST(CodecTest, EveryReplyRoundTripsThroughTheClientSide) {
   const Reply nil = DecodedReply(EncodeNilReply(6));
   EXPECT_TRUE(IsNilReplyValue(nil.value));
   EXPECT_FALSE(ReplyError(nil));
-
-  const Reply disabled =
-      DecodedReply(EncodeOperationErrorReply(7, kReportingErrorDomain, kReportingDisabledCode));
-  EXPECT_EQ(disabled.status, Status::kOperationError);
-  const OptionalError error = ReplyError(disabled);
-  ASSERT_TRUE(error);
-  EXPECT_EQ(error->domain, "com.quorvex.audio.reporting");
-  EXPECT_EQ(error->code, 1);
 
   const Reply rejected = DecodedReply(EncodeRejectReply(8, RejectCode::kTooDeep, "too deep"));
   EXPECT_EQ(rejected.status, Status::kRejected);
@@ -581,8 +455,6 @@ TEST(CodecTest, ReplyValueAccessorsRefuseTheWrongShape) {
 TEST(CodecTest, MalformedRepliesAreRefused) {
   const std::vector<std::pair<std::string, Bytes>> cases = {
       {"empty", {}},
-      {"truncated", Pack().array(3).uint(1).uint(0)},
-      {"trailing", Pack().array(3).uint(1).uint(0).nil().nil()},
       {"not an array", Pack().map(0)},
       {"4 elements", Pack().array(4).uint(1).uint(0).nil().nil()},
       {"nil call", Pack().array(3).nil().uint(0).nil()},

@@ -66,13 +66,6 @@ TEST(MessagePackTest, MixedValueDecodesWithWireOrderAndSignedness) {
   EXPECT_EQ(v[4].get<int64_t>(), -5);
 }
 
-TEST(MessagePackTest, EncodeThenDecodeGivesTheSameValue) {
-  Value value = *DecodeMessagePack(Mixed()).value;
-  const DecodedValue again = DecodeMessagePack(EncodeMessagePack(value));
-  ASSERT_TRUE(again.value);
-  EXPECT_EQ(*again.value, value);
-}
-
 TEST(MessagePackTest, DepthCountsArraysAndMapsOneLevelEach) {
   EXPECT_EQ(ScanMessagePack(Pack().nil()).depth, 0);
   EXPECT_EQ(ScanMessagePack(Pack().array(0)).depth, 1);
@@ -82,18 +75,8 @@ TEST(MessagePackTest, DepthCountsArraysAndMapsOneLevelEach) {
   EXPECT_EQ(ScanMessagePack(Pack().array(2).map(1).str("k").array(1).nil().uint(1)).depth, 3);
 }
 
-TEST(MessagePackTest, DepthAtTheLimitIsAcceptedAndOneMoreIsNot) {
-  const DecodedValue atLimit = DecodeMessagePack(NestedArrays(kMaxNestingDepth));
-  EXPECT_EQ(atLimit.scan.depth, kMaxNestingDepth);
-  EXPECT_FALSE(atLimit.scan.tooDeep);
-  EXPECT_TRUE(atLimit.value);
-
-  const DecodedValue over = DecodeMessagePack(NestedArrays(kMaxNestingDepth + 1));
-  EXPECT_TRUE(over.scan.WellFormed());
-  EXPECT_TRUE(over.scan.tooDeep);
-  EXPECT_FALSE(over.value);
-
-  // An empty container counts as a level too.
+// The limit itself and one more, through a request, are in CodecTest's nesting case.
+TEST(MessagePackTest, AnEmptyContainerPastTheLimitIsTooDeep) {
   Pack pack;
   for (int i = 0; i < kMaxNestingDepth; ++i) pack.array(1);
   pack.map(0);
@@ -174,7 +157,7 @@ TEST(MessagePackTest, BinAndExtAreNamedAndNotParsed) {
       {Pack().big(0xc9, 2, 4).raw({5, 9, 9}), "ext32"},
       {Pack().raw({0xd4, 5, 1}), "fixext1"},
       {Pack().raw({0xd6, 5, 1, 2, 3, 4}), "fixext4"},
-      {Pack().raw({0xd8, 5}).zeros(16), "fixext16"},
+      {Pack().raw({0xd8, 5}).append(Bytes(16, 0)), "fixext16"},
   };
   for (const Case& c : cases) {
     // Inside a request, after other elements, so the scan must skip over it correctly.
@@ -189,8 +172,6 @@ TEST(MessagePackTest, BinAndExtAreNamedAndNotParsed) {
 
 TEST(MessagePackTest, NonStringMapKeysAreFoundAtAnyDepth) {
   EXPECT_TRUE(ScanMessagePack(Pack().map(1).uint(1).nil()).nonStringKey);
-  EXPECT_TRUE(ScanMessagePack(Pack().map(1).nil().nil()).nonStringKey);
-  EXPECT_TRUE(ScanMessagePack(Pack().map(1).array(0).nil()).nonStringKey);
   EXPECT_TRUE(
       ScanMessagePack(Pack().array(2).uint(1).map(2).str("a").nil().uint(2).nil()).nonStringKey);
   // Values may be anything; only keys must be strings.
@@ -200,6 +181,7 @@ TEST(MessagePackTest, NonStringMapKeysAreFoundAtAnyDepth) {
   EXPECT_TRUE(ok.value);
 }
 
+// Integers of every format as the call, with their values, are in CodecTest's integer table.
 TEST(MessagePackTest, FirstElementOfTopLevelArrayIsClassified) {
   using First = ScanResult::First;
   struct Case {
@@ -209,15 +191,9 @@ TEST(MessagePackTest, FirstElementOfTopLevelArrayIsClassified) {
   };
   const std::vector<Case> cases = {
       {Pack().array(2).uint(0).nil(), First::kUnsigned, 0},
-      {Pack().array(1).integer(IntFormat::kUint64, ~uint64_t{0}), First::kUnsigned, ~uint64_t{0}},
       {Pack().array(1).integer(IntFormat::kInt8, 5), First::kUnsigned, 5},
-      {Pack().array(1).integer(IntFormat::kInt64, INT64_MAX), First::kUnsigned, INT64_MAX},
-      {Pack().array(1).integer(IntFormat::kInt8, static_cast<uint64_t>(-1)), First::kOther, 0},
-      {Pack().array(1).integer(IntFormat::kNegativeFixint, static_cast<uint64_t>(-1)),
-       First::kOther, 0},
       {Pack().array(1).nil(), First::kNil, 0},
       {Pack().array(1).float64(1.0), First::kOther, 0},
-      {Pack().array(1).str("1"), First::kOther, 0},
       {Pack().array(1).array(1).uint(1), First::kOther, 0},
       {Pack().array(0), First::kAbsent, 0},
       {Pack().map(1).str("a").uint(1), First::kAbsent, 0},

@@ -5,7 +5,7 @@
 #include <chrono>
 #include <limits>
 #include <memory>
-#include <optional>
+#include <regex>
 #include <stdexcept>
 #include <string>
 #include <thread>
@@ -20,7 +20,6 @@ namespace {
 using std::chrono::milliseconds;
 using std::chrono::seconds;
 using testing::FakeLogSystem;
-using testing::LoggedLine;
 using Throttle = RuvoReportingBlockThrottle;
 
 std::string Key(const Dictionary& message, int64_t reporterID = 42, uint32_t category = 0x80000001,
@@ -28,27 +27,16 @@ std::string Key(const Dictionary& message, int64_t reporterID = 42, uint32_t cat
   return Throttle::buildMessageKey(message, reporterID, category, type);
 }
 
-// The message of a line written by `function` in RuvoReportingBlockThrottle.cpp, when the line
-// has the "RuvoReportingBlockThrottle.cpp:<digits>:<function>: " prefix.
-std::optional<std::string> ThrottleLineMessage(const std::string& text, std::string_view function) {
-  constexpr std::string_view kFile = "RuvoReportingBlockThrottle.cpp:";
-  if (!text.starts_with(kFile)) return std::nullopt;
-  size_t position = kFile.size();
-  const size_t digits = position;
-  while (position < text.size() && text[position] >= '0' && text[position] <= '9') ++position;
-  if (position == digits) return std::nullopt;
-  const std::string tail = ":" + std::string(function) + ": ";
-  if (text.compare(position, tail.size(), tail) != 0) return std::nullopt;
-  return text.substr(position + tail.size());
-}
-
-// Lines of `function` at `level`, as their messages.
-std::vector<std::string> Messages(const FakeLogSystem& logs, std::string_view function,
+// Messages of the lines `function` in RuvoReportingBlockThrottle.cpp wrote at `level`; the prefix
+// must name that file, a line number and that function.
+std::vector<std::string> Messages(const FakeLogSystem& logs, const std::string& function,
                                   LogLevel level) {
+  const std::regex prefix("^RuvoReportingBlockThrottle\\.cpp:[0-9]+:" + function + ": (.*)$");
   std::vector<std::string> found;
-  for (const LoggedLine& line : logs.Lines()) {
-    if (line.level != level) continue;
-    if (auto message = ThrottleLineMessage(line.text, function)) found.push_back(*message);
+  std::smatch match;
+  for (const auto& line : logs.Lines()) {
+    if (line.level == level && std::regex_match(line.text, match, prefix))
+      found.push_back(match[1]);
   }
   return found;
 }
@@ -56,191 +44,112 @@ std::vector<std::string> Messages(const FakeLogSystem& logs, std::string_view fu
 // ---------------------------------------------------------------------------------------------
 // Message key
 
-TEST(BlockThrottleKeyTest, ExampleMessageGivesTheDocumentedKey) {
-  Dictionary message = MakeDictionary();
-  message["b"] = 2;
-  message["a"] = "x";
-  message["ruvoreporting_timestamp"] = 123.4;
-  EXPECT_EQ(Key(message, 42, 0x80000001, 0),
-            "a|x|b|2|ruvoreporting_timestamp|^|reporterID|42|Toolbox_Generic|Generic");
-}
-
-TEST(BlockThrottleKeyTest, DefaultBlacklistedFieldsKeepTheirNameButNotTheirValue) {
-  const Dictionary first = {{"level", 3},
-                            {"ruvoreporting_timestamp", 1.5},
-                            {"systemuptime_sec", 100},
-                            {"processuptime_ms", 7},
-                            {"_throttle_seconds", 0.2},
-                            {"_comparison_field_blacklist", Value::array()}};
-  const Dictionary second = {{"level", 3},
-                             {"ruvoreporting_timestamp", 99.25},
-                             {"systemuptime_sec", 250},
-                             {"processuptime_ms", 9000},
-                             {"_throttle_seconds", 1},
-                             {"_comparison_field_blacklist", Value::array({"other"})}};
-  EXPECT_EQ(Key(first), Key(second));
-  EXPECT_EQ(Key(first),
-            "_comparison_field_blacklist|^|_throttle_seconds|^|level|3|processuptime_ms|^|"
-            "ruvoreporting_timestamp|^|systemuptime_sec|^|reporterID|42|Toolbox_Generic|Generic");
-  // An excluded field that is absent from one message still tells the two apart.
-  const Dictionary withoutTimestamp = {{"level", 3}};
-  const Dictionary withTimestamp = {{"level", 3}, {"ruvoreporting_timestamp", 1.0}};
-  EXPECT_NE(Key(withoutTimestamp), Key(withTimestamp));
-  // A field that is not excluded still counts.
-  EXPECT_NE(Key({{"level", 3}}), Key({{"level", 4}}));
-}
-
-TEST(BlockThrottleKeyTest, RoutingTellsEqualMessagesApart) {
-  const Dictionary message = {{"level", 3}};
-  const std::string base = Key(message, 42, 0x80000001, 0);
-  EXPECT_NE(base, Key(message, 43, 0x80000001, 0));
-  EXPECT_NE(base, Key(message, 42, 0x80000002, 0));
-  EXPECT_NE(base, Key(message, 42, 0x90000001, 0));  // "_Generic"
-  EXPECT_NE(base, Key(message, 42, 0x80000001, 1));
-  EXPECT_EQ(Key(message, -5, 0xFFFFFFFF, 0xFFFF), "level|3|reporterID|-5|Undefined|Unknown");
-  EXPECT_EQ(Key(message, std::numeric_limits<int64_t>::min(), 3, 6),
-            "level|3|reporterID|-9223372036854775808|Playback|Undefined");
-}
-
-TEST(BlockThrottleKeyTest, MessageBlacklistExcludesItsFieldsOnly) {
-  const Dictionary first = {
-      {"route", "speaker"}, {"gain", 1}, {"_comparison_field_blacklist", {"gain", 7}}};
-  Dictionary second = first;
-  second["gain"] = 2;
-  EXPECT_EQ(Key(first), Key(second));
-  // Lacking the field is not the same as an ignored value.
-  Dictionary lacking = first;
-  lacking.erase("gain");
-  EXPECT_NE(Key(first), Key(lacking));
-  // Other fields still count.
-  Dictionary otherRoute = first;
-  otherRoute["route"] = "receiver";
-  EXPECT_NE(Key(first), Key(otherRoute));
-}
-
-TEST(BlockThrottleKeyTest, BlacklistThatIsNotAnArrayIsIgnored) {
-  const Dictionary first = {{"gain", 1}, {"_comparison_field_blacklist", "gain"}};
-  const Dictionary second = {{"gain", 2}, {"_comparison_field_blacklist", "gain"}};
-  EXPECT_NE(Key(first), Key(second));
-  const Dictionary asDictionary = {{"gain", 1}, {"_comparison_field_blacklist", {{"gain", 1}}}};
-  EXPECT_EQ(Key(asDictionary),
-            "_comparison_field_blacklist|^|gain|1|reporterID|42|"
-            "Toolbox_Generic|Generic");
-}
-
-TEST(BlockThrottleKeyTest, VolumeCollapsesOnlyWithItsOperationTime) {
-  const Dictionary paired = {{"Volume", 0.5}, {"VolumeOperationTime", 10}};
-  const Dictionary pairedOther = {{"Volume", 0.75}, {"VolumeOperationTime", 11}};
-  EXPECT_EQ(Key(paired), Key(pairedOther));
-  EXPECT_EQ(Key(paired), "Volume|^|VolumeOperationTime|^|reporterID|42|Toolbox_Generic|Generic");
-
-  EXPECT_NE(Key({{"Volume", 0.5}}), Key({{"Volume", 0.75}}));
-  EXPECT_EQ(Key({{"Volume", 0.5}}), Key({{"Volume", 0.5}}));
-  EXPECT_NE(Key({{"VolumeOperationTime", 10}}), Key({{"VolumeOperationTime", 11}}));
-}
-
-TEST(BlockThrottleKeyTest, FieldsSortByCharacterCodeWhateverTheirOrder) {
-  const Dictionary message = {{"a", 1}, {"_", 2}, {"Z", 3}, {"\xC3\xA9", 4}, {"B", 5}};
-  EXPECT_EQ(Key(message), "B|5|Z|3|_|2|a|1|\xC3\xA9|4|reporterID|42|Toolbox_Generic|Generic");
-  const Dictionary reordered = {{"\xC3\xA9", 4}, {"B", 5}, {"Z", 3}, {"a", 1}, {"_", 2}};
-  EXPECT_EQ(Key(message), Key(reordered));
-}
-
-TEST(BlockThrottleKeyTest, ValueTextForms) {
-  EXPECT_EQ(Key({{"n", 2.0}}), Key({{"n", 2}}));
-  EXPECT_EQ(Key({{"n", true}}), Key({{"n", 1}}));
-  EXPECT_EQ(Key({{"f", 4.9}, {"neg", -1}, {"no", false}, {"s", "a b"}}, 1, 0, 0),
-            "f|4.9|neg|-1|no|0|s|a b|reporterID|1|Undefined|Generic");
-}
-
-// Equal nested dictionaries built in different orders are duplicates of one message.
-TEST(BlockThrottleKeyTest, NestedValuesGiveTheSameKeyWhateverTheirKeyOrder) {
-  auto build = [] {
-    return Dictionary{{"list", Value::array({1, "two", Value::array({3.5, false})})},
-                      {"dict", {{"y", 1}, {"x", {{"deep", "v"}, {"b", 2}}}}}};
+TEST(BlockThrottleKeyTest, KeysListSortedFieldsWithExcludedValuesMaskedThenTheRouting) {
+  const struct {
+    Dictionary message;
+    std::string key;
+    int64_t reporter = 42;
+    uint32_t category = 0x80000001;
+    uint16_t type = 0;
+  } cases[] = {
+      {{{"b", 2}, {"a", "x"}, {"ruvoreporting_timestamp", 123.4}},
+       "a|x|b|2|ruvoreporting_timestamp|^|reporterID|42|Toolbox_Generic|Generic"},
+      {{{"level", 3},
+        {"ruvoreporting_timestamp", 1.5},
+        {"systemuptime_sec", 100},
+        {"processuptime_ms", 7},
+        {"_throttle_seconds", 0.2},
+        {"_comparison_field_blacklist", Value::array()}},
+       "_comparison_field_blacklist|^|_throttle_seconds|^|level|3|processuptime_ms|^|"
+       "ruvoreporting_timestamp|^|systemuptime_sec|^|reporterID|42|Toolbox_Generic|Generic"},
+      {{{"level", 3}}, "level|3|reporterID|-5|Undefined|Unknown", -5, 0xFFFFFFFF, 0xFFFF},
+      {{{"level", 3}},
+       "level|3|reporterID|-9223372036854775808|Playback|Undefined",
+       std::numeric_limits<int64_t>::min(),
+       3,
+       6},
+      // A blacklist that is not an array excludes nothing but itself.
+      {{{"gain", 1}, {"_comparison_field_blacklist", {{"gain", 1}}}},
+       "_comparison_field_blacklist|^|gain|1|reporterID|42|Toolbox_Generic|Generic"},
+      {{{"Volume", 0.5}, {"VolumeOperationTime", 10}},
+       "Volume|^|VolumeOperationTime|^|reporterID|42|Toolbox_Generic|Generic"},
+      // By character code, whatever the insertion order.
+      {{{"a", 1}, {"_", 2}, {"Z", 3}, {"\xC3\xA9", 4}, {"B", 5}},
+       "B|5|Z|3|_|2|a|1|\xC3\xA9|4|reporterID|42|Toolbox_Generic|Generic"},
+      {{{"f", 4.9}, {"neg", -1}, {"no", false}, {"s", "a b"}},
+       "f|4.9|neg|-1|no|0|s|a b|reporterID|1|Undefined|Generic",
+       1,
+       0},
+      {{{"list", Value::array({1, "two", Value::array({3.5, false})})},
+        {"dict", {{"y", 1}, {"x", {{"deep", "v"}, {"b", 2}}}}}},
+       R"(dict|{"x":{"b":2,"deep":"v"},"y":1}|list|[1,"two",[3.5,false]]|reporterID|42|)"
+       "Toolbox_Generic|Generic"},
+      {{{"route", "speaker"}, {"gain", 1}, {"_comparison_field_blacklist", {"gain", 7}}},
+       "_comparison_field_blacklist|^|gain|^|route|speaker|reporterID|42|Toolbox_Generic|Generic"},
+      {{{"gain", 1}, {"_comparison_field_blacklist", "gain"}},
+       "_comparison_field_blacklist|^|gain|1|reporterID|42|Toolbox_Generic|Generic"},
+      {{{"Volume", 0.5}}, "Volume|0.5|reporterID|42|Toolbox_Generic|Generic"},
+      {{{"VolumeOperationTime", 10}},
+       "VolumeOperationTime|10|reporterID|42|Toolbox_Generic|Generic"},
+      {{{"n", 2.0}, {"t", true}}, "n|2|t|1|reporterID|42|Toolbox_Generic|Generic"},
+      // Not a dictionary: the routing only.
+      {Value::array({1, 2}), "reporterID|42|Toolbox_Generic|Generic"},
+      {Value(), "reporterID|42|Toolbox_Generic|Generic"},
   };
-  const std::string key = Key(build());
-  EXPECT_EQ(key, Key(Dictionary{{"dict", {{"x", {{"b", 2}, {"deep", "v"}}}, {"y", 1}}},
-                                {"list", Value::array({1, "two", Value::array({3.5, false})})}}));
-  EXPECT_EQ(key, R"(dict|{"x":{"b":2,"deep":"v"},"y":1}|list|[1,"two",[3.5,false]]|reporterID|42|)"
-                 "Toolbox_Generic|Generic");
-  Dictionary changed = build();
-  changed["dict"]["x"]["deep"] = "w";
-  EXPECT_NE(key, Key(changed));
-}
-
-TEST(BlockThrottleKeyTest, NonDictionaryMessageGivesRoutingOnly) {
-  EXPECT_EQ(Key(Value::array({1, 2})), "reporterID|42|Toolbox_Generic|Generic");
-  EXPECT_EQ(Key(Value()), "reporterID|42|Toolbox_Generic|Generic");
+  for (const auto& c : cases) {
+    EXPECT_EQ(Key(c.message, c.reporter, c.category, c.type), c.key) << c.message.dump();
+  }
 }
 
 // ---------------------------------------------------------------------------------------------
 // Throttle time
 
-class SleepTimeTest : public ::testing::Test {
- protected:
-  double SleepTime(const Value& seconds) {
-    return Throttle::determineSleepTime({{"x", 1}, {"_throttle_seconds", seconds}});
-  }
-  std::vector<std::string> Rejections() {
-    return Messages(logs_, "determineSleepTime", LogLevel::kInfo);
-  }
-  FakeLogSystem logs_;
-};
-
-TEST_F(SleepTimeTest, MissingValueGivesHalfASecondSilently) {
+TEST(SleepTimeTest, BelowFiveIsKeptToSinglePrecisionAndAnythingElseGivesHalfASecond) {
+  FakeLogSystem logs;
   EXPECT_EQ(Throttle::determineSleepTime({{"x", 1}}), 0.5);
   EXPECT_EQ(Throttle::determineSleepTime(MakeDictionary()), 0.5);
-  EXPECT_TRUE(logs_.Lines().empty());
-}
+  EXPECT_TRUE(logs.Lines().empty());
 
-TEST_F(SleepTimeTest, ValuesBelowFiveAreKeptToSinglePrecision) {
-  EXPECT_EQ(SleepTime(4.9), static_cast<double>(4.9f));
-  EXPECT_NE(SleepTime(4.9), 4.9);
-  EXPECT_EQ(SleepTime(4.999), static_cast<double>(4.999f));
-  EXPECT_EQ(SleepTime(4), 4.0);
-  EXPECT_EQ(SleepTime(0.2), static_cast<double>(0.2f));
-  EXPECT_EQ(SleepTime(0), 0.0);
-  EXPECT_EQ(SleepTime(-1), -1.0);
-  EXPECT_EQ(SleepTime(-7.5), -7.5);
-  EXPECT_EQ(SleepTime(true), 1.0);
-  EXPECT_TRUE(Rejections().empty());
-}
-
-TEST_F(SleepTimeTest, FiveOrMoreIsRejectedWithTheLargeLine) {
-  EXPECT_EQ(SleepTime(5), 0.5);
-  EXPECT_EQ(SleepTime(12), 0.5);
-  EXPECT_EQ(SleepTime(5.5), 0.5);
-  EXPECT_EQ(SleepTime(std::numeric_limits<uint64_t>::max()), 0.5);
-  EXPECT_EQ(SleepTime(std::numeric_limits<double>::infinity()), 0.5);
-  const std::vector<std::string> expected = {
-      "Rejecting large throttle time. {time=5, max=5.000000}",
-      "Rejecting large throttle time. {time=12, max=5.000000}",
-      "Rejecting large throttle time. {time=5.5, max=5.000000}",
-      "Rejecting large throttle time. {time=18446744073709551615, max=5.000000}",
-      "Rejecting large throttle time. {time=inf, max=5.000000}",
+  constexpr double kLowest = std::numeric_limits<float>::lowest();
+  const std::string large = "Rejecting large throttle time. {time=";
+  const std::string nonNumber = "Rejecting non-number value of throttle time. {time=";
+  const struct {
+    Value seconds;
+    double expected;
+    std::string rejection;
+  } cases[] = {
+      {4.9, static_cast<double>(4.9f), ""},
+      {4.999, static_cast<double>(4.999f), ""},
+      {4, 4.0, ""},
+      {4u, 4.0, ""},
+      {0.2, static_cast<double>(0.2f), ""},
+      {0, 0.0, ""},
+      {-1, -1.0, ""},
+      {-7.5, -7.5, ""},
+      {true, 1.0, ""},
+      {-1e300, kLowest, ""},
+      {-std::numeric_limits<double>::infinity(), kLowest, ""},
+      {std::numeric_limits<int64_t>::min(), -0x1p63, ""},
+      {5, 0.5, large + "5, max=5.000000}"},
+      {12, 0.5, large + "12, max=5.000000}"},
+      {5.0, 0.5, large + "5, max=5.000000}"},
+      {5.5, 0.5, large + "5.5, max=5.000000}"},
+      {std::numeric_limits<uint64_t>::max(), 0.5, large + "18446744073709551615, max=5.000000}"},
+      {std::numeric_limits<double>::infinity(), 0.5, large + "inf, max=5.000000}"},
+      {std::numeric_limits<double>::quiet_NaN(), 0.5, large + "nan, max=5.000000}"},
+      {"3", 0.5, nonNumber + "3}"},
+      {Value::array({1}), 0.5, nonNumber + "[1]}"},
+      {Value(), 0.5, nonNumber + "(null)}"},
   };
-  EXPECT_EQ(Rejections(), expected);
-}
-
-TEST_F(SleepTimeTest, NonNumbersAreRejectedWithTheNonNumberLine) {
-  EXPECT_EQ(SleepTime("3"), 0.5);
-  EXPECT_EQ(SleepTime(Value::array({1})), 0.5);
-  EXPECT_EQ(SleepTime(Value()), 0.5);
-  const std::vector<std::string> expected = {
-      "Rejecting non-number value of throttle time. {time=3}",
-      "Rejecting non-number value of throttle time. {time=[1]}",
-      "Rejecting non-number value of throttle time. {time=(null)}",
-  };
-  EXPECT_EQ(Rejections(), expected);
-}
-
-TEST_F(SleepTimeTest, ExtremeNegativesAndNanNeverMisbehave) {
-  EXPECT_LT(SleepTime(-1e300), 0.0);
-  EXPECT_LT(SleepTime(-std::numeric_limits<double>::infinity()), 0.0);
-  EXPECT_LT(SleepTime(std::numeric_limits<int64_t>::min()), 0.0);
-  EXPECT_EQ(SleepTime(std::numeric_limits<double>::quiet_NaN()), 0.5);
-  EXPECT_EQ(Rejections().size(), 1u);
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.seconds.dump());
+    logs.Clear();
+    EXPECT_EQ(Throttle::determineSleepTime({{"x", 1}, {"_throttle_seconds", c.seconds}}),
+              c.expected);
+    const auto rejections = Messages(logs, "determineSleepTime", LogLevel::kInfo);
+    EXPECT_EQ(rejections, c.rejection.empty() ? std::vector<std::string>{}
+                                              : std::vector<std::string>{c.rejection});
+  }
 }
 
 // ---------------------------------------------------------------------------------------------
@@ -308,25 +217,6 @@ TEST_F(ThrottleDeliveryTest, KeysFireInFireDateOrderAndAShorterDuplicateMovesThe
   EXPECT_EQ(labels_, (std::vector<int>{2, 5, 1, 3}));
   EXPECT_EQ(at_[1], milliseconds(200));
   EXPECT_TRUE(onQueue_);
-}
-
-// Each callback runs only once a full throttle time has passed since it was added.
-TEST_F(ThrottleDeliveryTest, StreamOfDuplicatesNeverDeliversBeforeTheThrottleTime) {
-  std::vector<Duration> added;
-  for (int i = 0; i < 60; ++i) {
-    added.push_back(dispatcher_.Time().Now() - start_);
-    Add(i, 9, 0.03);
-    dispatcher_.AdvanceBy(milliseconds(i % 3 == 0 ? 35 : 5));
-  }
-  dispatcher_.AdvanceBy(seconds(1));
-  ASSERT_GT(labels_.size(), 1u);
-  EXPECT_EQ(labels_.back(), 59);
-  for (size_t i = 0; i < labels_.size(); ++i) {
-    if (i > 0) {
-      EXPECT_GT(labels_[i], labels_[i - 1]);
-    }
-    EXPECT_GE(at_[i] - added[labels_[i]], milliseconds(29)) << labels_[i];
-  }
 }
 
 // Two keys are due at once, so both expiries are queued before either callback runs. While the

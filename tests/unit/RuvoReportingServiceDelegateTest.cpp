@@ -1,4 +1,5 @@
 #include "Statistics/Service/RuvoReportingServiceDelegate.h"
+#include "Statistics/Service/ServiceWatchdog.h"
 
 #include "Statistics/RuvoReportingUtility.h"
 
@@ -11,6 +12,7 @@
 #include "platform/TracePoints.h"
 #include "tests/fakes/FakeClientConnection.h"
 #include "tests/fakes/FakeDefaultsDomain.h"
+#include "tests/fakes/FakeDispatcher.h"
 #include "tests/fakes/FakeLogSystem.h"
 #include "tests/fakes/FakeNotificationCenter.h"
 #include "tests/fakes/FakePlatform.h"
@@ -20,6 +22,7 @@
 namespace tavrin {
 namespace {
 
+using std::chrono::seconds;
 using testing::FakeClientConnection;
 
 // Listener that is never asked to do anything: the delegate only receives it.
@@ -157,11 +160,14 @@ TEST_F(ServiceDelegateTest, DisabledReportingRefusesMessagesAndHidesOtherClients
   a->service().createReportingSession(7, a->Bool("create"));
   a->service().setServiceType(2, 7, a->Bool("type"));
   Run();
-  // While reporting is enabled, another client's lookup finds the session.
-  std::optional<uint16_t> seen;
-  b->service().getServiceNameForReporterID(7, [&](uint16_t type) { seen = type; });
+  // While reporting is enabled, another client's lookup finds the session; reporter 0 is
+  // answered twice, an unknown reporter once.
+  std::vector<uint16_t> types;
+  for (int64_t id : {7, 0, 44}) {
+    b->service().getServiceNameForReporterID(id, [&](uint16_t type) { types.push_back(type); });
+  }
   Run();
-  EXPECT_EQ(seen, 2u);
+  EXPECT_EQ(types, (std::vector<uint16_t>{2, 0xFFFF, 0xFFFF, 0xFFFF}));
 
   defaults.Set("disable_reporting", true);
   PostDefaults();
@@ -192,51 +198,22 @@ TEST_F(ServiceDelegateTest, DisabledReportingRefusesMessagesAndHidesOtherClients
   EXPECT_EQ(*valid, (Dictionary{{"reporterID", 7}, {"serviceType", 2}}));
 }
 
-TEST_F(ServiceDelegateTest, BroadcastReachesEveryRunningSessionOfEveryClientOrGoesStandalone) {
+// (Empty lists, lists naming no session and the standalone road are checked end to end.)
+TEST_F(ServiceDelegateTest, BroadcastReachesEveryRunningSessionOfEveryClient) {
   auto a = Connect(100);
   auto b = Connect(200);
   b->service().createReportingSession(3, b->Bool("create"));  // never started: left out
-  Run();
-  int nilReplies = 0;
-  auto countNil = [&](const OptionalError& error) { nilReplies += error ? 0 : 1; };
-  // Empty lists, or ones naming no session, send nothing at all.
-  a->service().sendMessage(Dictionary{{"a", 1}}, 3, 1, std::vector<int64_t>{}, countNil);
-  a->service().sendMessage(Dictionary{{"a", 2}}, 3, 1, std::vector<int64_t>{0, 5}, countNil);
-  Run();
-  EXPECT_EQ(nilReplies, 2);
-  EXPECT_TRUE(platform.telvoro.SingleMessages().empty());
-  EXPECT_TRUE(platform.analytics.Events().empty());
-
-  a->service().sendMessage(Dictionary{{"a", 3}}, 3, 1, std::nullopt, countNil);
-  Run();
-  EXPECT_EQ(nilReplies, 3);
-  EXPECT_EQ(log.Count("no active reporting sessions found, sending as standalone"), 1u);
-  auto singles = platform.telvoro.SingleMessages();
-  ASSERT_EQ(singles.size(), 1u);
-  EXPECT_EQ(singles[0].userInfo[kTelvoroUserInfoServiceName], "standalone");
-  EXPECT_EQ(singles[0].payload, (Dictionary{{"a", 3}}));
-
   a->CreateAndStart(1);
   b->CreateAndStart(2);
-  Run();
   a->service().sendMessage(Dictionary{{"EngineOnTime", 4.5}}, 1, 0, std::nullopt, nullptr);
   Run();
   EXPECT_EQ(log.Count("active reporting sessions 2 : "), 1u);
   size_t delivered = 0;
   for (const auto& session : platform.telvoro.Sessions()) delivered += session->Messages().size();
   EXPECT_EQ(delivered, 2u);
-  EXPECT_EQ(platform.analytics.Events().size(), 2u);  // none for the standalone one
+  EXPECT_TRUE(platform.telvoro.SingleMessages().empty());
+  EXPECT_EQ(platform.analytics.Events().size(), 2u);
   EXPECT_EQ(platform.powerLog.Events().size(), 2u);
-}
-
-TEST_F(ServiceDelegateTest, ServiceTypeOfReporterZeroIsAnsweredTwice) {
-  auto client = Connect(100);
-  std::vector<uint16_t> answers;
-  client->service().getServiceNameForReporterID(0, [&](uint16_t type) { answers.push_back(type); });
-  client->service().getServiceNameForReporterID(44,
-                                                [&](uint16_t type) { answers.push_back(type); });
-  Run();
-  EXPECT_EQ(answers, (std::vector<uint16_t>{0xFFFF, 0xFFFF, 0xFFFF}));
 }
 
 TEST_F(ServiceDelegateTest, CreatingAnIdTwiceReplacesTheSessionWithoutStoppingIt) {
@@ -282,7 +259,7 @@ TEST_F(ServiceDelegateTest, DisconnectStopsRunningSessionsAndRemovesTheClientOnc
   auto client = Connect(100);
   client->CreateAndStart(7);
   Run();
-  platform.clock.Advance(std::chrono::seconds(42));
+  platform.clock.Advance(seconds(42));
 
   client->connection->End(/*abnormal=*/true);
   Run();
@@ -346,31 +323,37 @@ TEST_F(ServiceDelegateTest, DestroyStopsARunningSessionAndReportersAreListedInOr
                                                   "destroy0=YES"}));
 }
 
-TEST_F(ServiceDelegateTest, KillServiceEndsTheProcessWithStatusTwoAndNoReply) {
-  std::optional<int> status;
-  RuvoReportingServerInstance::SetProcessExit([&](int code) { status = code; });
-  auto client = Connect(100);
-  bool replied = false;
-  client->service().killService([&](bool) { replied = true; });
-  RuvoReportingServerInstance::SetProcessExit(nullptr);
-  EXPECT_EQ(status, 2);
-  EXPECT_FALSE(replied);
-  EXPECT_EQ(log.Count("DESTROYING SERVICE"), 1u);
-}
+// Pings only while probes come back through the work queue within the interval; a stuck queue
+// stops them, holds one probe at the most, and they resume once it turns again.
+TEST(ServiceWatchdogTest, PingsOnlyWhileTheQueueTurns) {
+  testing::FakeDispatcher dispatcher;
+  SerialQueuePtr queue = dispatcher.CreateSerialQueue("work", QualityOfService::kUserInteractive);
+  int pings = 0;
+  ServiceWatchdog watchdog(queue, dispatcher.GetClock(), seconds(10), [&] { ++pings; });
 
-TEST_F(ServiceDelegateTest, EntryLinesAreDebugOnlyWhenVerboseAndLinesNameTheOperation) {
-  log.SetVerbose(false);
-  auto client = Connect(100);
-  client->service().createReportingSession(7, client->Bool("create"));
-  Run();
-  EXPECT_EQ(log.Count("creating session for reporter 7"), 0u);
-  log.SetVerbose(true);
-  client->service().createReportingSession(8, client->Bool("create"));
-  Run();
-  EXPECT_EQ(log.Count("creating session for reporter 8", LogLevel::kDebug), 1u);
-  // Lines written from the queued work name the operation, not the lambda that runs it.
-  EXPECT_EQ(log.Count(":createReportingSession: session created for reporter 8"), 1u);
-  EXPECT_EQ(log.Count("operator()"), 0u);
+  for (int i = 0; i < 4; ++i) {
+    watchdog.Tick();
+    dispatcher.AdvanceBy(seconds(5));
+  }
+  EXPECT_EQ(pings, 4);
+
+  queue->Suspend();  // stuck: the probe that is queued now never comes back
+  watchdog.Tick();
+  dispatcher.AdvanceBy(seconds(5));
+  watchdog.Tick();  // the last probe ran 10 s ago: just alive
+  EXPECT_EQ(pings, 6);
+  for (int i = 0; i < 6; ++i) {
+    dispatcher.AdvanceBy(seconds(5));
+    watchdog.Tick();
+  }
+  EXPECT_EQ(pings, 6) << "pinged for a queue that had not turned for over 10 s";
+  EXPECT_EQ(dispatcher.PendingCount(*queue), 1u) << "probes piled up behind the stuck queue";
+
+  queue->Resume();
+  dispatcher.RunUntilIdle();
+  watchdog.Tick();
+  EXPECT_EQ(pings, 7);
+  EXPECT_EQ(watchdog.Pings(), 7u);
 }
 
 }  // namespace

@@ -1,25 +1,36 @@
-// Session lifecycle against the back-ends, the message path and the standalone single-message
-// path, on the fake platform (time moves only when a test moves it).
+// Session lifecycle against the back-ends, the message path, the standalone single-message path,
+// orientation tracking and the sinks, on the fake platform (time moves only when a test moves it);
+// last, sessions on the real dispatcher with real threads.
 
+#include <algorithm>
+#include <atomic>
 #include <chrono>
+#include <functional>
 #include <memory>
 #include <optional>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include <gtest/gtest.h>
 
+#include "Statistics/RuvoReportingKelvaneUtility.h"
+#include "Statistics/RuvoReportingStratikBridge.h"
 #include "Statistics/RuvoReportingUtility.h"
 #include "Statistics/Service/RuvoReportingSession.h"
 #include "platform/TracePoints.h"
+#include "platform/linux/dispatch/AsioDispatcher.h"
 #include "tests/support/SessionTestSupport.h"
 
 namespace tavrin::testing {
 namespace {
 
+using std::chrono::microseconds;
 using std::chrono::milliseconds;
 using std::chrono::seconds;
+using Builders = FakeAnalyticsSink::Builders;
 using Discovery = FakeTelvoroService::Discovery;
+using Kind = FakeOrientationRegistry::Kind;
 
 class SessionTest : public SessionTestBase {
  protected:
@@ -94,7 +105,6 @@ TEST_F(SessionTest, BackendsThatNeverAnswerDropTheSessionAfterNineSecondsAndAggr
 
   platform.dispatcher.AdvanceBy(milliseconds(8999));
   EXPECT_TRUE(platform.dispatcher.IsSuspended(*session->telvoroQueue()));
-  EXPECT_EQ(session->telvoroSession(), fake);
   EXPECT_EQ(CountMessage("failed to find backend"), 0u);
 
   platform.dispatcher.AdvanceBy(milliseconds(1));
@@ -113,7 +123,6 @@ TEST_F(SessionTest, BackendsThatNeverAnswerDropTheSessionAfterNineSecondsAndAggr
   EXPECT_EQ(platform.telvoro.AnswerPendingDiscoveries(std::vector<std::string>{"sqlite:/l.db"}),
             1u);
   platform.dispatcher.RunUntilIdle();
-  EXPECT_EQ(CountMessage("List of backends [\"sqlite:/l.db\"]"), 1u);
   EXPECT_EQ(CountMessage("continuing"), 0u);
   EXPECT_EQ(session->telvoroSession(), nullptr);
 
@@ -139,8 +148,6 @@ TEST_F(SessionTest, BackendsAnsweringLaterReleaseQueuedMessagesInOrder) {
 
   // The answer may come from any thread; here from the test's.
   platform.telvoro.AnswerPendingDiscoveries(std::vector<std::string>{"sqlite:/a.db", "kafka:b"});
-  EXPECT_EQ(CountMessage("List of backends [\"sqlite:/a.db\",\"kafka:b\"]", LogLevel::kDefault),
-            1u);
   EXPECT_EQ(CountMessage("continuing", LogLevel::kDefault), 1u);
   platform.dispatcher.RunUntilIdle();
   EXPECT_EQ(Sequence(fake), (std::vector<int64_t>{0, 1, 2, 3, 4}));
@@ -196,14 +203,14 @@ TEST_F(SessionTest, AnImmediateAnswerMeansNoWaitAndTheBackEndGetsSessionAndUserI
 
   auto fake = platform.telvoro.LastSession();
   const Dictionary& info = fake->SessionInfo();
-  EXPECT_EQ(info, (Dictionary{{"ClientType", 19},
-                              {"ClientVersion", 2.0},
-                              {"SessionID", reporter},
-                              {"BatchEvent", true},
-                              {"HierarchyToken", token->value},
-                              {"ContainsRealtimeEvents", false}}));
-  EXPECT_TRUE(info["ClientType"].is_number_integer());
-  EXPECT_TRUE(info["ClientVersion"].is_number_float());
+  // As text, so the number types count too.
+  EXPECT_EQ(info.dump(), (Dictionary{{"ClientType", 19},
+                                     {"ClientVersion", 2.0},
+                                     {"SessionID", reporter},
+                                     {"BatchEvent", true},
+                                     {"HierarchyToken", token->value},
+                                     {"ContainsRealtimeEvents", false}})
+                             .dump());
   EXPECT_EQ(fake->UserInfo(), (Dictionary{{"ClientName", "com.quorvex.tavrin"},
                                           {"ServiceName", "telephony_session"},
                                           {"HostApplicationDisplayID", "com.example.app"},
@@ -457,9 +464,8 @@ TEST_F(SessionTest, OtherSingleMessagesGoAtOnceWithoutTheClientsUserInfoAndRepor
   platform.dispatcher.RunUntilIdle();
   const auto singles = platform.telvoro.SingleMessages();
   ASSERT_EQ(singles.size(), 2u);
-  EXPECT_EQ(singles[0].sessionInfo,
-            (Dictionary{{"ClientType", 19}, {"ClientVersion", 2.0}, {"SessionID", -1}}));
-  EXPECT_TRUE(singles[0].sessionInfo["ClientVersion"].is_number_float());
+  EXPECT_EQ(singles[0].sessionInfo.dump(),
+            R"({"ClientType":19,"ClientVersion":2.0,"SessionID":-1})");
   EXPECT_EQ(singles[0].userInfo,
             (Dictionary{{"ClientName", "com.quorvex.tavrin"}, {"ServiceName", "telephony"}}));
   EXPECT_EQ(singles[0].category, 3);
@@ -482,6 +488,332 @@ TEST_F(SessionTest, OtherSingleMessagesGoAtOnceWithoutTheClientsUserInfoAndRepor
   EXPECT_EQ((*answer)->description, "back-end down");
   EXPECT_EQ(CountMessage("sendOneMessageWithSessionInfo back-end down", LogLevel::kError), 1u);
   EXPECT_EQ(platform.telvoro.RefusedSingleMessages(), 1u);
+}
+
+// --- orientation tracking of telephony and long-form audio sessions on internal builds ---------
+
+constexpr const char* kCallbackID = "RuvoReportingService 42";
+
+TEST_F(SessionTest, TelephonyAndLongFormAudioRegisterDeviceThenUI) {
+  for (uint16_t type : {uint16_t{2}, uint16_t{7}}) {
+    const size_t before = platform.orientation.History().size();
+    auto session = Started(42, type);
+    EXPECT_TRUE(session->shouldReportOrientation());
+    EXPECT_EQ(session->orientationCallbackID(), kCallbackID);
+    EXPECT_EQ(session->startDate(), platform.clock.Now());
+    session->stop();
+    EXPECT_FALSE(session->orientationCallbackID().has_value());
+    EXPECT_EQ(platform.orientation.FireDevice("portrait"), 0u);
+
+    const auto history = platform.orientation.History();
+    ASSERT_EQ(history.size(), before + 4);
+    const Kind kinds[] = {Kind::kDevice, Kind::kUI, Kind::kDevice, Kind::kUI};
+    const bool registered[] = {true, true, false, false};
+    for (size_t i = 0; i < 4; ++i) {
+      EXPECT_EQ(history[before + i].kind, kinds[i]) << i;
+      EXPECT_EQ(history[before + i].registered, registered[i]) << i;
+      EXPECT_EQ(history[before + i].id, kCallbackID) << i;
+    }
+  }
+}
+
+TEST_F(SessionTest, OtherServiceTypesDeviceClassSixAndNeverStartedSessionsNeverTrack) {
+  for (uint16_t type : {uint16_t{0}, uint16_t{3}, uint16_t{8}, uint16_t{0xFFFF}}) {
+    auto session = Started(42, type);
+    EXPECT_FALSE(session->orientationCallbackID().has_value()) << type;
+    session->stop();
+  }
+  Create(42, 2)->stop();  // never started: nothing to unregister
+  platform.deviceInfo.SetInt32(kDeviceInfoDeviceClassNumber, 6);
+  auto session = Started(42, 2);
+  EXPECT_FALSE(session->shouldReportOrientation());
+  EXPECT_FALSE(session->orientationCallbackID().has_value());
+  EXPECT_TRUE(platform.orientation.History().empty());
+
+  platform.deviceInfo.SetInt32(kDeviceInfoDeviceClassNumber, 5);
+  EXPECT_TRUE(session->shouldReportOrientation());
+}
+
+TEST_F(SessionTest, TimesAreRoundedToWholeMilliseconds) {
+  platform.orientation.SetText("3", "landscape-left");
+  auto session = Started(42, 2);
+  platform.clock.Advance(microseconds(12600));
+  EXPECT_EQ(platform.orientation.FireUI("3"), 1u);
+  platform.clock.Advance(microseconds(2000400 - 12600));
+  EXPECT_EQ(platform.orientation.FireDevice("portrait"), 1u);
+  platform.clock.Advance(microseconds(500));  // 2.0009 s: rounded, not cut off
+  platform.orientation.FireDevice("face-up");
+
+  EXPECT_EQ(Aggregated(session->summaryTexts()), 3u);
+  const Dictionary summary{{"Ruvo_Session_Summary_Event", "2"},
+                           {"ui_orientation", "landscape-left"},
+                           {"ui_orientation_time", "0.013"},
+                           {"device_orientation", "portrait,face-up"},
+                           {"device_orientation_time", "2,2.001"}};
+  EXPECT_EQ(session->createSummaryEventForSession()->dump(), summary.dump());
+  // Records are not messages: not counted, not in the nested list.
+  EXPECT_EQ(session->messageTypeCounts(), Dictionary::object());
+  EXPECT_TRUE(Entries(session->spool()).empty());
+}
+
+TEST_F(SessionTest, TheCallbacksHoldTheSessionUntilStopUnregistersThem) {
+  std::weak_ptr<RuvoReportingSession> weak = Started(42, 2);
+  // Released without stop: still registered, still aggregating.
+  ASSERT_FALSE(weak.expired());
+  EXPECT_EQ(platform.orientation.FireUI("portrait"), 1u);
+  EXPECT_EQ(Aggregated(weak.lock()->summaryTexts()), 1u);
+
+  // A type changed before stop leaves the callbacks registered; what they report after stop is
+  // kept nowhere.
+  weak.lock()->setServiceType(3);
+  weak.lock()->stop();
+  EXPECT_TRUE(platform.orientation.IsRegistered(Kind::kDevice, kCallbackID));
+  EXPECT_TRUE(platform.orientation.IsRegistered(Kind::kUI, kCallbackID));
+  EXPECT_EQ(weak.lock()->orientationCallbackID(), kCallbackID);
+  EXPECT_EQ(platform.orientation.FireDevice("portrait"), 1u);
+  EXPECT_EQ(weak.lock()->summaryTexts(), nullptr);
+  EXPECT_EQ(CountMessage("deallocing this session 42"), 0u);
+}
+
+TEST_F(SessionTest, ARestartRegistersAgainAndRecordsInterleaveWithMessages) {
+  auto session = Started(42, 7);
+  session->stop();
+  platform.clock.Advance(std::chrono::seconds(30));
+  session->start();
+  EXPECT_EQ(session->startDate(), platform.clock.Now());
+  EXPECT_TRUE(platform.orientation.IsRegistered(Kind::kDevice, kCallbackID));
+  session->sendMessage(Dictionary{{"a", 1}}, 1, 1, nullptr);
+  platform.clock.Advance(milliseconds(250));
+  platform.orientation.FireDevice("portrait");
+  session->sendMessage(Dictionary{{"a", 2}}, 1, 1, nullptr);
+  platform.orientation.FireUI("portrait");
+  EXPECT_EQ(*session->createSummaryEventForSession(),
+            (Dictionary{{"Ruvo_Session_Summary_Event", "7"},
+                        {"a", "1,2"},
+                        {"device_orientation", "portrait"},
+                        {"device_orientation_time", "0.25"},
+                        {"ui_orientation", "portrait"},
+                        {"ui_orientation_time", "0.25"}}));
+  EXPECT_EQ(CountMessage("Orientation handler callback mode=ui orientation=\"portrait\" "
+                         "app=\"(null)\", time=0.25, id=\"RuvoReportingService 42\"",
+                         LogLevel::kDebug),
+            1u);
+}
+
+// --- the analytics and power-event sinks every delivered message is offered to --------------
+
+class SinksTest : public SessionTest {
+ protected:
+  SinksTest() : session(Create(42, 3)) {
+    session->setConfiguration(Dictionary{{"HostApplicationDisplayID", "com.example.game"}});
+  }
+
+  // Both sinks, in the order the client instance offers a message to them.
+  void Offer(const Dictionary& event, uint32_t category, uint16_t type) {
+    RuvoReportingStratikBridge::handleEvent(event, category, type, *session);
+    RuvoReportingKelvaneUtility::handleEvent(event, category, type, *session);
+  }
+
+  std::shared_ptr<RuvoReportingSession> session;
+};
+
+// --- analytics --------------------------------------------------------------------------------
+
+TEST_F(SinksTest, EveryMessageBecomesANamedAnalyticsEventWithTheSessionsApplicationName) {
+  Offer(Dictionary{{"latency", 12}, {"route", "speaker"}}, 0x80000001, 1);
+  Offer(Dictionary{{"HostApplicationDisplayID", "forged"}}, 12, 6);
+  Offer(Dictionary(), 0xFFFFFFFF, 0xFFFF);  // absent: an event all the same
+  Offer(Dictionary::object(), 0x90000001, 5);
+  RuvoReportingKelvaneUtility::handleEvent(Value::array({"EngineOnTime"}), 1, 1, *session);
+  RuvoReportingStratikBridge::handleEvent(Dictionary{{"HostApplicationDisplayID", "forged"}}, 1, 1,
+                                          *Create(7, 3));
+  const auto events = platform.analytics.Events();
+  ASSERT_EQ(events.size(), 5u);
+  const std::string names[] = {"Toolbox_Generic.Start", "Undefined.Undefined", "Undefined.Unknown",
+                               "_Generic.IssueDetector"};
+  for (size_t i = 0; i < 4; ++i) EXPECT_EQ(events[i].name, "com.quorvex.tavrin." + names[i]);
+  EXPECT_EQ(events[0].builderCalls, 1u);
+  const Dictionary game{{"HostApplicationDisplayID", "com.example.game"}};
+  EXPECT_EQ(*events[0].payload, (Dictionary{{"latency", 12},
+                                            {"route", "speaker"},
+                                            {"HostApplicationDisplayID", "com.example.game"}}));
+  for (size_t i = 1; i < 4; ++i) EXPECT_EQ(*events[i].payload, game) << i;
+  EXPECT_EQ(*events[4].payload, (Dictionary{{"HostApplicationDisplayID", "Unknown"}}));
+  // No engine time, or no dictionary: no power event.
+  EXPECT_TRUE(platform.powerLog.Events().empty());
+  EXPECT_TRUE(DefaultMessages(LogLevel::kError).empty());
+}
+
+TEST_F(SinksTest, TheLazyPayloadIsTheOnePreparedAtSendTimeAndASwitchedOffSinkNeverBuildsIt) {
+  platform.analytics.SetBuilders(Builders::kCallLater);
+  Offer(Dictionary{{"n", 1}}, 1, 1);
+  EXPECT_EQ(platform.analytics.Events()[0].builderCalls, 0u);
+  // Changes after the send do not reach the payload built later.
+  session->setConfiguration(Dictionary{{"HostApplicationDisplayID", "changed"}});
+  EXPECT_EQ(platform.analytics.RunPendingBuilders(), 1u);
+  EXPECT_EQ(*platform.analytics.Events()[0].payload,
+            (Dictionary{{"n", 1}, {"HostApplicationDisplayID", "com.example.game"}}));
+
+  platform.analytics.SetBuilders(Builders::kNeverCall);
+  Offer(Dictionary{{"n", 2}}, 1, 1);
+  const auto events = platform.analytics.Events();
+  ASSERT_EQ(events.size(), 2u);
+  EXPECT_EQ(events[1].builderCalls, 0u);
+  EXPECT_FALSE(events[1].payload.has_value());
+}
+
+TEST_F(SinksTest, EngineTimeBecomesAPowerEventAndAMissingTimestampIsLogged) {
+  Offer(Dictionary{{"EngineOnTime", 12.5}, {"ruvoreporting_timestamp", 1700000000123}, {"x", 1}}, 3,
+        2);
+  EXPECT_TRUE(DefaultMessages(LogLevel::kError).empty());
+  Offer(Dictionary{{"EngineOnTime", 3}}, 1, 1);
+  const auto events = platform.powerLog.Events();
+  ASSERT_EQ(events.size(), 2u);
+  EXPECT_EQ(events[0].agent, 28);
+  EXPECT_EQ(events[0].name, "Mediane_Haptics");
+  EXPECT_FALSE(events[0].extra.has_value());
+  EXPECT_EQ(events[0].payload.dump(), (Dictionary{{"EngineOnDuration", 12.5},
+                                                  {"ApplicationName", "com.example.game"},
+                                                  {"TimestampEnd", 1700000000123}})
+                                          .dump());
+  EXPECT_EQ(events[1].payload,
+            (Dictionary{{"EngineOnDuration", 3}, {"ApplicationName", "com.example.game"}}));
+  EXPECT_EQ(DefaultMessages(LogLevel::kError),
+            std::vector<std::string>{"failed to get RuvoReporting timestamp for kelvane"});
+}
+
+TEST_F(SinksTest, AnAbsentApplicationNameIsLoggedAndLeftOut) {
+  // "Unknown" stands in for a missing key; only a present but empty value gives no name.
+  session->setConfiguration(Dictionary{{"HostApplicationDisplayID", nullptr}});
+  Offer(Dictionary{{"EngineOnTime", "7"}, {"ruvoreporting_timestamp", 5}}, 1, 1);
+  const auto events = platform.powerLog.Events();
+  ASSERT_EQ(events.size(), 1u);
+  EXPECT_EQ(events[0].payload, (Dictionary{{"EngineOnDuration", "7"}, {"TimestampEnd", 5}}));
+  EXPECT_EQ(DefaultMessages(LogLevel::kError),
+            std::vector<std::string>{"failed to get app name for kelvane"});
+
+  RuvoReportingKelvaneUtility::handleEvent(Dictionary{{"EngineOnTime", 1}}, 1, 1, *Create(7, 3));
+  EXPECT_EQ(platform.powerLog.Events()[1].payload["ApplicationName"], "Unknown");
+}
+
+// --- on the real dispatcher, with real threads: the client's sends, orientation callbacks and
+// back-end answers arrive from different threads at once ---------------------------------------
+
+// Generous: other builds share the two cores, and sanitizers slow everything down.
+constexpr auto kDeadline = std::chrono::seconds(120);
+
+// Polls `done` until it holds or the deadline passes; true when it held.
+bool Eventually(const std::function<bool()>& done) {
+  const auto deadline = std::chrono::steady_clock::now() + kDeadline;
+  while (!done()) {
+    if (std::chrono::steady_clock::now() > deadline) return false;
+    std::this_thread::sleep_for(milliseconds(2));
+  }
+  return true;
+}
+
+class SessionThreadsTest : public SessionTestBase {
+ protected:
+  SessionThreadsTest() {
+    services = platform.services;
+    services.dispatcher = &dispatcher;
+  }
+  ~SessionThreadsTest() override { dispatcher.Shutdown(); }
+
+  AsioDispatcher dispatcher;
+  PlatformServices services;
+};
+
+TEST_F(SessionThreadsTest, MessagesKeepTheirOrderWhileOrientationAndStopRunElsewhere) {
+  constexpr int kSessions = 6;
+  constexpr int kMessages = 300;
+  constexpr int kAfterStop = 5;
+  log.SetVerbose(false);
+  platform.telvoro.SetDiscovery(Discovery::kAnswerLater);
+
+  std::vector<std::shared_ptr<RuvoReportingSession>> sessions;
+  for (int i = 0; i < kSessions; ++i) {
+    sessions.push_back(RuvoReportingSession::create(i + 1, {100 + i}, services));
+    sessions.back()->setServiceType(2);  // telephony: orientation is tracked
+  }
+
+  std::atomic<bool> clientDone{false};
+  std::atomic<size_t> fired{0};
+  std::thread orientation([&] {
+    while (!clientDone.load()) {
+      fired += platform.orientation.FireDevice("portrait");
+      fired += platform.orientation.FireUI("landscape");
+      std::this_thread::yield();
+    }
+  });
+  std::thread backends([&] {
+    // Answers each session's discovery as soon as it asks, from this thread.
+    size_t answered = 0;
+    const auto deadline = std::chrono::steady_clock::now() + kDeadline;
+    while (answered < kSessions && std::chrono::steady_clock::now() < deadline) {
+      answered += platform.telvoro.AnswerPendingDiscoveries(std::vector<std::string>{"x"});
+      std::this_thread::yield();
+    }
+  });
+  std::thread client([&] {
+    for (auto& session : sessions) session->start();
+    // Let orientation changes reach the started sessions while the messages go out.
+    const size_t firedBefore = fired.load();
+    while (fired.load() == firedBefore) std::this_thread::yield();
+    for (int seq = 0; seq < kMessages; ++seq) {
+      for (auto& session : sessions) session->sendMessage(Dictionary{{"seq", seq}}, 1, 1, nullptr);
+    }
+    for (auto& session : sessions) session->stop();
+    for (int n = 0; n < kAfterStop; ++n) {
+      for (auto& session : sessions) session->sendMessage(Dictionary{{"late", n}}, 1, 1, nullptr);
+    }
+    clientDone = true;
+  });
+  client.join();
+  orientation.join();
+  backends.join();
+
+  ASSERT_TRUE(Eventually([&] {
+    const auto created = platform.telvoro.Sessions();
+    return created.size() == kSessions &&
+           std::all_of(created.begin(), created.end(),
+                       [](const auto& s) { return s->MessagesAtFlush().size() == 1; }) &&
+           platform.telvoro.SingleMessages().size() == kSessions * kAfterStop;
+  }));
+
+  std::string allSeq;
+  for (int seq = 0; seq < kMessages; ++seq) allSeq += (seq ? "," : "") + std::to_string(seq);
+  int records = 0;
+  for (const auto& fake : platform.telvoro.Sessions()) {
+    const auto messages = fake->Messages();
+    ASSERT_EQ(messages.size(), size_t{kMessages} + 1);
+    for (int seq = 0; seq < kMessages; ++seq) {
+      ASSERT_EQ(messages[seq].payload["seq"], seq) << fake->Description();
+    }
+    // The summary comes last and holds every message, in order, with the orientation records.
+    const Dictionary& summary = messages.back().payload;
+    EXPECT_EQ(summary["seq"], allSeq);
+    EXPECT_FALSE(summary.contains("late"));
+    records += summary.contains("device_orientation") || summary.contains("ui_orientation");
+    if (summary.contains("device_orientation")) {
+      const auto count = [&](const char* key) {
+        const std::string text = summary[key].get<std::string>();
+        return std::count(text.begin(), text.end(), ',');
+      };
+      EXPECT_EQ(count("device_orientation"), count("device_orientation_time"));
+    }
+    EXPECT_EQ(fake->MessagesAtFlush(), std::vector<size_t>{kMessages + 1});
+  }
+  EXPECT_EQ(CountMessage("failed to find backend"), 0u);
+  EXPECT_GT(records, 0);
+
+  // Nothing holds the sessions once their queued work is done and their callbacks are gone.
+  std::vector<std::weak_ptr<RuvoReportingSession>> weak(sessions.begin(), sessions.end());
+  sessions.clear();
+  EXPECT_TRUE(Eventually([&] {
+    return std::all_of(weak.begin(), weak.end(), [](const auto& s) { return s.expired(); });
+  }));
+  EXPECT_EQ(platform.orientation.RegisteredCount(FakeOrientationRegistry::Kind::kDevice), 0u);
 }
 
 }  // namespace

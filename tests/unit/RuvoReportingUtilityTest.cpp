@@ -45,78 +45,59 @@ TEST(ServiceTypeNameTest, NamesEveryCodedTypeAndTheUnsetType) {
   EXPECT_EQ(ServiceTypeName(65534), std::nullopt);
 }
 
-TEST(CategoryNameTest, GroupPrefixOnlyWhenTheWholeHighHalfIsOneGroup) {
-  EXPECT_EQ(CategoryName(0x80000001), "Toolbox_Generic");
-  EXPECT_EQ(CategoryName(0x80000009), "Toolbox_Metrioning");
-  EXPECT_EQ(CategoryName(0x08000005), "Session_Setup");
-  EXPECT_EQ(CategoryName(0x10000004), "DSP_PlaybackAndRecord");
-  EXPECT_EQ(CategoryName(0x4000000B), "Routing_Volume");
-  EXPECT_EQ(CategoryName(0x20000000), "HAL_Undefined");
-  // Two group bits, a bit outside the groups, or every bit: a bare "_".
-  EXPECT_EQ(CategoryName(0x90000001), "_Generic");
-  EXPECT_EQ(CategoryName(0x18000008), "_Error");
-  EXPECT_EQ(CategoryName(0x00010002), "_Record");
-  EXPECT_EQ(CategoryName(0xFFFF0001), "_Generic");
-  EXPECT_EQ(CategoryName(0x00010000), "_Undefined");
-  EXPECT_EQ(CategoryName(0x80010001), "_Generic");
-}
-
-TEST(CategoryNameTest, UngroupedAndOutOfTableKinds) {
-  EXPECT_EQ(CategoryName(0), "Undefined");
-  EXPECT_EQ(CategoryName(0x00000003), "Playback");
-  EXPECT_EQ(CategoryName(0x0000000A), "Performance");
-  EXPECT_EQ(CategoryName(0x0000000B), "Volume");
-  EXPECT_EQ(CategoryName(0x0000000C), "Undefined");
-  EXPECT_EQ(CategoryName(0x0000FFFF), "Undefined");
-  EXPECT_EQ(CategoryName(0x8000000C), "Toolbox_Undefined");
-  // The summary event's category has no prefix at all; its neighbour does.
-  EXPECT_EQ(CategoryName(kSummaryEventCategory), "Undefined");
-  EXPECT_EQ(CategoryName(0xFFFFFFFE), "_Undefined");
-}
-
-TEST(TypeNameTest, UnknownOnlyFor65535AndUndefinedElsewhere) {
-  EXPECT_EQ(TypeName(0), "Generic");
-  EXPECT_EQ(TypeName(1), "Start");
-  EXPECT_EQ(TypeName(2), "Stop");
-  EXPECT_EQ(TypeName(3), "Setup");
-  EXPECT_EQ(TypeName(4), "Error");
-  EXPECT_EQ(TypeName(5), "IssueDetector");
-  EXPECT_EQ(TypeName(6), "Undefined");
-  EXPECT_EQ(TypeName(65534), "Undefined");
-  EXPECT_EQ(TypeName(kSummaryEventType), "Unknown");
+// A group prefix only when the whole high half is one group; two group bits, a bit outside the
+// groups, or every bit give a bare "_". The summary event's category has no prefix; its neighbour
+// does.
+TEST(CategoryAndTypeNameTest, EveryKindOfCode) {
+  const std::pair<uint32_t, const char*> categories[] = {{0x80000001, "Toolbox_Generic"},
+                                                         {0x80000009, "Toolbox_Metrioning"},
+                                                         {0x08000005, "Session_Setup"},
+                                                         {0x10000004, "DSP_PlaybackAndRecord"},
+                                                         {0x4000000B, "Routing_Volume"},
+                                                         {0x20000000, "HAL_Undefined"},
+                                                         {0x90000001, "_Generic"},
+                                                         {0x18000008, "_Error"},
+                                                         {0x00010002, "_Record"},
+                                                         {0xFFFF0001, "_Generic"},
+                                                         {0x00010000, "_Undefined"},
+                                                         {0x80010001, "_Generic"},
+                                                         {0, "Undefined"},
+                                                         {3, "Playback"},
+                                                         {0x0A, "Performance"},
+                                                         {0x0B, "Volume"},
+                                                         {0x0C, "Undefined"},
+                                                         {0xFFFF, "Undefined"},
+                                                         {0x8000000C, "Toolbox_Undefined"},
+                                                         {kSummaryEventCategory, "Undefined"},
+                                                         {0xFFFFFFFE, "_Undefined"}};
+  for (const auto& [code, name] : categories) EXPECT_EQ(CategoryName(code), name) << code;
+  const std::pair<uint16_t, const char*> types[] = {
+      {0, "Generic"},   {1, "Start"},         {2, "Stop"},
+      {3, "Setup"},     {4, "Error"},         {5, "IssueDetector"},
+      {6, "Undefined"}, {65534, "Undefined"}, {kSummaryEventType, "Unknown"}};
+  for (const auto& [code, name] : types) EXPECT_EQ(TypeName(code), name) << code;
 }
 
 // ---------------------------------------------------------------------------------------------
 // Application name
 
-TEST(ApplicationNameFromUserInfoTest, MissingDictionaryOrKeyGivesUnknown) {
+// A missing dictionary or key gives "Unknown"; a stored value comes back as it is, whatever its
+// type (compared as text, so 7 is not 7.0).
+TEST(ApplicationNameFromUserInfoTest, StoredValueOrUnknown) {
   EXPECT_EQ(ApplicationNameFromUserInfo(nullptr), Value("Unknown"));
-  const Dictionary empty = MakeDictionary();
-  EXPECT_EQ(ApplicationNameFromUserInfo(&empty), Value("Unknown"));
-  const Dictionary other = {{"HostApplication", "com.example.player"}};
-  EXPECT_EQ(ApplicationNameFromUserInfo(&other), Value("Unknown"));
-  // A value that is not a dictionary at all holds no key.
-  const Value notADictionary = Value::array({"HostApplicationDisplayID", "x"});
-  EXPECT_EQ(ApplicationNameFromUserInfo(&notADictionary), Value("Unknown"));
-}
-
-TEST(ApplicationNameFromUserInfoTest, StoredValueComesBackAsItIsWhateverItsType) {
-  const Dictionary named = {{"HostApplicationDisplayID", "com.example.player"}};
-  EXPECT_EQ(ApplicationNameFromUserInfo(&named), Value("com.example.player"));
-
-  const Dictionary emptyName = {{"HostApplicationDisplayID", ""}};
-  EXPECT_EQ(ApplicationNameFromUserInfo(&emptyName), Value(""));
-
-  const Dictionary number = {{"HostApplicationDisplayID", 7}};
-  const Value numberName = ApplicationNameFromUserInfo(&number);
-  EXPECT_TRUE(numberName.is_number_integer());
-  EXPECT_EQ(numberName, Value(7));
-
-  const Dictionary list = {{"HostApplicationDisplayID", Value::array({1, "a"})}};
-  EXPECT_EQ(ApplicationNameFromUserInfo(&list), Value::array({1, "a"}));
-
-  const Dictionary null = {{"HostApplicationDisplayID", nullptr}};
-  EXPECT_TRUE(ApplicationNameFromUserInfo(&null).is_null());
+  const std::pair<Value, Value> cases[] = {
+      {MakeDictionary(), "Unknown"},
+      {{{"HostApplication", "com.example.player"}}, "Unknown"},
+      {Value::array({"HostApplicationDisplayID", "x"}), "Unknown"},
+      {{{"HostApplicationDisplayID", "com.example.player"}}, "com.example.player"},
+      {{{"HostApplicationDisplayID", ""}}, ""},
+      {{{"HostApplicationDisplayID", 7}}, 7},
+      {{{"HostApplicationDisplayID", Value::array({1, "a"})}}, Value::array({1, "a"})},
+      {{{"HostApplicationDisplayID", nullptr}}, nullptr},
+  };
+  for (const auto& [userInfo, name] : cases) {
+    EXPECT_EQ(ApplicationNameFromUserInfo(&userInfo).dump(), name.dump()) << userInfo.dump();
+  }
 }
 
 // ---------------------------------------------------------------------------------------------

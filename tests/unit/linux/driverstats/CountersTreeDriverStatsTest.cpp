@@ -133,7 +133,7 @@ TEST_F(CountersTreeDriverStatsTest, EverySampleReadsTheFilesAfreshAndBadOnesCost
   tree_.write("G/new", 30);   // channels added later are not in this subscription
   tree_.remove("G/vanishing");
   tree_.remove("G/becomes-dir");
-  tree_.makeDirectory("G/becomes-dir");
+  std::filesystem::create_directory(tree_.path("G/becomes-dir"));
   tree_.remove("G/becomes-fifo");
   ASSERT_EQ(mkfifo(tree_.path("G/becomes-fifo").c_str(), 0644), 0);  // must not block
   EXPECT_EQ(Read(Samples()), (Values{{"good", 11}}));
