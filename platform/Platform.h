@@ -1,5 +1,6 @@
 #pragma once
 
+#include <cstdint>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -46,6 +47,8 @@ struct PlatformServices {
   std::string diagnosticDirectory = "/var/log/tavrin/DiagnosticLogs";
   // Started sessions spool what they gather here ("<state-dir>/spool").
   std::string spoolDirectory = "/var/lib/tavrin/spool";
+  // A session's spool stops growing at this size (the "limits.spool_bytes_per_session" setting).
+  uint64_t spoolBytesPerSession = uint64_t(256) << 20;
   // The device's "InternalBuild" fact, asked of `deviceInfo` once and kept: a build does not
   // change while the service runs. Shared by copies of the context.
   std::shared_ptr<DeviceFactOnce> internalBuild = std::make_shared<DeviceFactOnce>();

@@ -220,8 +220,8 @@ void RuvoReportingSession::start() {
   const int64_t startedAt = std::chrono::duration_cast<std::chrono::nanoseconds>(
                                 platform_.dispatcher->GetClock().WallNow().time_since_epoch())
                                 .count();
-  auto spool =
-      SessionSpool::Create(*platform_.fileSystem, platform_.spoolDirectory, reporterID_, startedAt);
+  auto spool = SessionSpool::Create(*platform_.fileSystem, platform_.spoolDirectory, reporterID_,
+                                    startedAt, platform_.spoolBytesPerSession);
   {
     std::lock_guard lock(propertyMutex_);
     summaryTexts_ = std::make_shared<SummaryTexts>(spool);

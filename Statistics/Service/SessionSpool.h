@@ -28,9 +28,11 @@ namespace tavrin {
 // torn last record is ignored when reading. Thread-safe.
 class SessionSpool {
  public:
-  // A session's spool stops growing here (and says so once): its summary file then lacks the
-  // later messages, and a recovered summary covers only what was spooled.
+  // A session's spool stops growing at its limit (and says so once): its summary file then lacks
+  // the later messages, a recovered summary covers only what was spooled, and its long texts
+  // stay in memory. The limit is the "limits.spool_bytes_per_session" setting.
   static constexpr uint64_t kDefaultByteLimit = uint64_t(256) << 20;
+  static constexpr uint64_t kMinByteLimit = uint64_t(1) << 20;
   static constexpr unsigned kFileMode = 0640;
   static constexpr unsigned kDirectoryMode = 0750;
   static constexpr const char* kFileSuffix = ".spool";

@@ -100,6 +100,7 @@ struct ListenerSettings {
   uint64_t connectionsPerUid = tavrin::UnixListenerOptions{}.connectionsPerUid;
   uint64_t replyBytesPerConnection = tavrin::UnixListenerOptions{}.replyBytesPerConnection;
   uint64_t replyBytesTotal = tavrin::UnixListenerOptions{}.replyBytesTotal;
+  uint64_t spoolBytesPerSession = tavrin::SessionSpool::kDefaultByteLimit;
 };
 
 ListenerSettings ReadListenerSettings(const tavrin::Dictionary& defaults) {
@@ -133,6 +134,8 @@ ListenerSettings ReadListenerSettings(const tavrin::Dictionary& defaults) {
   readCount("connections_per_uid", 8, settings.connectionsPerUid);
   readCount("reply_bytes_per_connection", 64 * 1024, settings.replyBytesPerConnection);
   readCount("reply_bytes_total", 1024 * 1024, settings.replyBytesTotal);
+  readCount("spool_bytes_per_session", tavrin::SessionSpool::kMinByteLimit,
+            settings.spoolBytesPerSession);
   auto list = table->find("kill_uids");
   if (list == table->end()) return settings;
   if (!list->is_array()) {
@@ -276,6 +279,7 @@ int main(int argc, char** argv) {
   services.defaults = &defaults;
   services.diagnosticDirectory = options.diagnosticDir;
   services.spoolDirectory = options.stateDir + "/spool";
+  services.spoolBytesPerSession = startSettings.spoolBytesPerSession;
   RecoverSpooledSessions(services);
 
   // Log verbosity and the analytics policy follow the defaults as the settings do.

@@ -165,6 +165,34 @@ TEST_F(SummaryTest, LongTextsSpillToTheSpoolAndComeBackWhole) {
   EXPECT_EQ(session->createSummaryEventForSession(), expected);
 }
 
+// A full spool says so once and keeps what it has; the summary event stays whole because texts
+// that cannot spill stay in memory, and the file lists the messages spooled before it filled.
+TEST_F(SummaryTest, AFullSpoolLeavesLaterMessagesOutOfTheFileButNotOfTheSummary) {
+  platform.services.spoolBytesPerSession = 600;
+  auto session = Started(3);
+  std::string joined;
+  for (int i = 0; i < 100; ++i) {
+    session->sendMessage(Dictionary{{"k", std::string(100, 'k') + std::to_string(i)}}, 1, 1,
+                         nullptr);
+    platform.dispatcher.RunUntilIdle();
+    joined += (i ? "," : "") + std::string(100, 'k') + std::to_string(i);
+  }
+  platform.dispatcher.RunUntilIdle();
+  const size_t spooled = Entries(session->spool()).size();
+  EXPECT_GT(spooled, 0u);
+  EXPECT_LT(spooled, 10u);
+  EXPECT_EQ(session->createSummaryEventForSession(),
+            (Dictionary{{"Ruvo_Session_Summary_Event", "3"}, {"k", joined}}));
+  session->stop();
+  platform.dispatcher.RunUntilIdle();
+  const auto errors = SessionMessages(LogLevel::kError);
+  ASSERT_EQ(errors.size(), 1u);
+  EXPECT_NE(errors[0].find("the spool is full"), std::string::npos) << errors[0];
+  const Value file =
+      Value::parse(*platform.fileSystem.ReadFile(platform.fileSystem.WriteCalls().back()));
+  EXPECT_EQ(file.size(), spooled + 2) << "user info, the spooled messages, the summary";
+}
+
 // What a crash leaves: the spool of an open session. Recovery sends its summary through a session
 // marked as recovered, with the file named so, and removes the spool; a torn last record only
 // loses that record, and a spool without its header is removed with nothing sent.
