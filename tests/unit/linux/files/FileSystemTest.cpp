@@ -12,6 +12,7 @@
 #include <memory>
 #include <optional>
 #include <thread>
+#include <vector>
 
 #include <gtest/gtest.h>
 
@@ -102,6 +103,50 @@ TEST_P(FileSystemContractTest, APathIsAFileOrADirectoryAndAWriteNeedsItsDirector
   EXPECT_TRUE(files_.WriteFileAtomically(root_ + "/missing/f", "x"));
   EXPECT_EQ(driver_->Read(root_ + "/missing/f"), std::nullopt);
   EXPECT_EQ(driver_->Read(root_ + "/f"), "x");
+}
+
+// Appends accumulate and are read back in pieces; an atomic write shows nothing until its commit
+// and nothing at all when dropped uncommitted; listing shows files only, sorted.
+TEST_P(FileSystemContractTest, AppendsReadsListingAndStreamedAtomicWrites) {
+  OptionalError error;
+  auto appended = files_.OpenForAppend(root_ + "/s", 0640, &error);
+  ASSERT_TRUE(appended) << error->LocalizedDescription();
+  EXPECT_EQ(appended->Append("abc"), std::nullopt);
+  EXPECT_EQ(appended->Append("defgh"), std::nullopt);
+  EXPECT_EQ(driver_->Read(root_ + "/s"), "abcdefgh") << "each append reaches the file";
+  auto reader = files_.OpenForReading(root_ + "/s", &error);
+  ASSERT_TRUE(reader);
+  std::string piece, all;
+  for (int reads = 0; reads < 10; ++reads) {
+    ASSERT_EQ(reader->Read(3, &piece), std::nullopt);
+    if (piece.empty()) break;
+    EXPECT_LE(piece.size(), 3u);
+    all += piece;
+  }
+  EXPECT_EQ(all, "abcdefgh");
+  EXPECT_FALSE(files_.OpenForReading(root_ + "/none", &error));
+  EXPECT_TRUE(error);
+  EXPECT_FALSE(files_.OpenForAppend(root_ + "/missing/s", 0640, &error));
+
+  auto atomic = files_.BeginAtomicWrite(root_ + "/t", &error);
+  ASSERT_TRUE(atomic);
+  EXPECT_EQ(atomic->Append("[1,"), std::nullopt);
+  EXPECT_EQ(atomic->Append("2]"), std::nullopt);
+  EXPECT_EQ(driver_->Read(root_ + "/t"), std::nullopt);
+  EXPECT_EQ(atomic->Commit(), std::nullopt);
+  EXPECT_EQ(driver_->Read(root_ + "/t"), "[1,2]");
+  atomic = files_.BeginAtomicWrite(root_ + "/t", &error);
+  ASSERT_TRUE(atomic);
+  EXPECT_EQ(atomic->Append("dropped"), std::nullopt);
+  atomic.reset();
+  EXPECT_EQ(driver_->Read(root_ + "/t"), "[1,2]");
+
+  ASSERT_EQ(files_.CreateDirectories(root_ + "/d", 0750), std::nullopt);
+  EXPECT_EQ(files_.ListFiles(root_), (std::vector<std::string>{"s", "t"}));
+  EXPECT_EQ(files_.RemoveFile(root_ + "/s"), std::nullopt);
+  EXPECT_TRUE(files_.RemoveFile(root_ + "/s")) << "already gone";
+  EXPECT_EQ(files_.ListFiles(root_), std::vector<std::string>{"t"});
+  EXPECT_TRUE(files_.ListFiles(root_ + "/none").empty());
 }
 
 // ---- The Linux one ------------------------------------------------------------------------------
