@@ -405,7 +405,8 @@ void RuvoReportingSession::stop() {
         if (error) TLOG_ERROR(SessionLog(), "flush error {}", error->LocalizedDescription());
       });
     } else if (spool) {
-      spool->Remove();
+      // A recovered summary that found no back-end keeps its spool for the next start.
+      if (!self->recovered_ || self->serviceType() == service_type::kTest) spool->Remove();
     }
     self->setTelvoroSession(nullptr);
   });

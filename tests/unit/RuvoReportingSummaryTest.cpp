@@ -238,6 +238,14 @@ TEST_F(SummaryTest, ASpoolLeftByACrashBecomesARecoveredSummary) {
     // The summary continues the session's count of its kind.
     EXPECT_EQ(entries.back().begin().key(), "Undefined_Unknown_1");
   }
+  // No back-end within the wait: the spool stays for the next start to try again.
+  platform.telvoro.SetDiscovery(FakeTelvoroService::Discovery::kAnswerNil);
+  const std::string path = directory + "/later.spool";
+  ASSERT_EQ(platform.fileSystem.WriteFileAtomically(path, spooled), std::nullopt);
+  RuvoReportingSession::recover(platform.services, path);
+  platform.dispatcher.RunUntilIdle();
+  platform.dispatcher.AdvanceBy(std::chrono::seconds(10));
+  EXPECT_EQ(platform.fileSystem.ReadFile(path), spooled);
 }
 
 TEST_F(SummaryTest, WritingPutsTheUserInfoFirstEveryTime) {
