@@ -90,7 +90,8 @@ class CountingBackend final : public TelvoroService {
     void StartConfiguration(std::function<void(const BackendList&)> done) override {
       done(std::vector<std::string>{"bench"});
     }
-    bool SendSessionMessage(uint16_t, uint16_t, const Dictionary&, Error*) override {
+    bool SendSessionMessage(uint16_t, uint16_t, const Dictionary&, Error*,
+                            const DeliveryReceiptPtr&) override {
       received_.fetch_add(1, std::memory_order_release);
       return true;
     }
@@ -111,7 +112,7 @@ class CountingBackend final : public TelvoroService {
     return std::make_shared<Session>(received);
   }
   bool SendOneMessage(const Dictionary&, const Dictionary&, uint16_t, uint16_t, const Dictionary&,
-                      Error*) override {
+                      Error*, const DeliveryReceiptPtr&) override {
     return true;
   }
 

@@ -9,6 +9,7 @@
 
 #include "base/Dictionary.h"
 #include "base/Error.h"
+#include "platform/MessageLedger.h"
 
 namespace tavrin {
 
@@ -44,9 +45,10 @@ class TelvoroSession {
   // Discovery: calls `done` once, later, with the back-ends that are up.
   virtual void StartConfiguration(std::function<void(const BackendList&)> done) = 0;
   // Hands one message over; never blocks on I/O. False (and *error when given) when the message
-  // could not be accepted.
+  // could not be accepted. `receipt`, when given, is told exactly once what became of it (at
+  // once when it is refused, later when it is committed or lost).
   virtual bool SendSessionMessage(uint16_t category, uint16_t type, const Dictionary& payload,
-                                  Error* error) = 0;
+                                  Error* error, const DeliveryReceiptPtr& receipt = nullptr) = 0;
   // Calls `done` once everything handed over before is committed or acknowledged, with an error
   // when that failed.
   virtual void FlushMessages(std::function<void(const OptionalError&)> done) = 0;
@@ -63,10 +65,11 @@ class TelvoroService {
   virtual TelvoroSessionPtr CreateTelvoroSession(
       const Dictionary& sessionInfo, const Dictionary& userInfo,
       const std::vector<std::string>& frameworksToCheck) = 0;
-  // Sends one message without a session. Never blocks on I/O.
+  // Sends one message without a session. Never blocks on I/O. `receipt` as for
+  // SendSessionMessage.
   virtual bool SendOneMessage(const Dictionary& sessionInfo, const Dictionary& userInfo,
                               uint16_t category, uint16_t type, const Dictionary& payload,
-                              Error* error) = 0;
+                              Error* error, const DeliveryReceiptPtr& receipt = nullptr) = 0;
 };
 
 }  // namespace tavrin

@@ -383,7 +383,7 @@ void RuvoReportingSession::stop() {
         lastEntry = MakeDictionary();
         lastEntry[summaryId] = *cleaned;
         self->deliver(cleaned, cleaned, kSummaryEventCategory, kSummaryEventType,
-                      /*startedAtSend=*/true);
+                      /*startedAtSend=*/true, nullptr);
       }
     }
     self->writeSummaryFile(spool, leading, stoppedServiceType, stoppedAt,
@@ -418,7 +418,7 @@ void RuvoReportingSession::sendMessage(const Dictionary& payload, uint32_t categ
 }
 
 void RuvoReportingSession::sendMessage(const Dictionary& payload, uint32_t category, uint16_t type,
-                                       bool sync, Reply reply) {
+                                       bool sync, Reply reply, const DeliveryReceiptPtr& receipt) {
   TLOG_DEBUG(SessionLog(), "sending message for session owned by {}", reporterID_);
   bool changed = false;
   auto cleaned = std::make_shared<const Dictionary>(CleanedPayload(payload, &changed));
@@ -444,35 +444,39 @@ void RuvoReportingSession::sendMessage(const Dictionary& payload, uint32_t categ
   if (!startedAtSend) spool.reset();
   telvoroQueue_->Async([self = shared_from_this(), cleaned = std::move(cleaned),
                         received = std::move(received), messageId = std::move(messageId),
-                        spool = std::move(spool), category, type, startedAtSend] {
+                        spool = std::move(spool), category, type, startedAtSend, receipt] {
     if (spool) spool->AppendMessage(messageId, *cleaned);
-    self->deliver(cleaned, received, category, type, startedAtSend);
+    self->deliver(cleaned, received, category, type, startedAtSend, receipt);
   });
   if (reply) reply(std::nullopt);
 }
 
 void RuvoReportingSession::deliver(const PayloadPtr& cleaned, const PayloadPtr& received,
-                                   uint32_t category, uint16_t type, bool startedAtSend) {
+                                   uint32_t category, uint16_t type, bool startedAtSend,
+                                   const DeliveryReceiptPtr& receipt) {
   if (!startedAtSend) {
     TLOG_DEBUG(SessionLog(), "session not started, will send as a single message");
-    sendSingleMessage(platform_, *cleaned, category, type, serviceType(), userInfo(), nullptr);
+    sendSingleMessage(platform_, *cleaned, category, type, serviceType(), userInfo(), nullptr,
+                      receipt);
     return;
   }
   if (serviceType() == service_type::kTest) {
     TLOG_INFO(SessionLog(), "transactions aren't allowed on this platform");
+    Settle(receipt, false, DropReason::kTestSession);
     return;
   }
   TelvoroSessionPtr session = telvoroSession();
   if (!session) {
     const Error error{kGeneralErrorDomain, -1, "No valid TelvoroSession"};
     TLOG_ERROR(SessionLog(), "{}", error.LocalizedDescription());
+    Settle(receipt, false, DropReason::kNoBackend);
     return;
   }
   // A refused message is dropped without a line: the platform's error says nothing the caller
   // could act on, and the reply has long been given.
   Error error;
   if (session->SendSessionMessage(static_cast<uint16_t>(category & kPlatformCategoryMask), type,
-                                  *cleaned, &error)) {
+                                  *cleaned, &error, receipt)) {
     TLOG_DEBUG(SessionLog(), "TelvoroAgent {} : message {} : category {} : type {}",
                session->Description(), *received, static_cast<int32_t>(category), type);
   }
@@ -758,7 +762,8 @@ void RuvoReportingSession::orientationChanged(OrientationKind kind,
 
 void RuvoReportingSession::sendSingleMessage(PlatformServices& platform, const Dictionary& payload,
                                              uint32_t category, uint16_t type, uint16_t serviceType,
-                                             const Dictionary& userInfo, Reply reply) {
+                                             const Dictionary& userInfo, Reply reply,
+                                             const DeliveryReceiptPtr& receipt) {
   // `userInfo` is not sent: single messages carry only the service's own identification.
   (void)userInfo;
   const int64_t delaySeconds =
@@ -773,7 +778,7 @@ void RuvoReportingSession::sendSingleMessage(PlatformServices& platform, const D
   std::optional<Dictionary> received;
   if (changed && LogTarget(SessionLog()).ShouldLog(LogLevel::kDebug)) received = payload;
   Work send = [&platform, cleaned = std::move(cleaned), received = std::move(received), category,
-               type, serviceType, reply = std::move(reply)] {
+               type, serviceType, reply = std::move(reply), receipt] {
     EmitTracePoint(trace::kMessageSent);
     TLOG_DEBUG(SessionLog(), "sending single message");
     Dictionary sessionInfo = MakeDictionary();
@@ -790,7 +795,7 @@ void RuvoReportingSession::sendSingleMessage(PlatformServices& platform, const D
     OptionalError result;
     if (platform.telvoro->SendOneMessage(sessionInfo, telvoroUserInfo,
                                          static_cast<uint16_t>(category & kPlatformCategoryMask),
-                                         type, cleaned, &error)) {
+                                         type, cleaned, &error, receipt)) {
       TLOG_DEBUG(SessionLog(), "message {} : category {} : type {}", received ? *received : cleaned,
                  static_cast<int32_t>(category), type);
     } else {

@@ -116,8 +116,9 @@ class RuvoReportingSession : public std::enable_shared_from_this<RuvoReportingSe
   // message. `reply` (optional) is called at once, on the caller's thread, with nil: it means
   // accepted. `sync` is accepted and has no effect: delivery is never awaited.
   void sendMessage(const Dictionary& payload, uint32_t category, uint16_t type, Reply reply);
+  // `receipt`, when given, is the sender's account: it is told what became of the message.
   void sendMessage(const Dictionary& payload, uint32_t category, uint16_t type, bool sync,
-                   Reply reply);
+                   Reply reply, const DeliveryReceiptPtr& receipt = nullptr);
   // Counts one message of this kind and returns its id "<category>_<type>_<n>". Call exactly once
   // per message.
   std::string messageIdForCategory(uint32_t category, uint16_t type);
@@ -144,7 +145,8 @@ class RuvoReportingSession : public std::enable_shared_from_this<RuvoReportingSe
   // queue.
   static void sendSingleMessage(PlatformServices& platform, const Dictionary& payload,
                                 uint32_t category, uint16_t type, uint16_t serviceType,
-                                const Dictionary& userInfo, Reply reply);
+                                const Dictionary& userInfo, Reply reply,
+                                const DeliveryReceiptPtr& receipt = nullptr);
 
   // The session log scope ("rvrr"); registered once per process. May be null (default log).
   static const LogHandle& SessionLog();
@@ -197,7 +199,7 @@ class RuvoReportingSession : public std::enable_shared_from_this<RuvoReportingSe
   // Ends the back-end wait; true when this call ended it (each wait ends exactly once).
   static bool EndBackendWait(const std::shared_ptr<BackendWait>& wait, bool found);
   void deliver(const PayloadPtr& cleaned, const PayloadPtr& received, uint32_t category,
-               uint16_t type, bool startedAtSend);
+               uint16_t type, bool startedAtSend, const DeliveryReceiptPtr& receipt);
   void registerOrientationCallbacks();
   void orientationChanged(OrientationKind kind, const OrientationValue& orientation);
   void appendAggregated(const Dictionary& payload);

@@ -38,17 +38,22 @@ bool FakeTelvoroSession::AnswerDiscovery(const BackendList& backends) {
   return true;
 }
 
+// A refused message is dropped as by a full queue; an accepted one counts as committed at once.
 bool FakeTelvoroSession::SendSessionMessage(uint16_t category, uint16_t type,
-                                            const Dictionary& payload, Error* error) {
+                                            const Dictionary& payload, Error* error,
+                                            const DeliveryReceiptPtr& receipt) {
   OptionalError failure = service_.Locked(service_.sendError_);
-  std::lock_guard lock(mutex_);
-  if (failure) {
-    ++refused_;
-    if (error != nullptr) *error = *failure;
-    return false;
+  {
+    std::lock_guard lock(mutex_);
+    if (failure) {
+      ++refused_;
+      if (error != nullptr) *error = *failure;
+    } else {
+      messages_.push_back(FakeTelvoroMessage{category, type, payload});
+    }
   }
-  messages_.push_back(FakeTelvoroMessage{category, type, payload});
-  return true;
+  Settle(receipt, !failure, DropReason::kQueueFull);
+  return !failure;
 }
 
 void FakeTelvoroSession::FlushMessages(std::function<void(const OptionalError&)> done) {
@@ -96,15 +101,20 @@ TelvoroSessionPtr FakeTelvoroService::CreateTelvoroSession(
 
 bool FakeTelvoroService::SendOneMessage(const Dictionary& sessionInfo, const Dictionary& userInfo,
                                         uint16_t category, uint16_t type, const Dictionary& payload,
-                                        Error* error) {
-  std::lock_guard lock(mutex_);
-  if (sendError_) {
-    ++refusedSingles_;
-    if (error != nullptr) *error = *sendError_;
-    return false;
+                                        Error* error, const DeliveryReceiptPtr& receipt) {
+  bool accepted = false;
+  {
+    std::lock_guard lock(mutex_);
+    if (sendError_) {
+      ++refusedSingles_;
+      if (error != nullptr) *error = *sendError_;
+    } else {
+      singleMessages_.push_back(SingleMessage{sessionInfo, userInfo, category, type, payload});
+      accepted = true;
+    }
   }
-  singleMessages_.push_back(SingleMessage{sessionInfo, userInfo, category, type, payload});
-  return true;
+  Settle(receipt, accepted, DropReason::kQueueFull);
+  return accepted;
 }
 
 }  // namespace tavrin::testing

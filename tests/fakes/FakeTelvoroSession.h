@@ -32,8 +32,8 @@ class FakeTelvoroSession final : public TelvoroSession {
                      Dictionary userInfo, std::vector<std::string> frameworksToCheck);
 
   void StartConfiguration(std::function<void(const BackendList&)> done) override;
-  bool SendSessionMessage(uint16_t category, uint16_t type, const Dictionary& payload,
-                          Error* error) override;
+  bool SendSessionMessage(uint16_t category, uint16_t type, const Dictionary& payload, Error* error,
+                          const DeliveryReceiptPtr& receipt) override;
   void FlushMessages(std::function<void(const OptionalError&)> done) override;
   std::string Description() const override;
 
@@ -110,7 +110,8 @@ class FakeTelvoroService final : public TelvoroService {
       const Dictionary& sessionInfo, const Dictionary& userInfo,
       const std::vector<std::string>& frameworksToCheck) override;
   bool SendOneMessage(const Dictionary& sessionInfo, const Dictionary& userInfo, uint16_t category,
-                      uint16_t type, const Dictionary& payload, Error* error) override;
+                      uint16_t type, const Dictionary& payload, Error* error,
+                      const DeliveryReceiptPtr& receipt) override;
 
  private:
   friend class FakeTelvoroSession;

@@ -78,4 +78,15 @@ void DropReporter::Dropped(uint64_t count, std::string_view reason) {
              reason, Total());
 }
 
+const DeliveryReceiptPtr& RecordReceipt(const ReportRecord& record) {
+  static const DeliveryReceiptPtr kNone;
+  if (const auto* r = std::get_if<SessionMessageRecord>(&record)) return r->receipt;
+  if (const auto* r = std::get_if<SingleMessageRecord>(&record)) return r->receipt;
+  return kNone;
+}
+
+void SettleRecord(const ReportRecord& record, bool delivered, DropReason reason) {
+  Settle(RecordReceipt(record), delivered, reason);
+}
+
 }  // namespace tavrin

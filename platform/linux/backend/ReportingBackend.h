@@ -17,6 +17,7 @@
 #include "base/Error.h"
 #include "platform/Clock.h"
 #include "platform/LogSystem.h"
+#include "platform/MessageLedger.h"
 
 namespace tavrin {
 
@@ -42,6 +43,9 @@ struct SessionMessageRecord {
   uint16_t type = 0;
   Dictionary payload;
   double receivedAt = 0;
+  // The client message this record carries is accounted for through it; none for the service's
+  // own records.
+  DeliveryReceiptPtr receipt = nullptr;
 };
 
 // One row of `single_messages`.
@@ -52,6 +56,7 @@ struct SingleMessageRecord {
   uint16_t type = 0;
   Dictionary payload;
   double receivedAt = 0;
+  DeliveryReceiptPtr receipt = nullptr;
 };
 
 // One row of `analytics_events`.
@@ -84,6 +89,13 @@ Value RecordJson(const ReportRecord& record);
 
 // The reporter ID a record belongs to, when it has one (sessions and session messages).
 std::optional<int64_t> RecordReporterId(const ReportRecord& record);
+
+// The receipt of the client message a record carries; null for the service's own records.
+const DeliveryReceiptPtr& RecordReceipt(const ReportRecord& record);
+// Tells the record's receipt, when it carries one, what became of it in one back-end. Each
+// back-end settles every record it is handed exactly once.
+void SettleRecord(const ReportRecord& record, bool delivered,
+                  DropReason reason = DropReason::kBackendDown);
 
 // Counts that a person can read about one back-end.
 struct BackendStats {

@@ -91,6 +91,7 @@ bool KafkaProducerBackend::Append(ReportRecordPtr record) {
   std::shared_lock running(producerMutex_);
   if (!IsUp()) {
     drops_.Dropped(1, producer_ ? "the producer is shut down" : "the producer is not up");
+    SettleRecord(*record, false, DropReason::kBackendDown);
     return false;
   }
   const std::string value = JsonText(RecordJson(*record));
@@ -100,7 +101,7 @@ bool KafkaProducerBackend::Append(ReportRecordPtr record) {
   {
     std::lock_guard lock(mutex_);
     seq = ++producedSeq_;
-    outstanding_.insert(seq);
+    outstanding_.emplace(seq, RecordReceipt(*record));
   }
   rd_kafka_topic_t* topic = topics_[record->index()];
   const rd_kafka_resp_err_t error =
@@ -122,14 +123,18 @@ bool KafkaProducerBackend::Append(ReportRecordPtr record) {
   // can be) is refused here, never sent in part: it is counted with its size, and the store,
   // which has no such limit, keeps it when it is configured too.
   std::string reason;
+  DropReason code = DropReason::kDeliveryFailed;
   if (error == RD_KAFKA_RESP_ERR__QUEUE_FULL) {
     reason = fmt::format("the producer queue is full ({} records)", options_.maxQueuedMessages);
+    code = DropReason::kQueueFull;
   } else if (error == RD_KAFKA_RESP_ERR_MSG_SIZE_TOO_LARGE) {
     reason = fmt::format("a record of {} bytes is over message.max.bytes", value.size());
+    code = DropReason::kTooLarge;
   } else {
     reason = rd_kafka_err2str(error);
   }
   drops_.Dropped(1, reason);
+  SettleRecord(*record, false, code);
   return false;
 }
 
@@ -174,8 +179,15 @@ void KafkaProducerBackend::OnDelivery(const rd_kafka_message_t& message) {
     failed_.fetch_add(1, std::memory_order_relaxed);
     drops_.Dropped(1, fmt::format("delivery failed: {}", rd_kafka_err2str(message.err)));
   }
-  std::lock_guard lock(mutex_);
-  outstanding_.erase(OpaqueSeq(message._private));
+  DeliveryReceiptPtr receipt;
+  {
+    std::lock_guard lock(mutex_);
+    const auto found = outstanding_.find(OpaqueSeq(message._private));
+    if (found == outstanding_.end()) return;
+    receipt = std::move(found->second);
+    outstanding_.erase(found);
+  }
+  Settle(receipt, message.err == RD_KAFKA_RESP_ERR_NO_ERROR, DropReason::kDeliveryFailed);
 }
 
 void KafkaProducerBackend::AnswerFlushes(bool all) {
@@ -187,7 +199,7 @@ void KafkaProducerBackend::AnswerFlushes(bool all) {
     const uint64_t lost = lostNow - lostReported_;
     while (!waiters_.empty()) {
       Waiter& waiter = waiters_.front();
-      const bool acknowledged = outstanding_.empty() || *outstanding_.begin() > waiter.target;
+      const bool acknowledged = outstanding_.empty() || outstanding_.begin()->first > waiter.target;
       if (!acknowledged && !all) break;
       OptionalError error;
       lostReported_ = lostNow;
@@ -236,6 +248,13 @@ void KafkaProducerBackend::Shutdown() {
     rd_kafka_flush(producer_, kPurgeReportTimeoutMs);
   }
   AnswerFlushes(true);
+  // Whatever got no report even after the purge is lost with the producer.
+  std::map<uint64_t, DeliveryReceiptPtr> unreported;
+  {
+    std::lock_guard lock(mutex_);
+    unreported.swap(outstanding_);
+  }
+  for (const auto& [seq, receipt] : unreported) Settle(receipt, false, DropReason::kDeliveryFailed);
   if (mainQueue_) {
     rd_kafka_queue_cb_event_enable(mainQueue_, nullptr, nullptr);
     rd_kafka_queue_destroy(mainQueue_);

@@ -21,6 +21,7 @@
 #include <condition_variable>
 #include <cstdint>
 #include <deque>
+#include <map>
 #include <mutex>
 #include <set>
 #include <shared_mutex>
@@ -112,7 +113,8 @@ class KafkaProducerBackend final : public ReportingBackend {
   mutable std::mutex mutex_;  // guards the fields below
   std::condition_variable wakeup_;
   uint64_t producedSeq_ = 0;
-  std::set<uint64_t> outstanding_;  // produced, no delivery report yet
+  // Produced, no delivery report yet: the receipt of the client message each carries, if any.
+  std::map<uint64_t, DeliveryReceiptPtr> outstanding_;
   std::deque<Waiter> waiters_;
   uint64_t lostReported_ = 0;  // drops counted when the last flush was answered
   bool eventsPending_ = false;

@@ -148,12 +148,12 @@ class BackendReportingService::Session final : public TelvoroSession {
         [this_service = &service_, done = std::move(done)] { done(this_service->UpBackends()); });
   }
 
-  bool SendSessionMessage(uint16_t category, uint16_t type, const Dictionary& payload,
-                          Error* error) override {
-    return service_.DeliverOrFail(
-        std::make_shared<const ReportRecord>(SessionMessageRecord{
-            record_.row, record_.reporterId, category, type, payload, Seconds(service_.clock_)}),
-        error);
+  bool SendSessionMessage(uint16_t category, uint16_t type, const Dictionary& payload, Error* error,
+                          const DeliveryReceiptPtr& receipt) override {
+    return service_.DeliverOrFail(std::make_shared<const ReportRecord>(SessionMessageRecord{
+                                      record_.row, record_.reporterId, category, type, payload,
+                                      Seconds(service_.clock_), service_.JoinedReceipt(receipt)}),
+                                  error);
   }
 
   void FlushMessages(std::function<void(const OptionalError&)> done) override {
@@ -212,11 +212,49 @@ TelvoroSessionPtr BackendReportingService::CreateTelvoroSession(const Dictionary
 
 bool BackendReportingService::SendOneMessage(const Dictionary& sessionInfo,
                                              const Dictionary& userInfo, uint16_t category,
-                                             uint16_t type, const Dictionary& payload,
-                                             Error* error) {
-  return DeliverOrFail(std::make_shared<const ReportRecord>(SingleMessageRecord{
-                           sessionInfo, userInfo, category, type, payload, Seconds(clock_)}),
-                       error);
+                                             uint16_t type, const Dictionary& payload, Error* error,
+                                             const DeliveryReceiptPtr& receipt) {
+  return DeliverOrFail(
+      std::make_shared<const ReportRecord>(SingleMessageRecord{
+          sessionInfo, userInfo, category, type, payload, Seconds(clock_), JoinedReceipt(receipt)}),
+      error);
+}
+
+namespace {
+
+// One message handed to several back-ends: delivered once any of them commits it, dropped (with
+// the first reason) only when every one of them lost it.
+class AnyBackendReceipt final : public DeliveryReceipt {
+ public:
+  AnyBackendReceipt(DeliveryReceiptPtr receipt, size_t backends)
+      : receipt_(std::move(receipt)), pending_(backends) {}
+  void Delivered() override {
+    delivered_.store(true);
+    Settled();
+  }
+  void Dropped(DropReason reason) override {
+    uint8_t none = kNoReason;
+    firstReason_.compare_exchange_strong(none, uint8_t(reason));
+    Settled();
+  }
+
+ private:
+  static constexpr uint8_t kNoReason = 0xFF;
+  void Settled() {
+    if (pending_.fetch_sub(1) != 1) return;
+    Settle(receipt_, delivered_.load(), DropReason(firstReason_.load()));
+  }
+  const DeliveryReceiptPtr receipt_;
+  std::atomic<size_t> pending_;
+  std::atomic<bool> delivered_{false};
+  std::atomic<uint8_t> firstReason_{kNoReason};
+};
+
+}  // namespace
+
+DeliveryReceiptPtr BackendReportingService::JoinedReceipt(const DeliveryReceiptPtr& receipt) const {
+  if (!receipt || backends_.size() <= 1) return receipt;
+  return std::make_shared<AnyBackendReceipt>(receipt, backends_.size());
 }
 
 void BackendReportingService::SendEventLazy(const std::string& name,
@@ -321,6 +359,7 @@ size_t BackendReportingService::Deliver(ReportRecordPtr record) {
 }
 
 bool BackendReportingService::DeliverOrFail(ReportRecordPtr record, Error* error) {
+  if (backends_.empty()) SettleRecord(*record, false, DropReason::kNoBackend);
   if (Deliver(std::move(record)) > 0) return true;
   if (error) {
     *error = Error{kGeneralErrorDomain, -1,

@@ -109,7 +109,8 @@ class BackendReportingService final : public TelvoroService,
       const std::vector<std::string>& frameworksToCheck) override;
   // False (with *error) when no back-end took the message.
   bool SendOneMessage(const Dictionary& sessionInfo, const Dictionary& userInfo, uint16_t category,
-                      uint16_t type, const Dictionary& payload, Error* error) override;
+                      uint16_t type, const Dictionary& payload, Error* error,
+                      const DeliveryReceiptPtr& receipt = nullptr) override;
 
   // AnalyticsSink: calls the builder on the caller's thread when the policy lets the event in.
   void SendEventLazy(const std::string& name, std::function<Dictionary()> buildPayload) override;
@@ -144,6 +145,9 @@ class BackendReportingService final : public TelvoroService,
 
   // Hands `record` to every back-end; the number that took it.
   size_t Deliver(ReportRecordPtr record);
+  // The receipt a record for every back-end carries: `receipt` itself for one back-end, else one
+  // that tells it once every back-end has settled.
+  DeliveryReceiptPtr JoinedReceipt(const DeliveryReceiptPtr& receipt) const;
   bool DeliverOrFail(ReportRecordPtr record, Error* error);
   void FlushAll(FlushCallback done);
   // Runs `work` on the service's thread.

@@ -315,6 +315,7 @@ bool SqliteStore::Append(ReportRecordPtr record) {
   const State state = state_.load(std::memory_order_acquire);
   if (state == State::kFailed || state == State::kClosed) {
     drops_.Dropped(1, state == State::kClosed ? "the store is shut down" : "the store is not up");
+    SettleRecord(*record, false, DropReason::kBackendDown);
     return false;
   }
   bool stopping = false;
@@ -332,9 +333,11 @@ bool SqliteStore::Append(ReportRecordPtr record) {
   // Counted outside the lock: the drop line must not hold up the writer.
   if (stopping) {
     drops_.Dropped(1, "the store is shut down");
+    SettleRecord(*record, false, DropReason::kBackendDown);
   } else {
     drops_.Dropped(1,
                    fmt::format("the store's queue is full ({} records)", options_.queueCapacity));
+    SettleRecord(*record, false, DropReason::kQueueFull);
   }
   return false;
 }
@@ -446,6 +449,9 @@ void SqliteStore::WriteBatch(std::deque<Queued>& batch) {
       CloseDatabase();
       rc = reopened;
     }
+  }
+  for (const Queued& queued : batch) {
+    SettleRecord(*queued.record, rc == SQLITE_OK, DropReason::kWriteFailed);
   }
   batch.clear();
   if (rc == SQLITE_OK) {
