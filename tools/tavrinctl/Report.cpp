@@ -177,7 +177,8 @@ std::vector<Band> OrientationBands(const ReportSession& session, const char* con
       double offset = 0;
       const auto [at, error] =
           std::from_chars(times[i].data(), times[i].data() + times[i].size(), offset);
-      if (error == std::errc() && at == times[i].data() + times[i].size()) {
+      if (error == std::errc() && at == times[i].data() + times[i].size() &&
+          std::isfinite(offset)) {
         changes.emplace_back(session.createdAt + offset, names[i]);
       }
     }
@@ -375,8 +376,9 @@ std::string RenderTimelineSvg(const ReportSession& session) {
           R"(<rect x="{:.1f}" y="{:.1f}" width="{:.1f}" height="{}" fill="{}"><title>{}</title></rect>)",
           x0, y + 1, x1 - x0, kRowHeight - 2, kPalette[colour % std::size(kPalette)],
           Escape(band.name));
-      if (x1 - x0 > 7.0 * double(band.name.size()))
+      if (x1 - x0 > 7.0 * double(band.name.size())) {
         body += TextAt(x0 + 3, y + 13, Escape(band.name));
+      }
     }
     y += kRowHeight;
   }
@@ -390,8 +392,9 @@ std::string RenderTimelineSvg(const ReportSession& session) {
     const std::vector<size_t> picked = EvenPick(times.size());
     body += TextAt(4, y + 13, Label(name));
     body += R"(<path class="marks" stroke="#1f5fa8" d=")";
-    for (const size_t i : picked)
+    for (const size_t i : picked) {
       body += fmt::format("M{:.1f} {:.0f}v{:.0f}", axis.X(times[i]), y + 3, kRowHeight - 6);
+    }
     body += "\"/>";
     if (picked.size() < times.size()) {
       notes.push_back(name + ": " + ThinNote(picked.size(), times.size(), "marks") +
@@ -447,12 +450,15 @@ std::string RenderReportHtml(const ReportSession& session) {
 
 CLI::App* AddReportCommand(CLI::App& app, ReportOptions& options) {
   CLI::App* report = app.add_subcommand("report", "write one session of the store as an HTML page");
-  CLI::Option* row = report->add_option("--row", options.row, "the session of this store row");
+  CLI::Option* row =
+      report->add_option("--row", options.row, "the session of this store row")->type_name("N");
   report->add_option("--reporter,-r", options.reporter, "the latest session of this reporter ID")
+      ->type_name("ID")
       ->excludes(row);
   report
       ->add_option("--at", options.at,
-                   "the session open at this time: seconds since the epoch, or how long ago")
+                   "the session open then: seconds since the epoch, or how long ago (10m)")
+      ->type_name("WHEN")
       ->excludes(row);
   report->add_option("--output,-o", options.output, "write here, not to stdout")->type_name("PATH");
   report->add_flag("--svg", options.svg, "only the timeline, as a standalone SVG");
