@@ -164,8 +164,8 @@ owned() { # owned MODE UID GID PATH
 for entry in "750 $uid $gid var/lib/tavrin" "750 $uid $gid var/log/tavrin" \
   "750 $uid $gid var/log/tavrin/DiagnosticLogs/Audio/Reporting" "755 $uid $gid run/tavrin" \
   "775 0 $gid run/tavrin/driverstats"; do
-  set -- $entry
-  check "directory /$4 mode $1 owner $2:$3" owned "$1" "$2" "$3" "$root/$4"
+  read -r mode owner group dir <<<"$entry"
+  check "directory /$dir mode $mode owner $owner:$group" owned "$mode" "$owner" "$group" "$root/$dir"
 done
 
 if command -v systemd-analyze >/dev/null; then
@@ -217,7 +217,7 @@ if [ "$status" -eq 0 ]; then pass "installed tavrind exits 0 on SIGTERM"; else
 fi
 
 echo
-ls -l "$build"/packages/*.deb | awk '{ print "      " $5 "  " $9 }'
+stat -c '      %s  %n' "${debs[@]}"
 if [ "$failures" -eq 0 ]; then
   echo "build-packages: all checks passed"
 else
