@@ -203,7 +203,10 @@ int main(int argc, char** argv) {
   using tavrin::pwexport::CounterWriter;
   CLI::App app{"tavrin-pw-exporter: PipeWire profiler counters for tavrind's driver statistics"};
   std::string root = "/run/tavrin/driverstats";
-  std::string group = "PipeWire";
+  // A group tavrind subscribes to (its driver table: QuorvexAE2MCA, Speaker, */MCA,
+  // Haptics/Stats): nodes are subgroups, and (Speaker, any subgroup) takes them all, so the
+  // counters reach a session's stop message without any set-up.
+  std::string group = "Speaker";
   std::string remote;
   int intervalMs = 1000;
   app.add_option("--root", root, "the counters tree to write")->envname("TAVRIN_DRIVER_STATS_ROOT");

@@ -11,6 +11,7 @@
 #include "Defaults.h"
 #include "Operations.h"
 #include "Record.h"
+#include "Report.h"
 #include "Shell.h"
 #include "Store.h"
 #include "Summaries.h"
@@ -72,6 +73,8 @@ int main(int argc, char** argv) {
   CLI::App* events = AddEventsCommand(app, eventsOptions);
   SummariesOptions summariesOptions;
   CLI::App* summaries = AddSummariesCommand(app, summariesOptions);
+  ReportOptions reportOptions;
+  CLI::App* report = AddReportCommand(app, reportOptions);
 
   try {
     app.parse(argc, argv);
@@ -100,6 +103,7 @@ int main(int argc, char** argv) {
   if (defaults->parsed()) return RunDefaults(*defaults, defaultsOptions, context);
   if (events->parsed()) return RunEvents(eventsOptions, context);
   if (summaries->parsed()) return RunSummaries(*summaries, summariesOptions, context);
+  if (report->parsed()) return RunReport(reportOptions, context);
   if (operations.Selected()) {
     if (const int status = operations.Prepare(); status != kExitOk) return status;
     auto opened = Connection::Open(context);

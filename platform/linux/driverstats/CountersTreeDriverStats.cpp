@@ -66,6 +66,31 @@ bool IsInside(const std::string& canonicalRoot, const std::string& resolved) {
          resolved[canonicalRoot.size()] == '/';
 }
 
+// A name that cannot be a tree entry matches nothing (and must not be looked up: "..").
+bool NamePossible(const std::optional<std::string>& name) { return !name || IsTreeName(*name); }
+
+bool CanMatch(const std::optional<std::string>& group, const std::optional<std::string>& subgroup) {
+  return NamePossible(group) && NamePossible(subgroup);
+}
+
+// The query of a pending channel description, when it is one: (group, subgroup), each a string
+// or null.
+std::optional<std::pair<std::optional<std::string>, std::optional<std::string>>> PendingQuery(
+    const Value& channels) {
+  if (!channels.is_object()) return std::nullopt;
+  const auto it = channels.find("pending");
+  if (it == channels.end() || !it->is_object()) return std::nullopt;
+  std::optional<std::string> names[2];
+  int i = 0;
+  for (const char* key : {"group", "subgroup"}) {
+    const auto name = it->find(key);
+    if (name == it->end() || !(name->is_null() || name->is_string())) return std::nullopt;
+    if (name->is_string()) names[i] = name->get<std::string>();
+    ++i;
+  }
+  return std::pair{names[0], names[1]};
+}
+
 // The value of one sample entry, when it is a signed 64-bit integer.
 std::optional<int64_t> EntryValue(const Value& entry) {
   const auto it = entry.find("value");
@@ -267,64 +292,72 @@ void CountersTreeDriverStats::ListGroup(Listing& listing, const std::string& gro
   }
 }
 
-std::optional<DriverChannels> CountersTreeDriverStats::CopyChannelsInGroup(
-    const std::optional<std::string>& group, const std::optional<std::string>& subgroup,
-    uint64_t options, OptionalError* error) {
-  Listing listing;
+bool CountersTreeDriverStats::List(Listing& listing, const std::optional<std::string>& group,
+                                   const std::optional<std::string>& subgroup,
+                                   OptionalError* error) const {
   struct stat info {};
   auto canonical = CanonicalPath(root_);
   if (!canonical || ::stat(canonical->c_str(), &info) != 0) {
     const int code = errno;
     SetError(error, code, "counters tree " + root_ + ": " + ErrnoText(code));
-    return std::nullopt;
+    return false;
   }
   if (!S_ISDIR(info.st_mode)) {
     SetError(error, ENOTDIR, "counters tree " + root_ + ": " + ErrnoText(ENOTDIR));
-    return std::nullopt;
+    return false;
   }
   listing.canonicalRoot = *canonical;
-
-  // A name that cannot be a tree entry matches nothing (and must not be looked up: "..").
-  const bool groupPossible = !group || IsTreeName(*group);
-  const bool subgroupPossible = !subgroup || IsTreeName(*subgroup);
-  if (groupPossible && subgroupPossible) {
-    if (group) {
-      // Only a directory inside the root is a group; anything else means "no such group".
-      const auto resolved = ResolveInside(listing.canonicalRoot, *group);
-      if (resolved && ::stat(resolved->c_str(), &info) == 0 && S_ISDIR(info.st_mode)) {
-        ListGroup(listing, *group, subgroup);
-      }
-    } else {
-      std::vector<TreeEntry> groups;
-      uint64_t ignored = 0;
-      std::vector<std::string> linksOut;
-      if (!ReadTreeDirectory(listing.canonicalRoot, "", &groups, &ignored, &linksOut)) {
-        const int code = errno;
-        SetError(error, code, "counters tree " + root_ + ": " + ErrnoText(code));
-        return std::nullopt;
-      }
-      for (const auto& link : linksOut) {
-        TLOG_DEFAULT(log_, "ignoring {}/{}: the link leads out of the counters tree", root_, link);
-      }
-      for (const auto& entry : groups) {
-        if (entry.kind != EntryKind::kDirectory) {
-          ++ignored;  // a file directly under the root belongs to no group
-          continue;
-        }
-        ListGroup(listing, entry.name, subgroup);
-        if (listing.truncated) break;
-      }
-      ignoredEntries_ += ignored;
+  if (!CanMatch(group, subgroup)) return true;
+  if (group) {
+    // Only a directory inside the root is a group; anything else means "no such group".
+    const auto resolved = ResolveInside(listing.canonicalRoot, *group);
+    if (resolved && ::stat(resolved->c_str(), &info) == 0 && S_ISDIR(info.st_mode)) {
+      ListGroup(listing, *group, subgroup);
     }
+    return true;
   }
+  std::vector<TreeEntry> groups;
+  uint64_t ignored = 0;
+  std::vector<std::string> linksOut;
+  if (!ReadTreeDirectory(listing.canonicalRoot, "", &groups, &ignored, &linksOut)) {
+    const int code = errno;
+    SetError(error, code, "counters tree " + root_ + ": " + ErrnoText(code));
+    return false;
+  }
+  for (const auto& link : linksOut) {
+    TLOG_DEFAULT(log_, "ignoring {}/{}: the link leads out of the counters tree", root_, link);
+  }
+  for (const auto& entry : groups) {
+    if (entry.kind != EntryKind::kDirectory) {
+      ++ignored;  // a file directly under the root belongs to no group
+      continue;
+    }
+    ListGroup(listing, entry.name, subgroup);
+    if (listing.truncated) break;
+  }
+  ignoredEntries_ += ignored;
+  return true;
+}
 
+std::optional<DriverChannels> CountersTreeDriverStats::CopyChannelsInGroup(
+    const std::optional<std::string>& group, const std::optional<std::string>& subgroup,
+    uint64_t options, OptionalError* error) {
+  Listing listing;
+  OptionalError rootError;
+  const bool listed = List(listing, group, subgroup, &rootError);
   if (listing.truncated) {
     ++truncatedQueries_;
     TLOG_ERROR(log_, "channels of {}-{} in {}: only the first {} are used",
                group.value_or("(null)"), subgroup.value_or("(null)"), root_, kMaxChannelsPerQuery);
   }
-  if (listing.firstError && error != nullptr) *error = listing.firstError;
+  if (error != nullptr) *error = listed ? listing.firstError : rootError;
   DriverChannels result = MakeDictionary();
+  // Nothing there yet (no tree, or no such group): the drivers or the exporter may start after
+  // the service, so the query itself is kept and run again whenever it is sampled.
+  if (listing.channels.empty() && CanMatch(group, subgroup)) {
+    result["pending"] = Value{{"group", group ? Value(*group) : Value(nullptr)},
+                              {"subgroup", subgroup ? Value(*subgroup) : Value(nullptr)}};
+  }
   result["channels"] = std::move(listing.channels);
   return result;
 }
@@ -332,6 +365,8 @@ std::optional<DriverChannels> CountersTreeDriverStats::CopyChannelsInGroup(
 int32_t CountersTreeDriverStats::ChannelCount(const DriverChannels& channels) {
   const Value* list = ArrayOf(channels, "channels");
   if (list == nullptr) return 0;
+  // A pending query stands for the channels it will find: worth a subscription.
+  if (list->empty() && PendingQuery(channels)) return 1;
   return int32_t(std::min<size_t>(list->size(), INT32_MAX));
 }
 
@@ -354,7 +389,10 @@ DriverSubscription CountersTreeDriverStats::CreateSubscription(const DriverChann
     }
     kept.push_back(entry);
   }
-  if (subscribed != nullptr) *subscribed = DriverChannels{{"channels", std::move(kept)}};
+  if (subscribed != nullptr) {
+    *subscribed = DriverChannels{{"channels", std::move(kept)}};
+    if (PendingQuery(channels)) (*subscribed)["pending"] = channels.at("pending");
+  }
   return nextSubscription_.fetch_add(1, std::memory_order_relaxed);
 }
 
@@ -421,7 +459,19 @@ std::optional<DriverSampleSet> CountersTreeDriverStats::CreateSamples(
     SetError(error, EINVAL, "subscribed channels are not a channel description");
     return std::nullopt;
   }
-  const auto canonical = CanonicalPath(root_);
+  std::optional<std::string> canonical;
+  Listing found;
+  if (const auto query = list->empty() ? PendingQuery(subscribed) : std::nullopt) {
+    // Looked for again on every sample, so a tree or group made after the subscription counts
+    // from then on; until then there is nothing to read, which is not an error.
+    OptionalError notYet;
+    if (!List(found, query->first, query->second, &notYet))
+      return DriverSampleSet{{"samples", Value::array()}};
+    canonical = found.canonicalRoot;
+    list = &found.channels;
+  } else {
+    canonical = CanonicalPath(root_);
+  }
   if (!canonical) {
     const int code = errno;
     SetError(error, code, "counters tree " + root_ + ": " + ErrnoText(code));

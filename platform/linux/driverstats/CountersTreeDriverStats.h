@@ -41,6 +41,15 @@ namespace tavrin {
 //   {"channels": [{"group": "G", "subgroup": "S" | null, "name": "N", "path": "G/S/N"}, ...]}
 // "path" is relative to the root and is what CreateSamples reads.
 //
+// Pending queries: a query that finds no channel (the root is missing, or nothing matches yet)
+// describes itself instead, {"channels": [], "pending": {"group": G | null, "subgroup": S | null}},
+// and ChannelCount counts it as one channel, so the caller subscribes to it. Every CreateSamples
+// of such a subscription runs the query again: drivers or the exporter that start after the
+// service are seen without a restart. While the root is still missing it samples nothing, without
+// an error. A query whose names cannot be tree names ("..") never matches and is not pending.
+// CopyChannelsInGroup still reports a root it cannot list as an error, with the pending
+// description.
+//
 // Sample set (DriverSampleSet) layout:
 //   {"samples": [{"name": "N", "path": "G/S/N", "value": 42}, ...]}
 // CreateSamplesDelta matches samples by "path" (by "name" when a sample has no path); a channel
@@ -48,7 +57,8 @@ namespace tavrin {
 // present only in the earlier set has no delta.
 //
 // Errors: Error{kDriverStatsErrorDomain, code, description}; codes are errno values:
-//   ENOENT / ENOTDIR / EACCES / ...  the root (or a directory below it) could not be listed;
+//   ENOENT / ENOTDIR / EACCES / ...  the root (or a directory below it) could not be listed (or,
+//               from CreateSamples of channels found earlier, the root has gone);
 //   EINVAL      a subscription handle this service did not issue, or a channel description or
 //               sample set that does not have the layout above.
 // A directory below the root that cannot be listed is skipped: CopyChannelsInGroup then returns
@@ -111,6 +121,9 @@ class CountersTreeDriverStats final : public DriverStatsService {
   // Resolves `rel` below the root; nullopt (and errno set) when it does not exist or leads out.
   std::optional<std::string> ResolveInside(const std::string& canonicalRoot,
                                            const std::string& rel) const;
+  // Lists (group, subgroup) into `listing`; false with *error set when the root cannot be listed.
+  bool List(Listing& listing, const std::optional<std::string>& group,
+            const std::optional<std::string>& subgroup, OptionalError* error) const;
   std::optional<int64_t> ReadChannel(const std::string& canonicalRoot, const std::string& rel,
                                      std::string* why) const;
 

@@ -354,15 +354,15 @@ TEST(PwExporterDaemonTest, ExportsDriverAndFollowerCountersFromALiveDaemon) {
                    logFile);
     ASSERT_TRUE(exporter.started());
     ASSERT_TRUE(Eventually([&] {
-      return Counter(tree, "PipeWire/Dummy-Driver/cycles") > 0 &&
-             Counter(tree, "PipeWire/test_sink/cycles") > 0 &&
-             Counter(tree, "PipeWire/test-source/cycles") > 0;
+      return Counter(tree, "Speaker/Dummy-Driver/cycles") > 0 &&
+             Counter(tree, "Speaker/test_sink/cycles") > 0 &&
+             Counter(tree, "Speaker/test-source/cycles") > 0;
     })) << ReadFile(logFile);
 
-    const int64_t before = Counter(tree, "PipeWire/Dummy-Driver/cycles");
-    EXPECT_TRUE(Eventually([&] { return Counter(tree, "PipeWire/Dummy-Driver/cycles") > before; }));
-    EXPECT_GE(Counter(tree, "PipeWire/Dummy-Driver/xruns"), 0);
-    EXPECT_GE(Counter(tree, "PipeWire/test_sink/busy_ns_total"), 0);
+    const int64_t before = Counter(tree, "Speaker/Dummy-Driver/cycles");
+    EXPECT_TRUE(Eventually([&] { return Counter(tree, "Speaker/Dummy-Driver/cycles") > before; }));
+    EXPECT_GE(Counter(tree, "Speaker/Dummy-Driver/xruns"), 0);
+    EXPECT_GE(Counter(tree, "Speaker/test_sink/busy_ns_total"), 0);
 
     exporter.Signal(SIGTERM);
     EXPECT_EQ(exporter.Wait(), 0) << ReadFile(logFile);

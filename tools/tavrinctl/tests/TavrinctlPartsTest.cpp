@@ -7,11 +7,15 @@
 #include <stdlib.h>
 #include <utime.h>
 
+#include <algorithm>
 #include <filesystem>
 #include <fstream>
 
+#include <fmt/format.h>
+
 #include "Common.h"
 #include "Defaults.h"
+#include "Report.h"
 #include "Shell.h"
 #include "Store.h"
 #include "Summaries.h"
@@ -299,6 +303,123 @@ TEST_F(TavrinctlStoreTest, QueriesThatCannotBeAnsweredSayWhy) {
   EXPECT_NE(answer.error.find("no store at"), std::string::npos) << answer.error;
   // Reading never creates the file.
   EXPECT_FALSE(std::filesystem::exists(directory_.path("missing.db")));
+}
+
+TEST_F(TavrinctlStoreTest, AReportOfAStoreWithoutTheRecoveredColumnCallsNothingRecovered) {
+  const SessionAnswer answer = LoadReportSession(path_, SessionPick{1, {}, {}});
+  ASSERT_EQ(answer.status, kExitOk) << answer.error;
+  EXPECT_FALSE(answer.session.recovered);
+  EXPECT_EQ(answer.session.serviceName, "generic");  // from session_info when user_info lacks it
+}
+
+// Reporter 7: a stopped, recovered session with lanes past and under the cap, its counter deltas
+// and summary; then a session still open.
+class TavrinctlReportTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    std::string sql =
+        "BEGIN; CREATE TABLE sessions(row INTEGER PRIMARY KEY, reporter_id INTEGER, session_info "
+        "TEXT, user_info TEXT, created_at REAL, flushed_at REAL, recovered INTEGER);"
+        "CREATE TABLE session_messages(row INTEGER PRIMARY KEY, session_row INTEGER, "
+        "reporter_id INTEGER, category INTEGER, type INTEGER, payload TEXT, received_at REAL);"
+        "INSERT INTO sessions VALUES(1, 7, '{}', '{\"ServiceName\":\"a_session\"}', 1000, 1100, 1);"
+        "INSERT INTO sessions VALUES(2, 7, '{}', '{}', 2000, NULL, 0);";
+    auto message = [&](int session, int category, int type, std::string_view payload, double at) {
+      sql += fmt::format(
+          "INSERT INTO session_messages(session_row, reporter_id, category, type, payload, "
+          "received_at) VALUES({}, 7, {}, {}, '{}', {});",
+          session, category, type, payload, at);
+    };
+    for (int i = 0; i < 2500; ++i)
+      message(1, 1, 0, fmt::format(R"({{"level":{}}})", i % 7), 1000 + i * 0.01);
+    for (int i = 0; i < 900; ++i) message(1, 7, 2, R"({"<script>":1})", 1050 + i * 0.01);
+    message(1, 9, 0, R"({"Speaker_xruns":4,"MCA_underruns":12})", 1099);
+    message(1, 65535, 65535,
+            R"({"Ruvo_Session_Summary_Event":"2","device_orientation":"portrait,face-up",)"
+            R"("device_orientation_time":"2,50"})",
+            1099.5);
+    message(2, 1, 0, R"({"level":1})", 2001);
+    sqlite3* db = nullptr;
+    ASSERT_EQ(sqlite3_open(directory_.path("tavrin.db").c_str(), &db), SQLITE_OK);
+    EXPECT_EQ(sqlite3_exec(db, (sql + "COMMIT;").c_str(), nullptr, nullptr, nullptr), SQLITE_OK);
+    sqlite3_close(db);
+  }
+
+  ReportSession Session(int64_t row) {
+    SessionAnswer answer =
+        LoadReportSession(directory_.path("tavrin.db"), SessionPick{row, {}, {}});
+    EXPECT_EQ(answer.status, kExitOk) << answer.error;
+    return answer.session;
+  }
+
+  TempCountersTree directory_;
+};
+
+TEST_F(TavrinctlReportTest, SessionsArePickedByRowByTheLatestOfAReporterOrByTheTimeTheyCover) {
+  const std::pair<SessionPick, int64_t> picks[] = {
+      // 0: no such session
+      {{1, {}, {}}, 1},    {{{}, 7, {}}, 2},
+      {{{}, 7, 1050}, 1},  {{{}, 7, 9e9}, 2},  // not flushed: still open
+      {{{}, {}, 1100}, 1}, {{{}, 7, 1500}, 0},
+      {{3, {}, {}}, 0},    {{{}, 8, {}}, 0},
+  };
+  for (const auto& [pick, row] : picks) {
+    const SessionAnswer answer = LoadReportSession(directory_.path("tavrin.db"), pick);
+    EXPECT_EQ(answer.status, row ? kExitOk : kExitFailed) << row << answer.error;
+    if (row) {
+      EXPECT_EQ(answer.session.row, row);
+    }
+  }
+  const ReportSession first = Session(1);
+  EXPECT_TRUE(first.recovered);
+  EXPECT_EQ(first.serviceName, "a_session");
+  EXPECT_EQ(first.messages.size(), 3402u);
+  EXPECT_EQ(Session(2).messages.size(), 1u);
+  EXPECT_EQ(LoadReportSession(directory_.path("none.db"), SessionPick{1, {}, {}}).status,
+            kExitFailed);
+}
+
+TEST_F(TavrinctlReportTest, TheTimelineMarksEveryMessageUpToTheCapAndSaysWhatItLeftOut) {
+  const std::string svg = RenderTimelineSvg(Session(1));
+  std::vector<size_t> marks;  // per lane, in (category, type) order
+  for (size_t at = 0; (at = svg.find(R"(class="marks" stroke="#1f5fa8" d=")", at)) != svg.npos;) {
+    const size_t end = svg.find('"', at + 34);
+    marks.push_back(size_t(std::count(svg.begin() + at, svg.begin() + end, 'M')));
+    at = end;
+  }
+  EXPECT_EQ(marks, (std::vector<size_t>{2000, 900, 1, 1}));
+  EXPECT_NE(svg.find("1/0 Generic · Generic: 2000 of 2500 marks shown"), svg.npos);
+  EXPECT_EQ(svg.find("of 900"), svg.npos);
+  for (const char* band : {"<title>portrait</title>", "<title>face-up</title>"}) {
+    EXPECT_NE(svg.find(band), svg.npos) << band;
+  }
+}
+
+TEST_F(TavrinctlReportTest, ThePageEscapesClientTextAndShowsPlotsDeltasAndTheSummary) {
+  const std::string html = RenderReportHtml(Session(1));
+  EXPECT_EQ(html.find("<script"), html.npos);
+  EXPECT_NE(html.find("&lt;script&gt;"), html.npos);
+  EXPECT_NE(html.find("2000 of 2500 points shown"), html.npos);
+  // Largest delta first.
+  EXPECT_LT(html.find("MCA_underruns"), html.find("Speaker_xruns"));
+  EXPECT_NE(html.find("<tr><td>Ruvo_Session_Summary_Event</td><td>2</td></tr>"), html.npos);
+  EXPECT_NE(html.find("<th>recovered</th><td>yes"), html.npos);
+}
+
+TEST_F(TavrinctlReportTest, TheCommandWritesTheFileOrExitsLikeTheOtherCommands) {
+  Context context;
+  context.paths.stateDir = directory_.root();
+  const std::string output = directory_.path("out.svg");
+  const std::pair<ReportOptions, int> runs[] = {
+      {{"1", "", "", output, true}, kExitOk},     {{"9", "", "", output, false}, kExitFailed},
+      {{"", "seven", "", "", false}, kExitUsage}, {{"", "", "later", "", false}, kExitUsage},
+      {{"", "", "", output, false}, kExitUsage},
+  };
+  for (const auto& [options, status] : runs) EXPECT_EQ(RunReport(options, context), status);
+  std::ifstream file(output);
+  EXPECT_EQ(std::string(std::istreambuf_iterator<char>(file), {}).rfind("<svg ", 0), 0u);
+  context.paths.stateDir = directory_.path("missing");
+  EXPECT_EQ(RunReport({"1", "", "", output, false}, context), kExitFailed);
 }
 
 TEST(TavrinctlSummariesTest, OnlyFinishedSummaryFilesAreListedOldestFirst) {

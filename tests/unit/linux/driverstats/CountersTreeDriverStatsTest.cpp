@@ -7,6 +7,7 @@
 
 #include <gtest/gtest.h>
 
+#include "Statistics/RuvoReportingDriverUtility.h"
 #include "tests/fakes/FakeLogSystem.h"
 #include "tests/support/TempCountersTree.h"
 
@@ -188,6 +189,47 @@ TEST_F(CountersTreeDriverStatsTest, DeltaMatchesByFileCountsNewChannelsFromZeroA
   EXPECT_EQ(log_.Count("does not fit 64 bits", LogLevel::kError), 1u);
   EXPECT_FALSE(service_.CreateSamplesDelta(nullptr, Value{{"x", 1}}, &error));
   EXPECT_EQ(error->code, EINVAL);
+}
+
+// Packaged, the service may start before the drivers or the exporter made the tree: a query that
+// found nothing is run again on each sample, so the tree is seen when it appears, without a restart
+// and without an error while it is missing.
+TEST_F(CountersTreeDriverStatsTest, AQueryThatFoundNothingSeesTheTreeWhenItAppears) {
+  tree_.remove("");
+  OptionalError error;
+  const auto channels = service_.CopyChannelsInGroup("Speaker", std::nullopt, 0, &error);
+  ASSERT_TRUE(channels && error);
+  EXPECT_EQ(error->code, ENOENT);
+  EXPECT_EQ(service_.ChannelCount(*channels), 1);
+  handle_ = service_.CreateSubscription(*channels, &subscribed_, 0);
+  error.reset();
+  EXPECT_EQ(Read(Samples(&error)), Values{});
+  EXPECT_FALSE(error);
+  tree_.write("Speaker/MCA/resets", 2);  // makes the root
+  tree_.write("Other/xruns", 9);         // not this query's group
+  EXPECT_EQ(Read(Samples()), (Values{{"resets", 2}}));
+  tree_.write("Speaker/xruns", 4);
+  EXPECT_EQ(Read(Samples()), (Values{{"resets", 2}, {"xruns", 4}}));
+  // A name that can never be in the tree is not worth looking for again.
+  EXPECT_EQ(service_.ChannelCount(*service_.CopyChannelsInGroup("..", {}, 0, &error)), 0);
+}
+
+// The same through the service's driver table, which subscribes once at start: a session that
+// starts after the tree appeared gets its counters.
+TEST_F(CountersTreeDriverStatsTest, TheDriverTableSubscribedBeforeTheTreeExistedReadsItLater) {
+  tree_.remove("");
+  RuvoReportingDriverUtility::ResetLogScopeForTesting();
+  RuvoReportingDriverUtility utility(service_);
+  EXPECT_EQ(utility.ioChannelSubscriptions().size(), 4u);
+  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(utility.getSnapShot()), std::nullopt);
+  tree_.write("Speaker/xruns", 5);
+  tree_.write("Haptics/Stats/kicks", 1);
+  const Dictionary start = utility.getSnapShot();
+  tree_.write("Speaker/xruns", 8);
+  tree_.write("Speaker/Amp/MCA/deep", 1);  // below a subgroup: never a channel
+  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(start),
+            (Dictionary{{"Speaker_xruns", 3}}));
+  RuvoReportingDriverUtility::ResetLogScopeForTesting();
 }
 
 }  // namespace
