@@ -49,6 +49,8 @@ void LedgerAccount::Dropped(DropReason reason) {
   ledger_.totals().Dropped(reason);
 }
 
+void LedgerAccount::Close() { ledger_.CloseAccount(this); }
+
 Dictionary LedgerAccount::ToDictionary() const {
   Dictionary entry = counts_.ToDictionary();
   entry["pid"] = pid_;
@@ -65,9 +67,9 @@ LedgerAccountPtr MessageLedger::OpenAccount(int32_t pid, uint32_t uid, std::stri
   return account;
 }
 
-void MessageLedger::CloseAccount(const LedgerAccountPtr& account) {
+void MessageLedger::CloseAccount(const LedgerAccount* account) {
   std::lock_guard lock(mutex_);
-  open_.remove(account);
+  open_.remove_if([account](const LedgerAccountPtr& open) { return open.get() == account; });
 }
 
 Dictionary MessageLedger::ToDictionary() const {

@@ -79,6 +79,8 @@ class LedgerAccount final : public DeliveryReceipt {
   void Received(uint64_t count = 1);
   void Delivered() override;
   void Dropped(DropReason reason) override;
+  // Takes the account off the ledger's list of clients (the client went away).
+  void Close();
   void SetSessions(uint64_t sessions) { sessions_.store(sessions); }
   uint64_t sessions() const { return sessions_.load(); }
   // The client's entry of the status: its counts, "pid", "uid", "name" and "sessions".
@@ -101,7 +103,7 @@ class MessageLedger {
  public:
   // A connected client's account, listed under "clients" until it is closed.
   LedgerAccountPtr OpenAccount(int32_t pid, uint32_t uid, std::string name);
-  void CloseAccount(const LedgerAccountPtr& account);
+  void CloseAccount(const LedgerAccount* account);
 
   MessageCounts& totals() { return totals_; }
   // {"totals": {...}, "clients": [...], "sessions": open sessions of connected clients}.

@@ -13,6 +13,7 @@ class DeviceInfoQuery;
 class Dispatcher;
 class DriverStatsService;
 class FileSystem;
+class MessageLedger;
 class NotificationCenter;
 class OrientationRegistry;
 class PowerEventLog;
@@ -43,6 +44,8 @@ struct PlatformServices {
   FileSystem* fileSystem = nullptr;
   NotificationCenter* notifications = nullptr;
   DefaultsDomain* defaults = nullptr;
+  // Accounts for every client message; null when nobody reads the counts (tests).
+  MessageLedger* ledger = nullptr;
   // Summary files go to "<diagnosticDirectory>/Audio/Reporting".
   std::string diagnosticDirectory = "/var/log/tavrin/DiagnosticLogs";
   // Started sessions spool what they gather here ("<state-dir>/spool").

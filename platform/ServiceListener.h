@@ -16,6 +16,7 @@ class ClientConnection {
  public:
   virtual ~ClientConnection() = default;
   virtual int32_t ProcessIdentifier() const = 0;
+  virtual uint32_t UserIdentifier() const = 0;
   virtual void SetExportedInterface(std::string_view interfaceName) = 0;
   virtual void SetExportedObject(std::shared_ptr<RuvoReportingServiceProtocol> object) = 0;
   virtual std::shared_ptr<RuvoReportingServiceProtocol> ExportedObject() const = 0;

@@ -183,6 +183,8 @@ Arguments ReadArguments(Op op, ArgumentReader& reader) {
       return GetAllReporters{};
     case Op::kKillService:
       return KillService{};
+    case Op::kStatus:
+      return GetStatus{};
   }
   return GetAllReporters{};  // not reached: the op was checked against the table
 }
@@ -222,7 +224,8 @@ Value ArgumentValues(const Arguments& arguments) {
           args.push_back(a.category);
           args.push_back(a.type);
           args.push_back(a.reporterIDs ? ReporterArray(*a.reporterIDs) : Value(nullptr));
-        } else if constexpr (std::is_same_v<T, GetAllReporters> || std::is_same_v<T, KillService>) {
+        } else if constexpr (std::is_same_v<T, GetAllReporters> || std::is_same_v<T, KillService> ||
+                             std::is_same_v<T, GetStatus>) {
           // no arguments
         } else {
           args.push_back(a.reporterID);

@@ -88,7 +88,7 @@ enum class Status : uint8_t {
   kRejected = 2,
 };
 
-// Typed arguments of the eleven operations; the alternative's index is the op number minus one.
+// Typed arguments of the twelve operations; the alternative's index is the op number minus one.
 struct CreateReportingSession {
   int64_t reporterID = 0;
   bool operator==(const CreateReportingSession&) const = default;
@@ -136,11 +136,14 @@ struct GetAllReporters {
 struct KillService {
   bool operator==(const KillService&) const = default;
 };
+struct GetStatus {
+  bool operator==(const GetStatus&) const = default;
+};
 
 using Arguments = std::variant<CreateReportingSession, SetServiceType, GetServiceNameForReporterID,
                                SetConfiguration, StartReportingSessionForID, SendMessage,
                                StopReportingSessionForID, DestroyReportingSession, ReporterIDValid,
-                               GetAllReporters, KillService>;
+                               GetAllReporters, KillService, GetStatus>;
 static_assert(std::variant_size_v<Arguments> == kLastOp, "one alternative per operation");
 
 struct Request {

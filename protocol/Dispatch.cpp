@@ -56,9 +56,16 @@ void Dispatch(Request request, RuvoReportingServiceProtocol& service, ReplySende
               call, send, [](uint64_t c, const std::vector<int64_t>& ids) {
                 return EncodeReportersReply(c, ids);
               }));
-        } else {
-          static_assert(std::is_same_v<T, KillService>);
+        } else if constexpr (std::is_same_v<T, KillService>) {
           service.killService(boolReply());
+        } else {
+          // The listener answers status with what it alone can read; a service reached any
+          // other way has none to give.
+          static_assert(std::is_same_v<T, GetStatus>);
+          if (call) {
+            send(EncodeOperationErrorReply(*call, kProtocolErrorDomain, 1,
+                                           "status is answered by the service's listener"));
+          }
         }
       },
       request.arguments);

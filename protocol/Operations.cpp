@@ -22,6 +22,7 @@ constexpr std::array<OperationInfo, kLastOp> kOperations{{
     {"reporterID:valid:", 1},
     {"getAllReporters:", 0},
     {"killService:", 0},
+    {"status", 0},
 }};
 
 const OperationInfo* Find(uint64_t op) {

@@ -19,10 +19,13 @@ enum class Op : uint8_t {
   kReporterIDValid = 9,
   kGetAllReporters = 10,
   kKillService = 11,
+  // The service's counts (uptime, memory, sessions, the message ledger); answered by the
+  // listener itself, so it answers even while the work queue is stuck.
+  kStatus = 12,
 };
 
 inline constexpr uint8_t kFirstOp = 1;
-inline constexpr uint8_t kLastOp = 11;
+inline constexpr uint8_t kLastOp = 12;
 
 // The operation's name as the remote interface spells it ("createReportingSession:reply:"), or
 // nothing for an unknown number.

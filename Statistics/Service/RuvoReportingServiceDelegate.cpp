@@ -1,5 +1,7 @@
 #include "Statistics/Service/RuvoReportingServiceDelegate.h"
 
+#include "platform/MessageLedger.h"
+
 #include <algorithm>
 #include <cmath>
 #include <cstdio>
@@ -207,8 +209,13 @@ bool RuvoReportingServiceDelegate::shouldAcceptNewConnection(
     std::lock_guard lock(delegateMutex_);
     connection->SetExportedInterface(kExportedInterfaceName);
     instance = RuvoReportingServerInstance::initWithPID(pid, weak_from_this(), platform_);
+    if (platform_.ledger != nullptr) {
+      instance->setAccount(platform_.ledger->OpenAccount(
+          pid, connection->UserIdentifier(), processNameForPID(pid).value_or(std::string())));
+    }
     connection->SetExportedObject(instance);
   }
+  LedgerAccountPtr account = instance->account();
   std::weak_ptr<RuvoReportingServerInstance> weakInstance = instance;
   instance.reset();
 
@@ -228,7 +235,9 @@ bool RuvoReportingServiceDelegate::shouldAcceptNewConnection(
     TLOG_DEFAULT(ServiceLog(), "InterruptionHandler: connection exited");
     if (ServerInstancePtr gone = weakInstance.lock()) gone->handleConnectionError();
   });
-  connection->SetInvalidationHandler([weakSelf, weakInstance, pid] {
+  connection->SetInvalidationHandler([weakSelf, weakInstance, pid, account] {
+    // The account leaves the clients list; its messages still in flight keep counting.
+    if (account) account->Close();
     if (auto self = weakSelf.lock()) self->reportClientUptime(weakInstance, pid);
   });
   connection->Resume();
@@ -383,6 +392,7 @@ void RuvoReportingServerInstance::createReportingSession(int64_t reporterID, Boo
     if (session) {
       // Replacing an entry releases the earlier session without stopping it.
       self.clientReportingSessionMap_[reporterID] = std::move(session);
+      if (self.account_) self.account_->SetSessions(self.clientReportingSessionMap_.size());
       TLOG_DEFAULT(RuvoReportingServiceDelegate::ServiceLog(), "session created for reporter {}",
                    reporterID);
     }
@@ -473,7 +483,17 @@ void RuvoReportingServerInstance::sendMessageOnQueue(
     const std::optional<std::vector<int64_t>>& reporterIDs, const ErrorReply& reply) {
   const LogHandle& log = RuvoReportingServiceDelegate::ServiceLog();
   auto delegate = delegate_.lock();
+  // Every path a message takes is counted as received, and then as delivered or dropped.
+  auto dropped = [this](DropReason reason) {
+    if (!account_) return;
+    account_->Received();
+    account_->Dropped(reason);
+  };
+  auto received = [this] {
+    if (account_) account_->Received();
+  };
   if (!delegate || !delegate->isReportingEnabled()) {
+    dropped(DropReason::kReportingDisabled);
     if (reply) reply(Error{"com.quorvex.audio.reporting", 1, "reporting is disabled"});
     return;
   }
@@ -481,10 +501,14 @@ void RuvoReportingServerInstance::sendMessageOnQueue(
     for (int64_t id : *reporterIDs) {
       if (id == 0) continue;
       RuvoReportingSessionPtr session = findReportingSessionForID(id, true);
-      if (!session) continue;
+      if (!session) {
+        dropped(DropReason::kNoSession);
+        continue;
+      }
       RuvoReportingStratikBridge::handleEvent(message, category, type, *session);
       RuvoReportingKelvaneUtility::handleEvent(message, category, type, *session);
-      session->sendMessage(message, category, type, nullptr);
+      received();
+      session->sendMessage(message, category, type, false, nullptr, account_);
     }
     if (reply) reply(std::nullopt);
     return;
@@ -503,16 +527,18 @@ void RuvoReportingServerInstance::sendMessageOnQueue(
   if (!running.empty()) {
     // The session's own send comes first on this road.
     for (const RuvoReportingSessionPtr& session : running) {
-      session->sendMessage(message, category, type, nullptr);
+      received();
+      session->sendMessage(message, category, type, false, nullptr, account_);
       RuvoReportingStratikBridge::handleEvent(message, category, type, *session);
       RuvoReportingKelvaneUtility::handleEvent(message, category, type, *session);
     }
   } else {
     TLOG_DEFAULT(log, "no active reporting sessions found, sending as standalone");
     const std::optional<Dictionary> defaults = delegate->getDefaults();
+    received();
     RuvoReportingSession::sendSingleMessage(platform_, message, category, type,
                                             service_type::kStandalone,
-                                            defaults ? *defaults : Dictionary(), nullptr);
+                                            defaults ? *defaults : Dictionary(), nullptr, account_);
   }
   if (reply) reply(std::nullopt);
 }
@@ -566,6 +592,7 @@ void RuvoReportingServerInstance::destroyReportingSession(int64_t reporterID, Bo
         RuvoReportingSessionPtr session = found->second;
         if (session->started()) session->stop();
         self.clientReportingSessionMap_.erase(found);
+        if (self.account_) self.account_->SetSessions(self.clientReportingSessionMap_.size());
       }
       TLOG_DEFAULT(RuvoReportingServiceDelegate::ServiceLog(), "destroying {}", reporterID);
     }

@@ -16,6 +16,7 @@
 #include "platform/Clock.h"
 #include "platform/Dispatcher.h"
 #include "platform/LogSystem.h"
+#include "platform/MessageLedger.h"
 #include "platform/Platform.h"
 #include "platform/ServiceListener.h"
 #include "protocol/RuvoReportingServiceProtocol.h"
@@ -150,6 +151,10 @@ class RuvoReportingServerInstance final
   void setClientProcessName(std::optional<std::string> name);
   // Work queue only.
   const SessionMap& clientReportingSessionMap() const { return clientReportingSessionMap_; }
+  // The client's account in the message ledger, set once before the first request; null
+  // without a ledger.
+  void setAccount(LedgerAccountPtr account) { account_ = std::move(account); }
+  const LedgerAccountPtr& account() const { return account_; }
 
  private:
   RuvoReportingServerInstance(int32_t pid,
@@ -172,6 +177,7 @@ class RuvoReportingServerInstance final
   std::optional<WallTime> clientStartDate_;       // guarded by propertyMutex_
   std::optional<std::string> clientProcessName_;  // guarded by propertyMutex_
   SessionMap clientReportingSessionMap_;          // work queue only
+  LedgerAccountPtr account_;
 };
 
 }  // namespace tavrin

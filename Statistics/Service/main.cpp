@@ -2,6 +2,7 @@
 // and runs the listener until SIGTERM or SIGINT, which flush the store and exit 0.
 
 #include <sys/stat.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <chrono>
@@ -23,6 +24,7 @@
 #include "Statistics/Service/ServiceWatchdog.h"
 #include "Statistics/Service/SessionSpool.h"
 #include "platform/LogSystem.h"
+#include "platform/MessageLedger.h"
 #include "platform/Platform.h"
 #include "platform/linux/dispatch/AsioDispatcher.h"
 #include "platform/linux/driverstats/CountersTreeDriverStats.h"
@@ -160,6 +162,16 @@ void ApplyListenerSettings(tavrin::UnixServiceListener& listener,
   listener.SetKillUids(std::move(settings.killUids));
 }
 
+// The process's resident memory, from /proc/self/statm; 0 when it cannot be read.
+uint64_t ResidentBytes() {
+  std::FILE* statm = std::fopen("/proc/self/statm", "r");
+  if (statm == nullptr) return 0;
+  unsigned long long size = 0, resident = 0;
+  const int read = std::fscanf(statm, "%llu %llu", &size, &resident);
+  std::fclose(statm);
+  return read == 2 ? resident * uint64_t(::sysconf(_SC_PAGESIZE)) : 0;
+}
+
 // Sessions that were open when the service last ended left their spools: their summaries are
 // sent now, before any new session spools beside them.
 void RecoverSpooledSessions(tavrin::PlatformServices& services) {
@@ -259,6 +271,9 @@ int main(int argc, char** argv) {
 
   BackendEnvironment environment;
   environment.stateDirectory = options.stateDir;
+  // Declared before the back-ends: records still in their queues carry the ledger's accounts.
+  MessageLedger ledger;
+  const auto startedAt = std::chrono::steady_clock::now();
   BackendReportingService reporting(CreateBackends(*choices, environment), SystemClock(),
                                     SystemRandom());
   reporting.ApplyDefaults(defaults.Read());
@@ -277,6 +292,7 @@ int main(int argc, char** argv) {
   services.fileSystem = &fileSystem;
   services.notifications = &notifications;
   services.defaults = &defaults;
+  services.ledger = &ledger;
   services.diagnosticDirectory = options.diagnosticDir;
   services.spoolDirectory = options.stateDir + "/spool";
   services.spoolBytesPerSession = startSettings.spoolBytesPerSession;
@@ -301,6 +317,16 @@ int main(int argc, char** argv) {
   }
   // Clients that send faster than the store commits are slowed down through their sockets rather
   // than have their records dropped.
+  listener.SetStatusProvider([&] {
+    Dictionary status = ledger.ToDictionary();
+    status["uptime_s"] =
+        std::chrono::duration<double>(std::chrono::steady_clock::now() - startedAt).count();
+    status["rss_bytes"] = ResidentBytes();
+    status["store_backlog"] = reporting.Backlog();
+    status["queued_work_items"] = dispatcher.QueuedItems() + dispatcher.DeferredCount();
+    status["refusals"] = listener.RefusalsByLimit();
+    return status;
+  });
   listener.SetReadGate([&] {
     // Single messages held back on a timer are owed to their clients as much as queued work.
     const uint64_t queued = dispatcher.QueuedItems() + dispatcher.DeferredCount();

@@ -16,6 +16,7 @@ class FakeClientConnection final : public ClientConnection {
   explicit FakeClientConnection(int32_t pid) : pid_(pid) {}
 
   int32_t ProcessIdentifier() const override { return pid_; }
+  uint32_t UserIdentifier() const override { return 0; }
   void SetExportedInterface(std::string_view name) override { interface_ = std::string(name); }
   void SetExportedObject(std::shared_ptr<RuvoReportingServiceProtocol> object) override {
     object_ = std::move(object);

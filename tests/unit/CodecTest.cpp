@@ -203,7 +203,7 @@ std::vector<RejectCase> RejectCases() {
   return {
       // 1: op not an integer from 1 to 11
       {"op 0", RequestBytes(0, Pack().uint(0), {}), RejectCode::kUnknownOp},
-      {"op 12", RequestBytes(0, Pack().uint(12), {}), RejectCode::kUnknownOp},
+      {"op 13", RequestBytes(0, Pack().uint(13), {}), RejectCode::kUnknownOp},
       {"op 2^64-1", RequestBytes(0, Pack().uint(kUint64Max), {}), RejectCode::kUnknownOp},
       {"op -1", RequestBytes(0, Pack().integer(IntFormat::kNegativeFixint, -1), {}),
        RejectCode::kUnknownOp},

@@ -156,6 +156,11 @@ BackendStats KafkaProducerBackend::Stats() const {
                       delivered_.load(std::memory_order_relaxed), drops_.Total()};
 }
 
+size_t KafkaProducerBackend::Backlog() const {
+  std::lock_guard lock(mutex_);
+  return outstanding_.size();
+}
+
 void KafkaProducerBackend::PollLoop() {
   pthread_setname_np(pthread_self(), "tavrin-kafka");
   for (;;) {

@@ -77,6 +77,10 @@ class KafkaProducerBackend final : public ReportingBackend {
   // After Shutdown the callback is called at once, with an error, on the caller's thread.
   void Flush(FlushCallback done) override;
   BackendStats Stats() const override;
+  // Records produced and not yet acknowledged: they count in the service's backlog, so the read
+  // gate slows clients down before the producer's queue refuses records.
+  size_t Backlog() const override;
+  size_t BacklogCapacity() const override { return size_t(options_.maxQueuedMessages); }
   void Shutdown() override;
 
   uint64_t DroppedRecords() const { return drops_.Total(); }

@@ -335,6 +335,12 @@ double BackendReportingService::BacklogShare() const {
   return share;
 }
 
+size_t BackendReportingService::Backlog() const {
+  size_t backlog = 0;
+  for (const auto& backend : backends_) backlog += backend->Backlog();
+  return backlog;
+}
+
 BackendList BackendReportingService::UpBackends() const {
   std::vector<std::string> names;
   for (const auto& backend : backends_) {

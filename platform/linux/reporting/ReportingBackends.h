@@ -132,6 +132,8 @@ class BackendReportingService final : public TelvoroService,
   bool Congested() const;
   // The fullest bounded back-end queue, as a share of its capacity (0 when none is bounded).
   double BacklogShare() const;
+  // Records handed to the back-ends and not yet committed or acknowledged, over all of them.
+  size_t Backlog() const;
 
   // What discovery lists now: the names of the back-ends that are up; nothing when none is.
   BackendList UpBackends() const;

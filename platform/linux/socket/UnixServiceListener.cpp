@@ -72,6 +72,7 @@ class UnixClientConnection final : public ClientConnection,
   }
 
   int32_t ProcessIdentifier() const override { return pid_; }
+  uint32_t UserIdentifier() const override { return uid_; }
   void SetExportedInterface(std::string_view name) override { interface_ = std::string(name); }
   void SetExportedObject(std::shared_ptr<RuvoReportingServiceProtocol> object) override {
     object_ = std::move(object);
@@ -228,6 +229,13 @@ class UnixClientConnection final : public ClientConnection,
         Send(protocol::EncodeOperationErrorReply(
             *request.call, protocol::kAccessErrorDomain, protocol::kKillNotAllowedCode,
             "killService is allowed only to root, the service's user and limits.kill_uids"));
+      }
+      return true;
+    }
+    if (std::holds_alternative<protocol::GetStatus>(request.arguments) &&
+        listener_.statusProvider_) {
+      if (request.call) {
+        Send(protocol::EncodeDictionaryReply(*request.call, listener_.statusProvider_()));
       }
       return true;
     }
@@ -555,6 +563,15 @@ std::string UnixServiceListener::RefusalCounts() const {
       RefusalsOver(LimitCode::kSessionsPerConnection),
       RefusalsOver(LimitCode::kReporterListTooLong), RefusalsOver(LimitCode::kEntriesPerFrame),
       RefusalsOver(LimitCode::kConnectionsPerUid), RefusalsOver(LimitCode::kReplyBacklog));
+}
+
+Dictionary UnixServiceListener::RefusalsByLimit() const {
+  using protocol::LimitCode;
+  return Dictionary{{"sessions_per_connection", RefusalsOver(LimitCode::kSessionsPerConnection)},
+                    {"reporter_ids_per_message", RefusalsOver(LimitCode::kReporterListTooLong)},
+                    {"entries_per_frame", RefusalsOver(LimitCode::kEntriesPerFrame)},
+                    {"connections_per_uid", RefusalsOver(LimitCode::kConnectionsPerUid)},
+                    {"reply_backlog", RefusalsOver(LimitCode::kReplyBacklog)}};
 }
 
 void UnixServiceListener::NoteRefusal(const std::string& why) {

@@ -81,6 +81,13 @@ class UnixServiceListener final : public ServiceListener {
   // its requests unread (its client sees the socket fill up and slows down) and asks again after
   // kReadGatePause. Set before Resume().
   void SetReadGate(std::function<ReadGate()> gate) { readGate_ = std::move(gate); }
+  // What op 12 (status) answers, called on the I/O thread: it must be cheap and must not wait
+  // for the work queue. Set before Resume(); without one, status is answered with an error.
+  void SetStatusProvider(std::function<Dictionary()> provider) {
+    statusProvider_ = std::move(provider);
+  }
+  // The refusal counts by limit, for the status.
+  Dictionary RefusalsByLimit() const;
   // How fast recent traffic fades from a connection's share: bytes of the last few seconds count.
   static constexpr double kTrafficMemorySeconds = 1.0;
   // Short enough to add little latency once the gate opens, long enough not to spin the thread.
@@ -149,6 +156,7 @@ class UnixServiceListener final : public ServiceListener {
 
   ServiceListenerDelegate* delegate_ = nullptr;
   std::function<ReadGate()> readGate_;
+  std::function<Dictionary()> statusProvider_;
   double recentTraffic_ = 0;  // I/O thread: decayed bytes of all connections
   std::chrono::steady_clock::time_point trafficStamp_{};
   std::atomic<uint64_t> readGateStalls_{0};
