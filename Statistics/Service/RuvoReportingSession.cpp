@@ -373,6 +373,7 @@ void RuvoReportingSession::stop() {
                         spool = std::move(spool), leading = std::move(leading), stoppedServiceType,
                         stoppedAt, hasSummary, summaryId = std::move(summaryId)] {
     TLOG_OPERATION("stop");
+    self->deliverSpooled();
     Value lastEntry;
     if (hasSummary) {
       if (std::optional<Dictionary> summary = texts->Summary(stoppedServiceType)) {
@@ -442,13 +443,35 @@ void RuvoReportingSession::sendMessage(const Dictionary& payload, uint32_t categ
   // reaches the spool before the back-ends, so whatever they commit a crash can recover.
   const bool startedAtSend = started();
   if (!startedAtSend) spool.reset();
+  queuedSends_.fetch_add(1);
   telvoroQueue_->Async([self = shared_from_this(), cleaned = std::move(cleaned),
                         received = std::move(received), messageId = std::move(messageId),
                         spool = std::move(spool), category, type, startedAtSend, receipt] {
-    if (spool) spool->AppendMessage(messageId, *cleaned);
-    self->deliver(cleaned, received, category, type, startedAtSend, receipt);
+    const bool lastQueued = self->queuedSends_.fetch_sub(1) == 1;
+    if (!spool) {
+      self->deliverSpooled();
+      self->deliver(cleaned, received, category, type, startedAtSend, receipt);
+      return;
+    }
+    // Spooled in bursts: a message is handed on only after its record is written, and a burst
+    // ends when the queue holds no more sends or the buffer is full.
+    spool->BufferMessage(messageId, *cleaned);
+    self->spooledDeliveries_.push_back(
+        SpooledDelivery{cleaned, received, category, type, receipt, spool});
+    if (lastQueued || spool->bufferedBytes() >= kSpoolBurstBytes) self->deliverSpooled();
   });
   if (reply) reply(std::nullopt);
+}
+
+void RuvoReportingSession::deliverSpooled() {
+  if (spooledDeliveries_.empty()) return;
+  std::vector<SpooledDelivery> burst;
+  burst.swap(spooledDeliveries_);
+  for (const SpooledDelivery& delivery : burst) delivery.spool->FlushMessages();
+  for (const SpooledDelivery& delivery : burst) {
+    deliver(delivery.cleaned, delivery.received, delivery.category, delivery.type,
+            /*startedAtSend=*/true, delivery.receipt);
+  }
 }
 
 void RuvoReportingSession::deliver(const PayloadPtr& cleaned, const PayloadPtr& received,

@@ -198,6 +198,19 @@ class RuvoReportingSession : public std::enable_shared_from_this<RuvoReportingSe
                                    uint16_t serviceType);
   // Ends the back-end wait; true when this call ended it (each wait ends exactly once).
   static bool EndBackendWait(const std::shared_ptr<BackendWait>& wait, bool found);
+  // A message spooled and waiting for the rest of its burst; telvoroQueue only.
+  struct SpooledDelivery {
+    PayloadPtr cleaned;
+    PayloadPtr received;
+    uint32_t category;
+    uint16_t type;
+    DeliveryReceiptPtr receipt;
+    std::shared_ptr<SessionSpool> spool;
+  };
+  // A burst of spooled messages is written in one piece up to this size.
+  static constexpr size_t kSpoolBurstBytes = 64 * 1024;
+  // Writes the waiting messages' records, then hands the messages on; telvoroQueue only.
+  void deliverSpooled();
   void deliver(const PayloadPtr& cleaned, const PayloadPtr& received, uint32_t category,
                uint16_t type, bool startedAtSend, const DeliveryReceiptPtr& receipt);
   void registerOrientationCallbacks();
@@ -214,7 +227,10 @@ class RuvoReportingSession : public std::enable_shared_from_this<RuvoReportingSe
   std::atomic<bool> started_{false};
   std::atomic<bool> telvoroSessionStarted_{false};
   std::atomic<uint16_t> serviceType_;
-  bool recovered_ = false;  // set before the session is shared
+  // Sends queued on telvoroQueue and not yet run.
+  std::atomic<size_t> queuedSends_{0};
+  std::vector<SpooledDelivery> spooledDeliveries_;  // telvoroQueue only
+  bool recovered_ = false;                          // set before the session is shared
 
   // Guards the properties below that are not atomics or lists. Never held while calling out.
   mutable std::mutex propertyMutex_;

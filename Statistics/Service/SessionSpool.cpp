@@ -56,11 +56,32 @@ void SessionSpool::AppendHeader(int64_t reporterID, uint16_t serviceType,
   Append(Value::array({"h", reporterID, serviceType, userInfo, messageTypeCounts}));
 }
 
-void SessionSpool::AppendMessage(const std::string& messageId, const Dictionary& payload) {
-  if (Append(Value::array({"m", messageId, payload}))) {
-    std::lock_guard lock(mutex_);
-    ++messageCount_;
-  }
+void SessionSpool::BufferMessage(const std::string& messageId, const Dictionary& payload) {
+  // The record ["m", id, payload] is encoded piece by piece: building it as one value would copy
+  // every payload.
+  constexpr char kThreeElementArray = char(0x93);
+  std::string bytes = LengthPrefix(0);
+  bytes.push_back(kThreeElementArray);
+  Value::to_msgpack(Value("m"), bytes);
+  Value::to_msgpack(Value(messageId), bytes);
+  Value::to_msgpack(payload, bytes);
+  bytes.replace(0, kLengthBytes, LengthPrefix(bytes.size() - kLengthBytes));
+  std::lock_guard lock(mutex_);
+  buffer_ += bytes;
+  ++bufferedMessages_;
+}
+
+size_t SessionSpool::bufferedBytes() const {
+  std::lock_guard lock(mutex_);
+  return buffer_.size();
+}
+
+void SessionSpool::FlushMessages() {
+  std::lock_guard lock(mutex_);
+  if (buffer_.empty()) return;
+  if (WriteLocked(buffer_)) messageCount_ += bufferedMessages_;
+  buffer_.clear();
+  bufferedMessages_ = 0;
 }
 
 void SessionSpool::AppendAggregated(const Dictionary& record) {
@@ -79,18 +100,28 @@ bool SessionSpool::AppendTextPiece(size_t keyIndex, std::string_view text) {
   return Append(Value::array({"k", keyIndex, std::string(text)}));
 }
 
-bool SessionSpool::Append(const Value& record) {
+std::string SessionSpool::Encode(const Value& record) {
   std::string bytes = LengthPrefix(0);
   Value::to_msgpack(record, bytes);
   const size_t length = bytes.size() - kLengthBytes;
   bytes.replace(0, kLengthBytes, LengthPrefix(length));
+  return bytes;
+}
 
+bool SessionSpool::Append(const Value& record) {
+  const std::string bytes = Encode(record);
   std::lock_guard lock(mutex_);
+  return WriteLocked(bytes);
+}
+
+bool SessionSpool::WriteLocked(std::string_view bytes) {
   if (failed_ || removed_) return false;
   OptionalError error;
   if (bytes_ + bytes.size() > byteLimit_) {
     error = Error{kGeneralErrorDomain, -1,
-                  fmt::format("the spool is full at {} bytes; later records are left out", bytes_)};
+                  fmt::format("the spool is full at {} bytes (limits.spool_bytes_per_session); "
+                              "later records are left out",
+                              bytes_)};
   } else if (!file_) {
     file_ = files_.OpenForAppend(path_, kFileMode, &error);
     opened_ = file_ != nullptr;

@@ -23,9 +23,9 @@ namespace tavrin {
 //
 // The file is a sequence of records, each a 4-byte little-endian length and a MessagePack array
 // whose first element names the record ("h" header, "m" message, "a" aggregated record,
-// "u" user info, "t" service type, "k" text piece). Every append is one write that reaches the
-// file before it returns, so a process that dies loses at most the record it was writing, and a
-// torn last record is ignored when reading. Thread-safe.
+// "u" user info, "t" service type, "k" text piece). Every append (or flush of buffered messages)
+// is one write that reaches the file before it returns, so a process that dies loses at most the
+// record it was writing, and a torn last record is ignored when reading. Thread-safe.
 class SessionSpool {
  public:
   // A session's spool stops growing at its limit (and says so once): its summary file then lacks
@@ -47,7 +47,11 @@ class SessionSpool {
 
   void AppendHeader(int64_t reporterID, uint16_t serviceType, const Dictionary& userInfo,
                     const Dictionary& messageTypeCounts);
-  void AppendMessage(const std::string& messageId, const Dictionary& payload);
+  // Messages are buffered and written in one piece by FlushMessages, so that a burst costs one
+  // write, not one per message; the session flushes before it hands the messages on.
+  void BufferMessage(const std::string& messageId, const Dictionary& payload);
+  size_t bufferedBytes() const;
+  void FlushMessages();
   void AppendAggregated(const Dictionary& record);
   void AppendUserInfo(const Dictionary& userInfo);
   void AppendServiceType(uint16_t serviceType);
@@ -65,7 +69,9 @@ class SessionSpool {
 
  private:
   SessionSpool(FileSystem& files, std::string directory, std::string path, uint64_t byteLimit);
+  static std::string Encode(const Value& record);
   bool Append(const Value& record);
+  bool WriteLocked(std::string_view bytes);
 
   FileSystem& files_;
   const std::string directory_;
@@ -76,6 +82,8 @@ class SessionSpool {
   std::unique_ptr<WritableFile> file_;  // guarded by mutex_; opened at the first append
   uint64_t bytes_ = 0;                  // guarded by mutex_
   uint64_t messageCount_ = 0;           // guarded by mutex_
+  std::string buffer_;                  // guarded by mutex_
+  uint64_t bufferedMessages_ = 0;       // guarded by mutex_
   bool failed_ = false;                 // guarded by mutex_; the first failure is logged
   bool opened_ = false;                 // guarded by mutex_
   bool removed_ = false;                // guarded by mutex_
