@@ -93,6 +93,12 @@ std::optional<Done> AnswerValue<Done>(const Value& value) {
   return Done{};
 }
 
+template <>
+std::optional<Dictionary> AnswerValue<Dictionary>(const Value& value) {
+  if (!value.is_object()) return std::nullopt;
+  return value;
+}
+
 template <typename T>
 Result<T> TypedResult(const protocol::Reply& reply) {
   if (reply.status != protocol::Status::kOk) return ServiceError(reply);
@@ -738,6 +744,15 @@ Result<std::vector<int64_t>> Client::getAllReporters(std::chrono::milliseconds t
       *impl_, timeout, [&](ReplyHandler<std::vector<int64_t>> reply) {
         return impl_->Call(protocol::GetAllReporters{}, 1, Typed(std::move(reply)));
       });
+}
+
+void Client::status(ReplyHandler<Dictionary> reply) {
+  impl_->Call(protocol::GetStatus{}, 1, Typed(std::move(reply)));
+}
+Result<Dictionary> Client::status(std::chrono::milliseconds timeout) {
+  return Blocking<Dictionary>(*impl_, timeout, [&](ReplyHandler<Dictionary> reply) {
+    return impl_->Call(protocol::GetStatus{}, 1, Typed(std::move(reply)));
+  });
 }
 
 void Client::killService(ReplyHandler<Done> reply) {

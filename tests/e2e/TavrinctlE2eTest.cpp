@@ -209,6 +209,13 @@ TEST(TavrinctlE2eTest, DisablingReportingInTheDefaultsMakesSendsFailUntilItIsDel
   const Outcome record = Sh(ctl + " --json record <<'EOF'\n{\"a\": 1}\nEOF\n");
   EXPECT_EQ(record.status, 1) << Describe(record);
   EXPECT_EQ(Json::parse(record.out, nullptr, false)["stopped"], true) << record.out;
+  // Every refusal is in the ledger that status shows, by its reason.
+  const Outcome status = Sh(ctl + " --json status");
+  ASSERT_EQ(status.status, 0) << Describe(status);
+  const Json totals = Json::parse(status.out)["status"]["totals"];
+  EXPECT_GE(totals["dropped"]["reporting_disabled"].get<int>(), 2) << status.out;
+  EXPECT_EQ(totals["in_flight"], 0) << status.out;
+  EXPECT_NE(Sh(ctl + " status").out.find("reporting_disabled"), std::string::npos);
 
   const Outcome removed = Sh(ctl + " --json defaults delete disable_reporting");
   ASSERT_EQ(removed.status, 0) << Describe(removed);

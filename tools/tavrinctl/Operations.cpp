@@ -1,8 +1,10 @@
 #include "Operations.h"
 
 #include <algorithm>
+#include <chrono>
 #include <cstdio>
 #include <filesystem>
+#include <thread>
 
 #include <fmt/format.h>
 
@@ -304,6 +306,11 @@ void OperationCommands::AddTo(CLI::App& app, bool oneShot) {
   add("reporters", "list the reporter IDs of every connection's sessions", Operation::kReporters);
   add("kill", "end the service process at once (exit status 2); sessions are not stopped",
       Operation::kKill);
+  auto* status = add("status",
+                     "the service's counts: every client's messages received, delivered, in "
+                     "flight and dropped by reason",
+                     Operation::kStatus);
+  status->add_flag("--watch,-w", watch_, "refresh once a second until interrupted");
 }
 
 bool OperationCommands::Selected() const {
@@ -321,7 +328,7 @@ int OperationCommands::Prepare() {
   std::string error;
 
   const bool needsReporter = operation != Operation::kSend && operation != Operation::kReporters &&
-                             operation != Operation::kKill;
+                             operation != Operation::kKill && operation != Operation::kStatus;
   if (needsReporter) {
     if (operation == Operation::kCreate && reporter_.empty()) {
       request.reporterID = client::NewReporterID();
@@ -508,6 +515,20 @@ int OperationCommands::Execute(const Request& request, Connection& connection,
       }
       return kExitOk;
     }
+    case Operation::kStatus: {
+      for (;;) {
+        auto answer = client.status(timeout);
+        if (!answer) return ReportError(answer.error(), context, "status");
+        if (context.json) {
+          PrintJsonLine({{"operation", "status"}, {"status", answer.value()}});
+        } else {
+          std::printf("%s%s", watch_ ? "\n" : "", StatusTable(answer.value()).c_str());
+        }
+        std::fflush(stdout);
+        if (!watch_) return kExitOk;
+        std::this_thread::sleep_for(std::chrono::seconds(1));
+      }
+    }
     case Operation::kKill: {
       auto answer = client.killService(timeout);
       if (!answer) return ReportError(answer.error(), context, "kill");
@@ -520,6 +541,52 @@ int OperationCommands::Execute(const Request& request, Connection& connection,
     }
   }
   return Fail(kExitUsage, "unknown operation");
+}
+
+std::string StatusTable(const client::Dictionary& status) {
+  auto count = [](const client::Dictionary& object, const char* key) -> uint64_t {
+    const auto found = object.find(key);
+    return found != object.end() && found->is_number_unsigned() ? found->get<uint64_t>() : 0;
+  };
+  auto row = [&](const std::string& who, const client::Dictionary& counts) {
+    std::string dropped;
+    uint64_t droppedTotal = 0;
+    if (const auto reasons = counts.find("dropped"); reasons != counts.end()) {
+      for (const auto& [reason, n] : reasons->items()) {
+        if (!n.is_number_unsigned()) continue;
+        droppedTotal += n.get<uint64_t>();
+        dropped += fmt::format("{}{} {}", dropped.empty() ? " (" : ", ", reason, n.get<uint64_t>());
+      }
+    }
+    if (!dropped.empty()) dropped += ")";
+    return fmt::format("{:<28} {:>10} {:>10} {:>10} {:>10}{}\n", who, count(counts, "received"),
+                       count(counts, "delivered"), count(counts, "in_flight"), droppedTotal,
+                       dropped);
+  };
+  const auto number = [&](const char* key) {
+    const auto found = status.find(key);
+    return found != status.end() && found->is_number() ? found->get<double>() : 0.0;
+  };
+  std::string text = fmt::format(
+      "up {:.0f} s, {:.1f} MiB resident, {} sessions, {} records waiting for the back-ends, {} "
+      "queued work items\n",
+      number("uptime_s"), number("rss_bytes") / (1024 * 1024), count(status, "sessions"),
+      count(status, "store_backlog"), count(status, "queued_work_items"));
+  text += fmt::format("{:<28} {:>10} {:>10} {:>10} {:>10}\n", "messages", "received", "delivered",
+                      "in flight", "dropped");
+  if (const auto totals = status.find("totals"); totals != status.end() && totals->is_object()) {
+    text += row("all clients", *totals);
+  }
+  if (const auto clients = status.find("clients"); clients != status.end() && clients->is_array()) {
+    for (const auto& client : *clients) {
+      if (!client.is_object()) continue;
+      const std::string name = client.value("name", std::string());
+      text += row(fmt::format("pid {} uid {} {}", client.value("pid", 0), client.value("uid", 0),
+                              name.empty() ? "?" : name),
+                  client);
+    }
+  }
+  return text;
 }
 
 }  // namespace tavrin::ctl

@@ -21,6 +21,11 @@
 
 namespace tavrin::ctl {
 
+// The answer of the status operation as a person reads it: one line of the service's counts,
+// then a table of messages (received, delivered, in flight, dropped by reason) in total and per
+// connected client.
+std::string StatusTable(const client::Dictionary& status);
+
 using Json = nlohmann::ordered_json;
 
 // One line of JSON on stdout. Invalid UTF-8 from the store or a file is replaced, not fatal.
@@ -97,7 +102,8 @@ class OperationCommands {
     kDestroy,
     kValid,
     kReporters,
-    kKill
+    kKill,
+    kStatus
   };
   // The chosen operation with its arguments checked and converted.
   struct Request {
@@ -116,6 +122,7 @@ class OperationCommands {
   std::string reporter_;
   std::string serviceType_;
   std::string json_;
+  bool watch_ = false;
   std::string category_ = "1";
   std::string type_ = "0";
   std::vector<std::string> to_;

@@ -189,6 +189,9 @@ class Client {
   // 10: the reporter IDs of every client's sessions.
   void getAllReporters(ReplyHandler<std::vector<int64_t>> reply);
   Result<std::vector<int64_t>> getAllReporters(std::chrono::milliseconds timeout = kDefaultTimeout);
+  // 12: the service's counts and its message ledger (the protocol document lists the keys).
+  void status(ReplyHandler<Dictionary> reply);
+  Result<Dictionary> status(std::chrono::milliseconds timeout = kDefaultTimeout);
   // 11: ends the service process (exit status 2). Answered once the connection has closed.
   void killService(ReplyHandler<Done> reply);
   Result<Done> killService(std::chrono::milliseconds timeout = kDefaultTimeout);

@@ -15,6 +15,7 @@
 
 #include "Common.h"
 #include "Defaults.h"
+#include "Operations.h"
 #include "Report.h"
 #include "Shell.h"
 #include "Store.h"
@@ -446,6 +447,27 @@ TEST(TavrinctlSummariesTest, OnlyFinishedSummaryFilesAreListedOldestFirst) {
 
   EXPECT_TRUE(ListSummaries(dir + "/none", &error).empty());
   EXPECT_TRUE(error.empty());
+}
+
+// Dropped messages show their total and each reason; a client without a name and keys of the
+// wrong type do not break the table.
+TEST(TavrinctlStatusTest, TheTableShowsTotalsClientsAndEveryDropReason) {
+  const auto status = client::Dictionary::parse(R"({
+    "uptime_s": 61.4, "rss_bytes": 15728640, "sessions": 2, "store_backlog": 7,
+    "totals": {"received": 84, "delivered": 71, "in_flight": 0,
+               "dropped": {"no_session": 2, "test_session": 10, "reporting_disabled": 1}},
+    "clients": [{"pid": 42, "uid": 1000, "name": "", "sessions": "two",
+                 "received": 64, "delivered": 51, "in_flight": 0, "dropped": {}}]})");
+  const std::string table = StatusTable(status);
+  EXPECT_NE(table.find("up 61 s, 15.0 MiB resident, 2 sessions, 7 records waiting"),
+            std::string::npos)
+      << table;
+  EXPECT_NE(table.find("71          0         13 (no_session 2, test_session 10, "
+                       "reporting_disabled 1)"),
+            std::string::npos)
+      << table;
+  EXPECT_NE(table.find("pid 42 uid 1000 ?"), std::string::npos) << table;
+  EXPECT_NE(table.find("51          0          0\n"), std::string::npos) << table;
 }
 
 }  // namespace
