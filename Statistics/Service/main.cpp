@@ -19,6 +19,7 @@
 
 #include <CLI/CLI.hpp>
 
+#include "Statistics/Service/MetricsText.h"
 #include "Statistics/Service/RuvoReportingServiceDelegate.h"
 #include "Statistics/Service/RuvoReportingSession.h"
 #include "Statistics/Service/ServiceWatchdog.h"
@@ -69,6 +70,7 @@ struct Options {
   std::string orientation = "none";
   std::vector<std::string> backends;
   std::string logTarget = "stderr";
+  std::string metricsFile;
 };
 
 // With --root, every path that was not given explicitly moves under the root.
@@ -162,6 +164,9 @@ void ApplyListenerSettings(tavrin::UnixServiceListener& listener,
   listener.SetKillUids(std::move(settings.killUids));
 }
 
+// How often --metrics-file is rewritten: well within a textfile collector's scrape interval.
+constexpr auto kMetricsInterval = std::chrono::seconds(5);
+
 // The process's resident memory, from /proc/self/statm; 0 when it cannot be read.
 uint64_t ResidentBytes() {
   std::FILE* statm = std::fopen("/proc/self/statm", "r");
@@ -208,6 +213,9 @@ int main(int argc, char** argv) {
   app.add_option("--orientation", options.orientation, "none, iio or feed:PATH");
   app.add_option("--backend", options.backends,
                  "sqlite, kafka:BOOTSTRAP[,topic-prefix=P] or none (repeatable)");
+  app.add_option("--metrics-file", options.metricsFile,
+                 "rewrite PATH every few seconds with the status counts as OpenMetrics text")
+      ->type_name("PATH");
   app.add_option("--log-target", options.logTarget, "stderr or journal")
       ->check(CLI::IsMember({"stderr", "journal"}));
   CLI11_PARSE(app, argc, argv);
@@ -317,7 +325,7 @@ int main(int argc, char** argv) {
   }
   // Clients that send faster than the store commits are slowed down through their sockets rather
   // than have their records dropped.
-  listener.SetStatusProvider([&] {
+  const auto serviceStatus = [&] {
     Dictionary status = ledger.ToDictionary();
     status["uptime_s"] =
         std::chrono::duration<double>(std::chrono::steady_clock::now() - startedAt).count();
@@ -326,7 +334,15 @@ int main(int argc, char** argv) {
     status["queued_work_items"] = dispatcher.QueuedItems() + dispatcher.DeferredCount();
     status["refusals"] = listener.RefusalsByLimit();
     return status;
-  });
+  };
+  listener.SetStatusProvider(serviceStatus);
+  const auto writeMetrics = [&] {
+    if (options.metricsFile.empty()) return;
+    if (OptionalError error =
+            fileSystem.WriteFileAtomically(options.metricsFile, MetricsText(serviceStatus()))) {
+      TLOG_ERROR(nullptr, "metrics file not written: {}", error->LocalizedDescription());
+    }
+  };
   listener.SetReadGate([&] {
     // Single messages held back on a timer are owed to their clients as much as queued work.
     const uint64_t queued = dispatcher.QueuedItems() + dispatcher.DeferredCount();
@@ -377,15 +393,28 @@ int main(int argc, char** argv) {
       } while (!watchdogWake.wait_for(lock, interval / 2, [&] { return stopping; }));
     });
   }
+  std::thread metricsThread;
+  if (!options.metricsFile.empty()) {
+    metricsThread = std::thread([&] {
+      pthread_setname_np(pthread_self(), "tavrin-metrics");
+      std::unique_lock lock(watchdogMutex);
+      do {
+        lock.unlock();
+        writeMetrics();
+        lock.lock();
+      } while (!watchdogWake.wait_for(lock, kMetricsInterval, [&] { return stopping; }));
+    });
+  }
   listener.Resume();
 
-  if (watchdogThread.joinable()) {
+  if (watchdogThread.joinable() || metricsThread.joinable()) {
     {
       std::lock_guard lock(watchdogMutex);
       stopping = true;
     }
     watchdogWake.notify_all();
-    watchdogThread.join();
+    if (watchdogThread.joinable()) watchdogThread.join();
+    if (metricsThread.joinable()) metricsThread.join();
   }
   systemd_notify::Status("stopping: sending held-back messages and committing the store");
   systemd_notify::ExtendTimeout(kShutdownDrainLimit + std::chrono::seconds(10));
@@ -402,6 +431,8 @@ int main(int argc, char** argv) {
   }
   dispatcher.Shutdown();
   reporting.Shutdown();
+  // The last counts, with everything committed.
+  writeMetrics();
   listener.SetDelegate(nullptr);
   delegate.reset();
   TLOG_DEFAULT(nullptr, "tavrind stopped; refusals by limit: {}", listener.RefusalCounts());

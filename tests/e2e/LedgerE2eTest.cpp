@@ -3,6 +3,8 @@
 
 #include <gtest/gtest.h>
 
+#include <fstream>
+#include <sstream>
 #include <string>
 #include <vector>
 
@@ -26,7 +28,9 @@ Value Status(TestClient& client) {
 // Each drop reason the core decides, a client that goes away with messages counted, and the
 // delivered count that the store confirms row for row.
 TEST(LedgerE2eTest, EveryMessageIsReceivedThenDeliveredOrDroppedByReason) {
-  TavrindProcess service;
+  const std::string root = testing::MakeTempDirectory("tavrin-e2e-");
+  const std::string metrics = root + "/metrics.prom";
+  TavrindProcess service({"--metrics-file", metrics}, root);
   ASSERT_TRUE(service.Start()) << service.Log();
   TestClient client(service.SocketPath());
   uint64_t call = 0;
@@ -90,6 +94,19 @@ TEST(LedgerE2eTest, EveryMessageIsReceivedThenDeliveredOrDroppedByReason) {
                                       "SELECT count(*) FROM session_messages WHERE category = 1"),
             std::vector<std::string>{"71"});
   EXPECT_EQ(service.Stop(), 0);
+
+  // The metrics file's last rewrite, at exit, holds the same counts in OpenMetrics text.
+  std::ifstream in(metrics);
+  std::stringstream text;
+  text << in.rdbuf();
+  const std::string lines = text.str();
+  for (const char* sample :
+       {"tavrin_messages_received_total 84\n", "tavrin_messages_delivered_total 71\n",
+        "tavrin_messages_dropped_total{reason=\"test_session\"} 10\n",
+        "# TYPE tavrin_messages_dropped counter\n"}) {
+    EXPECT_NE(lines.find(sample), std::string::npos) << sample << lines;
+  }
+  EXPECT_TRUE(lines.ends_with("# EOF\n")) << lines;
 }
 
 // Without a back-end nothing is delivered, and every message says why.
