@@ -16,8 +16,8 @@ packages=(
   libedit-dev libreaderwriterqueue-dev
   # private D-Bus daemon for the orientation tests; PipeWire for the counters exporter
   dbus-daemon libpipewire-0.3-dev pipewire
-  # systemd-analyze, which checks the packaged units
-  systemd
+  # systemd-analyze, which checks the packaged units; promtool, which checks the metrics file
+  systemd prometheus
 )
 
 missing=()

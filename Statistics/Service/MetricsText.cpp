@@ -92,12 +92,12 @@ std::string MetricsText(const Dictionary& status, size_t maxClients) {
   if (clients.size() > maxClients) series.push_back({"pid=\"0\",name=\"(other)\"", other});
   const Value totals = status.contains("totals") ? status["totals"] : Value::object();
 
-  out.Family("messages_received", "counter", "Client messages received, per path they took.");
+  out.Family("messages_received_total", "counter", "Client messages received, per path they took.");
   out.Sample("messages_received_total", "", Number(totals, "received"));
   for (const Series& s : series) {
     out.Sample("messages_received_total", s.labels, Number(s.counts, "received"));
   }
-  out.Family("messages_delivered", "counter",
+  out.Family("messages_delivered_total", "counter",
              "Client messages committed by the store or acknowledged by Kafka.");
   out.Sample("messages_delivered_total", "", Number(totals, "delivered"));
   for (const Series& s : series) {
@@ -105,7 +105,7 @@ std::string MetricsText(const Dictionary& status, size_t maxClients) {
   }
   out.Family("messages_in_flight", "gauge", "Client messages neither delivered nor dropped yet.");
   out.Sample("messages_in_flight", "", Number(totals, "in_flight"));
-  out.Family("messages_dropped", "counter", "Client messages dropped, by reason.");
+  out.Family("messages_dropped_total", "counter", "Client messages dropped, by reason.");
   auto dropped = [&](const Value& counts, const std::string& labels) {
     if (!counts.is_object() || !counts.contains("dropped")) return;
     for (const auto& [reason, n] : counts["dropped"].items()) {
@@ -117,7 +117,7 @@ std::string MetricsText(const Dictionary& status, size_t maxClients) {
   };
   dropped(totals, "");
   for (const Series& s : series) dropped(s.counts, s.labels);
-  out.Family("refusals", "counter", "Requests and connections refused, by limit.");
+  out.Family("refusals_total", "counter", "Requests and connections refused, by limit.");
   if (const auto refusals = status.find("refusals"); refusals != status.end()) {
     for (const auto& [limit, n] : refusals->items()) {
       if (n.is_number())
