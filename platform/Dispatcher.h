@@ -60,7 +60,8 @@ class Dispatcher {
   // for work that may be held back but must not be lost when the process stops.
   virtual void AsyncDeferred(WorkQueue& queue, Duration delay, Work work) = 0;
   // Hands every item still held back by AsyncDeferred to its queue now; returns how many. Each
-  // item runs once, whichever comes first.
+  // item runs once, whichever comes first. From then on AsyncDeferred holds nothing back: work
+  // still queued when the service stops may defer more, and that must not be lost either.
   virtual size_t RunDeferredNow() = 0;
   // Items of AsyncDeferred not yet handed to their queue.
   virtual size_t DeferredCount() const = 0;

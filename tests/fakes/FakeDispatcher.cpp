@@ -38,7 +38,8 @@ struct FakeDispatcher::State {
   std::map<FireKey, std::function<void()>> delayed;
   // AsyncDeferred items not handed over yet, in the order given.
   std::map<uint64_t, std::pair<WorkQueue*, Work>> deferred;
-  bool running = false;  // inside RunUntilIdle
+  bool deferredReleased = false;  // RunDeferredNow was called: nothing is held back any more
+  bool running = false;           // inside RunUntilIdle
   const FakeQueue* current = nullptr;
   std::thread::id currentThread;
 
@@ -235,10 +236,19 @@ std::unique_ptr<Timer> FakeDispatcher::CreateTimer(WorkQueue& queue, Work work) 
 void FakeDispatcher::AsyncDeferred(WorkQueue& queue, Duration delay, Work work) {
   if (!work) return;
   uint64_t id = 0;
+  bool held = false;
   {
     std::lock_guard lock(state_->mutex);
-    id = state_->nextSequence++;
-    state_->deferred.emplace(id, std::pair{&queue, std::move(work)});
+    if (!state_->deferredReleased) {
+      held = true;
+      id = state_->nextSequence++;
+      state_->deferred.emplace(id, std::pair{&queue, std::move(work)});
+    }
+  }
+  // Released already: nothing is held back any more.
+  if (!held) {
+    queue.Async(std::move(work));
+    return;
   }
   queue.AsyncAfter(delay, [state = std::weak_ptr(state_), id] {
     auto alive = state.lock();
@@ -260,6 +270,7 @@ size_t FakeDispatcher::RunDeferredNow() {
   {
     std::lock_guard lock(state_->mutex);
     due.swap(state_->deferred);
+    state_->deferredReleased = true;
   }
   for (auto& [id, item] : due) item.first->Async(std::move(item.second));
   return due.size();

@@ -484,10 +484,19 @@ void AsioDispatcher::Shutdown() { core_->Shutdown(); }
 void AsioDispatcher::AsyncDeferred(WorkQueue& queue, Duration delay, Work work) {
   if (!work) return;
   uint64_t id = 0;
+  bool held = false;
   {
     std::lock_guard lock(deferredMutex_);
-    id = nextDeferredId_++;
-    deferred_.emplace(id, std::pair{&queue, std::move(work)});
+    if (!deferredReleased_) {
+      held = true;
+      id = nextDeferredId_++;
+      deferred_.emplace(id, std::pair{&queue, std::move(work)});
+    }
+  }
+  // Released already: nothing is held back any more.
+  if (!held) {
+    queue.Async(std::move(work));
+    return;
   }
   // The dispatcher outlives its delayed items: Shutdown() in the destructor cancels them first.
   queue.AsyncAfter(delay, [this, id] {
@@ -508,6 +517,7 @@ size_t AsioDispatcher::RunDeferredNow() {
   {
     std::lock_guard lock(deferredMutex_);
     due.swap(deferred_);
+    deferredReleased_ = true;
   }
   for (auto& [id, item] : due) item.first->Async(std::move(item.second));
   return due.size();

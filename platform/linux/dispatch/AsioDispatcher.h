@@ -78,6 +78,7 @@ class AsioDispatcher final : public Dispatcher {
   mutable std::mutex deferredMutex_;
   std::unordered_map<uint64_t, std::pair<WorkQueue*, Work>> deferred_;  // guarded by deferredMutex_
   uint64_t nextDeferredId_ = 0;                                         // guarded by deferredMutex_
+  bool deferredReleased_ = false;                                       // guarded by deferredMutex_
 };
 
 }  // namespace tavrin

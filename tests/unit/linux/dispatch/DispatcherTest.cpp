@@ -179,6 +179,10 @@ TEST_P(DispatcherContractTest, DeferredWorkRunsAtItsDelayOrWhenAskedButOnce) {
   driver_->Pass(700ms);  // past their own expiry
   EXPECT_EQ(Seen().size(), 3u);
   EXPECT_EQ(dispatcher_.RunDeferredNow(), 0u);
+  // Once released, later deferred work is not held back (work queued at a stop defers more).
+  dispatcher_.AsyncDeferred(*queue, 10s, Note("late", queue));
+  EXPECT_EQ(dispatcher_.DeferredCount(), 0u);
+  ASSERT_TRUE(SeenCount(4));
 }
 
 // A re-armed timer forgets its earlier arming, a cancelled one fires no more, both can be armed
