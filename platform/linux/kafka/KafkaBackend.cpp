@@ -45,6 +45,9 @@ bool KafkaProducerBackend::Create() {
       // Small batches on the wire within a few milliseconds, as the store does.
       {"linger.ms", "5"},
       {"client.id", "tavrind"},
+      // Retries after a lost acknowledgement must not write a record twice or out of order: the
+      // ledger counts each message delivered once.
+      {"enable.idempotence", "true"},
   };
   settings.insert(settings.end(), options_.extraConfig.begin(), options_.extraConfig.end());
   for (const auto& [name, value] : settings) {
