@@ -892,11 +892,6 @@ std::shared_ptr<SessionSpool> RuvoReportingSession::spool() const {
   return spool_;
 }
 
-std::vector<Dictionary> RuvoReportingSession::leadingEntries() const {
-  std::lock_guard lock(propertyMutex_);
-  return leadingEntries_;
-}
-
 TelvoroSessionPtr RuvoReportingSession::telvoroSession() const {
   std::lock_guard lock(propertyMutex_);
   return telvoroSession_;

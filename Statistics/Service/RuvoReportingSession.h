@@ -169,10 +169,6 @@ class RuvoReportingSession : public std::enable_shared_from_this<RuvoReportingSe
   // stopped.
   std::shared_ptr<SummaryTexts> summaryTexts() const;
   std::shared_ptr<SessionSpool> spool() const;
-  // The user info entries that writeSummaryJson put first in the nested list, latest first.
-  std::vector<Dictionary> leadingEntries() const;
-  // Recovered sessions say so in their session info and in their summary file's name.
-  bool recovered() const { return recovered_; }
   TelvoroSessionPtr telvoroSession() const;
   TelvoroTokenPtr telvoroAgentToken() const;
   const SerialQueuePtr& telvoroQueue() const { return telvoroQueue_; }
@@ -230,7 +226,8 @@ class RuvoReportingSession : public std::enable_shared_from_this<RuvoReportingSe
   // Sends queued on telvoroQueue and not yet run.
   std::atomic<size_t> queuedSends_{0};
   std::vector<SpooledDelivery> spooledDeliveries_;  // telvoroQueue only
-  bool recovered_ = false;                          // set before the session is shared
+  // Recovered sessions say so in their session info and summary file name; set before sharing.
+  bool recovered_ = false;
 
   // Guards the properties below that are not atomics or lists. Never held while calling out.
   mutable std::mutex propertyMutex_;
