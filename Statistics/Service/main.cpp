@@ -105,6 +105,8 @@ struct ListenerSettings {
   uint64_t replyBytesPerConnection = tavrin::UnixListenerOptions{}.replyBytesPerConnection;
   uint64_t replyBytesTotal = tavrin::UnixListenerOptions{}.replyBytesTotal;
   uint64_t spoolBytesPerSession = tavrin::SessionSpool::kDefaultByteLimit;
+  uint64_t storeQueueRecords = tavrin::SqliteStore::kMaxQueuedRecords;
+  uint64_t storeBytes = 0;  // no bound but the disk
 };
 
 ListenerSettings ReadListenerSettings(const tavrin::Dictionary& defaults) {
@@ -140,6 +142,11 @@ ListenerSettings ReadListenerSettings(const tavrin::Dictionary& defaults) {
   readCount("reply_bytes_total", 1024 * 1024, settings.replyBytesTotal);
   readCount("spool_bytes_per_session", tavrin::SessionSpool::kMinByteLimit,
             settings.spoolBytesPerSession);
+  readCount("store_queue_records", 1024, settings.storeQueueRecords);
+  // 0 means no bound but the disk; any other value is raised to the floor.
+  readCount("store_bytes", 0, settings.storeBytes);
+  if (settings.storeBytes > 0)
+    settings.storeBytes = std::max<uint64_t>(settings.storeBytes, 1 << 20);
   auto list = table->find("kill_uids");
   if (list == table->end()) return settings;
   if (!list->is_array()) {
@@ -279,6 +286,8 @@ int main(int argc, char** argv) {
 
   BackendEnvironment environment;
   environment.stateDirectory = options.stateDir;
+  environment.storeQueueRecords = startSettings.storeQueueRecords;
+  environment.storeBytes = startSettings.storeBytes;
   // Declared before the back-ends: records still in their queues carry the ledger's accounts.
   MessageLedger ledger;
   const auto startedAt = std::chrono::steady_clock::now();

@@ -116,6 +116,9 @@ std::vector<ReportingBackendPtr> CreateBackends(const std::vector<BackendSpec>& 
       case BackendSpec::Kind::kSqlite: {
         SqliteStoreOptions options;
         options.stateDirectory = environment.stateDirectory;
+        options.queueCapacity = environment.storeQueueRecords;
+        options.maxPageCount =
+            static_cast<int64_t>(environment.storeBytes / SqliteStore::kPageBytes);
         options.clock = environment.clock;
         options.log = environment.log;
         backends.push_back(std::make_unique<SqliteStore>(std::move(options)));

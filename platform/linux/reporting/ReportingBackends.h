@@ -24,6 +24,7 @@
 #include "platform/RandomSource.h"
 #include "platform/TelvoroSession.h"
 #include "platform/linux/backend/ReportingBackend.h"
+#include "platform/linux/store/SqliteStore.h"
 #include "platform/linux/time/SystemClock.h"
 
 namespace tavrin {
@@ -49,6 +50,8 @@ std::optional<std::vector<BackendSpec>> ParseBackendSpecs(const std::vector<std:
 
 struct BackendEnvironment {
   std::string stateDirectory = "/var/lib/tavrin";  // the store's directory
+  size_t storeQueueRecords = SqliteStore::kMaxQueuedRecords;
+  uint64_t storeBytes = 0;  // the store file's bound; 0 for none but the disk
   const Clock* clock = &SystemClock();
   LogHandle log;
 };

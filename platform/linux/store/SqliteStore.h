@@ -78,14 +78,16 @@ struct SqliteStoreOptions {
   size_t queueCapacity = 65536;  // see SqliteStore::kMaxQueuedRecords
   // How long a write waits for another process (sqlite3, tavrinctl) holding the write lock.
   std::chrono::milliseconds busyTimeout{2000};
-  // Largest database size in pages (PRAGMA max_page_count); 0 for no limit but the disk. A write
-  // beyond it fails as on a full disk.
+  // Largest database size in pages of kPageBytes (PRAGMA max_page_count); 0 for no limit but the
+  // disk. A write beyond it fails as on a full disk.
   int64_t maxPageCount = 0;
 };
 
 class SqliteStore final : public ReportingBackend {
  public:
   static constexpr const char* kFileName = "tavrin.db";
+  // SQLite's default page size, which the store never changes.
+  static constexpr uint64_t kPageBytes = 4096;
   // A commit costs about as much as a few hundred inserts; 512 makes it a small share of a batch.
   static constexpr size_t kMaxBatchRecords = 512;
   // Bounds how long an accepted record stays uncommitted, and so what a SIGKILL can lose.
