@@ -55,6 +55,16 @@ FrameReader::Status FrameReader::Next() {
   return Status::kFrame;
 }
 
+std::span<const uint8_t> FrameReader::Peek() const {
+  const size_t available = buffer_.size() - start_;
+  if (failed_ || available < kFrameHeaderSize) return {};
+  const uint8_t* header = buffer_.data() + start_;
+  const uint32_t length = (uint32_t{header[0]} << 24) | (uint32_t{header[1]} << 16) |
+                          (uint32_t{header[2]} << 8) | uint32_t{header[3]};
+  if (length == 0 || length > frameLimit_ || available - kFrameHeaderSize < length) return {};
+  return std::span<const uint8_t>(header + kFrameHeaderSize, length);
+}
+
 bool FrameReader::InsideFrame() const { return !failed_ && buffer_.size() > start_; }
 
 }  // namespace tavrin::protocol

@@ -44,6 +44,10 @@ class FrameReader {
   // Takes the next complete frame out of the buffer.
   Status Next();
 
+  // The body of the next complete frame, left in place for Next(); empty when no frame is
+  // complete. Valid until the next call of Append() or Next().
+  std::span<const uint8_t> Peek() const;
+
   // The body of the frame that the last Next() answered kFrame for; valid until the next call of
   // Append() or Next().
   std::span<const uint8_t> Body() const { return body_; }
