@@ -2,6 +2,8 @@
 // with what its store holds.
 
 #include <gtest/gtest.h>
+#include <librdkafka/rdkafka.h>
+#include <librdkafka/rdkafka_mock.h>
 
 #include <cstdlib>
 #include <fstream>
@@ -24,6 +26,29 @@ Value Status(TestClient& client) {
   auto reply = client.Read();
   if (!reply || reply->status != protocol::Status::kOk) return Value();
   return reply->value;
+}
+
+// Waits until the service is idle with `received` messages counted, then checks that every one of
+// them is delivered or dropped, and that the store holds exactly the delivered ones.
+Value SettledStatus(TestClient& client, const TavrindProcess& service, int64_t received) {
+  Value status;
+  EXPECT_TRUE(testing::WaitUntil([&] {
+    status = Status(client);
+    return status.is_object() && status["totals"]["in_flight"] == 0 &&
+           status["totals"]["received"] == received;
+  })) << status.dump()
+      << service.Log();
+  int64_t dropped = 0;
+  for (const auto& [reason, count] : status["totals"]["dropped"].items()) {
+    dropped += count.get<int64_t>();
+  }
+  EXPECT_EQ(status["totals"]["delivered"].get<int64_t>() + dropped, received) << status.dump();
+  return status;
+}
+
+std::string StoredMessages(const TavrindProcess& service) {
+  return testing::QueryStoreColumn(service.DatabasePath(), "SELECT count(*) FROM session_messages")
+      .at(0);
 }
 
 // Each drop reason the core decides, a client that goes away with messages counted, and the
@@ -128,6 +153,108 @@ TEST(LedgerE2eTest, WithoutABackEndEveryMessageIsDroppedAsSuch) {
   })) << status.dump();
   EXPECT_EQ(status["totals"]["dropped"], (Value{{"no_backend", 5}}));
   EXPECT_EQ(status["totals"]["delivered"], 0);
+}
+
+// A store that stalls (another program holds its write lock) while one client fans messages out to
+// hundreds of sessions and others send too: what the store's queue cannot take is dropped as
+// queue_full, and nothing else is lost. Then a store at its size bound: what does not fit is
+// dropped as write_failed. Both bounds are settings.
+TEST(LedgerE2eTest, AStalledStoreAndAFullStoreDropOnlyWhatTheirBoundsRefuse) {
+  const std::string root = testing::MakeTempDirectory("tavrin-e2e-");
+  std::filesystem::create_directories(root + "/etc");
+  testing::WriteFileAtomically(root + "/etc/com.quorvex.tavrin.toml",
+                               "[limits]\nstore_queue_records = 1024\nstore_bytes = 4194304\n");
+  TavrindProcess service({}, root);
+  ASSERT_TRUE(service.Start()) << service.Log();
+  TestClient fanOut(service.SocketPath());
+  constexpr int kSessions = 600;
+  std::vector<int64_t> ids;
+  for (int64_t id = 1; id <= kSessions; ++id) {
+    ids.push_back(id);
+    fanOut.Send(uint64_t(id), protocol::CreateReportingSession{id});
+  }
+  for (int i = 0; i < kSessions; ++i) ASSERT_TRUE(fanOut.Read());
+  for (int64_t id : ids) fanOut.Send(uint64_t(id), protocol::StartReportingSessionForID{id});
+  TestClient watcher(service.SocketPath());
+  ASSERT_TRUE(testing::WaitUntil([&] {  // the sessions are started: their rows are written
+    return testing::QueryStoreColumn(service.DatabasePath(), "SELECT count(*) FROM sessions") ==
+           std::vector<std::string>{std::to_string(kSessions)};
+  }));
+
+  sqlite3* holder = nullptr;
+  ASSERT_EQ(sqlite3_open(service.DatabasePath().c_str(), &holder), SQLITE_OK);
+  ASSERT_EQ(sqlite3_exec(holder, "BEGIN IMMEDIATE", nullptr, nullptr, nullptr), SQLITE_OK);
+  for (int i = 0; i < 3; ++i) {
+    fanOut.SendNoReply(protocol::SendMessage{Dictionary{{"fan", i}}, 1, 0, ids});
+  }
+  std::vector<std::unique_ptr<TestClient>> others;
+  for (int64_t id : {1001, 1002}) {
+    auto& other = others.emplace_back(std::make_unique<TestClient>(service.SocketPath()));
+    other->Send(1, protocol::CreateReportingSession{id});
+    other->Send(2, protocol::StartReportingSessionForID{id});
+    for (int i = 0; i < 100; ++i) {
+      other->SendNoReply(
+          protocol::SendMessage{Dictionary{{"i", i}}, 1, 0, std::vector<int64_t>{id}});
+    }
+  }
+  // The writer waits for the lock (each try up to its busy timeout): the fan-out overflows the
+  // queue meanwhile, and the lock is let go before the store would give the batch up. Every
+  // client's reading waits meanwhile, but an operator's status request is still answered.
+  Value status;
+  EXPECT_TRUE(testing::WaitUntil([&] {
+    status = Status(watcher);
+    return status.is_object() && status["totals"]["dropped"].contains("queue_full");
+  })) << status.dump();
+  sqlite3_exec(holder, "ROLLBACK", nullptr, nullptr, nullptr);
+  sqlite3_close(holder);
+  status = SettledStatus(watcher, service, 3 * kSessions + 200);
+  EXPECT_EQ(status["totals"]["dropped"].size(), 1u) << status.dump();
+  const int64_t delivered = status["totals"]["delivered"].get<int64_t>();
+  EXPECT_GT(delivered, 0) << "what the queue held is written once the store moves";
+  EXPECT_NE(service.Log().find("the store's queue is full (1024 records)"), std::string::npos);
+  EXPECT_EQ(StoredMessages(service), std::to_string(delivered));
+
+  // Messages of 64 KiB into a store bounded at 4 MiB.
+  const Dictionary big{{"blob", std::string(64 * 1024, 'x')}};
+  for (int i = 0; i < 100; ++i) {
+    fanOut.SendNoReply(protocol::SendMessage{big, 2, 0, std::vector<int64_t>{1}});
+  }
+  status = SettledStatus(watcher, service, 3 * kSessions + 200 + 100);
+  EXPECT_GT(status["totals"]["dropped"].value("write_failed", 0), 0) << status.dump();
+  EXPECT_EQ(StoredMessages(service), std::to_string(status["totals"]["delivered"].get<int64_t>()));
+  EXPECT_NE(service.Log().find("database or disk is full"), std::string::npos) << service.Log();
+}
+
+// Kafka (librdkafka's mock cluster, in this process) as the only back-end: a record over the
+// producer's message size is dropped as too_large at once, one the broker refuses as
+// delivery_failed once its report comes, and the rest are delivered when acknowledged.
+TEST(LedgerE2eTest, KafkaRefusalsAreDroppedByTheirReasonAndAcknowledgedRecordsDelivered) {
+  rd_kafka_conf_t* conf = rd_kafka_conf_new();
+  rd_kafka_conf_set(conf, "log_level", "3", nullptr, 0);
+  rd_kafka_t* host = rd_kafka_new(RD_KAFKA_PRODUCER, conf, nullptr, 0);
+  ASSERT_NE(host, nullptr);
+  rd_kafka_mock_cluster_t* cluster = rd_kafka_mock_cluster_new(host, 1);
+  ASSERT_NE(cluster, nullptr);
+  {
+    TavrindProcess service(
+        {"--backend", std::string("kafka:") + rd_kafka_mock_cluster_bootstraps(cluster)});
+    ASSERT_TRUE(service.Start()) << service.Log();
+    TestClient client(service.SocketPath());
+    client.SendNoReply(protocol::SendMessage{Dictionary{{"i", 0}}, 1, 0, std::nullopt});
+    SettledStatus(client, service, 1);
+    client.SendNoReply(protocol::SendMessage{Dictionary{{"blob", std::string(1'010'000, 'x')}}, 1,
+                                             0, std::nullopt});
+    constexpr int16_t kProduceApiKey = 0;  // Kafka's request numbering
+    rd_kafka_mock_push_request_errors(cluster, kProduceApiKey, 1,
+                                      RD_KAFKA_RESP_ERR_MSG_SIZE_TOO_LARGE);
+    client.SendNoReply(protocol::SendMessage{Dictionary{{"i", 1}}, 1, 0, std::nullopt});
+    const Value status = SettledStatus(client, service, 3);
+    EXPECT_EQ(status["totals"]["dropped"], (Value{{"too_large", 1}, {"delivery_failed", 1}}))
+        << status.dump() << service.Log();
+    EXPECT_EQ(status["totals"]["delivered"], 1);
+  }
+  rd_kafka_mock_cluster_destroy(cluster);
+  rd_kafka_destroy(host);
 }
 
 }  // namespace
