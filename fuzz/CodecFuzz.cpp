@@ -1,10 +1,9 @@
-// Feeds arbitrary bytes to the wire codec three ways (as one request body, as one reply body, and
-// as a stream of frames) and aborts on any broken invariant:
+// Feeds arbitrary bytes to the wire codec as one request body and as one reply body, and aborts
+// on any broken invariant (framing is FrameTest's: byte at a time, in one chunk, at the limits):
 //  - nothing throws;
 //  - the byte scan agrees with nlohmann's parser on what is well-formed;
 //  - an accepted request re-encodes to bytes that decode to the same request and re-encode
-//    identically; a rejected one is answered under the call the scan found;
-//  - splitting a stream into other chunks changes none of the frames it yields.
+//    identically; a rejected one is answered under the call the scan found.
 
 #include <cstdint>
 #include <cstdio>
@@ -15,7 +14,6 @@
 #include <vector>
 
 #include "protocol/Codec.h"
-#include "protocol/Frame.h"
 #include "protocol/MessagePack.h"
 
 namespace {
@@ -23,8 +21,6 @@ namespace {
 using namespace tavrin::protocol;
 using Bytes = std::vector<uint8_t>;
 
-// Small enough that inputs reach the "length over the limit" path.
-constexpr uint32_t kFuzzFrameLimit = 512;
 // Largest malformed input handed to nlohmann for comparison: its parser recurses, and a malformed
 // input is not depth-checked beyond the point where it broke.
 constexpr size_t kMaxCompareSize = 1024;
@@ -118,51 +114,6 @@ void CheckReply(std::span<const uint8_t> body) {
   FUZZ_CHECK(error.has_value() == (reply->status != Status::kOk));
 }
 
-struct StreamOutcome {
-  std::vector<Bytes> frames;
-  FrameReader::Status last = FrameReader::Status::kNeedMore;
-  bool insideFrame = false;
-  bool operator==(const StreamOutcome&) const = default;
-};
-
-// Reads `input` as a stream delivered in chunks whose sizes come from `chunkSizes` in turn.
-StreamOutcome ReadStream(std::span<const uint8_t> input, std::span<const uint8_t> chunkSizes) {
-  FrameReader reader(kFuzzFrameLimit);
-  StreamOutcome outcome;
-  size_t pos = 0;
-  size_t turn = 0;
-  while (pos < input.size() && outcome.last != FrameReader::Status::kBadLength) {
-    size_t chunk = input.size() - pos;
-    if (!chunkSizes.empty())
-      chunk = std::min<size_t>(chunk, 1 + chunkSizes[turn++ % chunkSizes.size()] % 16);
-    reader.Append(input.subspan(pos, chunk));
-    pos += chunk;
-    for (;;) {
-      outcome.last = reader.Next();
-      if (outcome.last != FrameReader::Status::kFrame) break;
-      FUZZ_CHECK(!reader.Body().empty() && reader.Body().size() <= kFuzzFrameLimit);
-      outcome.frames.emplace_back(reader.Body().begin(), reader.Body().end());
-    }
-  }
-  outcome.insideFrame = reader.InsideFrame();
-  return outcome;
-}
-
-void CheckStream(std::span<const uint8_t> input) {
-  const StreamOutcome whole = ReadStream(input, {});
-  const StreamOutcome chunked = ReadStream(input, input);
-  FUZZ_CHECK(whole == chunked);
-  for (const Bytes& frame : whole.frames) {
-    CheckRequest(frame);
-    // Framing a body again gives a frame that reads back as that body.
-    FrameReader reader(kFuzzFrameLimit);
-    reader.Append(EncodeFrame(frame));
-    FUZZ_CHECK(reader.Next() == FrameReader::Status::kFrame);
-    FUZZ_CHECK(Bytes(reader.Body().begin(), reader.Body().end()) == frame);
-    FUZZ_CHECK(!reader.InsideFrame());
-  }
-}
-
 }  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
@@ -171,7 +122,6 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     CheckScanAgainstParser(input);
     CheckRequest(input);
     CheckReply(input);
-    CheckStream(input);
   } catch (const std::exception& e) {
     std::fprintf(stderr, "codec threw: %s\n", e.what());
     std::abort();

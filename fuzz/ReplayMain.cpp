@@ -47,39 +47,28 @@ void RunWithDerived(const Bytes& seed) {
   }
 }
 
-bool ReadFile(const std::filesystem::path& path, Bytes& out) {
-  std::ifstream file(path, std::ios::binary);
-  if (!file) return false;
-  out.assign(std::istreambuf_iterator<char>(file), std::istreambuf_iterator<char>());
-  return true;
-}
-
 }  // namespace
 
+// Each argument is a corpus file or a directory of them; a path that cannot be read fails the run.
 int main(int argc, char** argv) {
   std::vector<std::filesystem::path> files;
   for (int i = 1; i < argc; ++i) {
-    const std::filesystem::path path(argv[i]);
-    std::error_code error;
-    if (std::filesystem::is_directory(path, error)) {
-      for (const auto& entry : std::filesystem::recursive_directory_iterator(path)) {
-        if (entry.is_regular_file()) files.push_back(entry.path());
-      }
-    } else if (std::filesystem::is_regular_file(path, error)) {
-      files.push_back(path);
-    } else {
-      std::fprintf(stderr, "%s: no such file or directory\n", argv[i]);
-      return 1;
+    if (!std::filesystem::is_directory(argv[i])) {
+      files.emplace_back(argv[i]);  // a missing one fails below, as unreadable
+      continue;
+    }
+    for (const auto& entry : std::filesystem::recursive_directory_iterator(argv[i])) {
+      if (entry.is_regular_file()) files.push_back(entry.path());
     }
   }
   std::sort(files.begin(), files.end());
   for (const auto& path : files) {
-    Bytes input;
-    if (!ReadFile(path, input)) {
+    std::ifstream file(path, std::ios::binary);
+    if (!file) {
       std::fprintf(stderr, "%s: cannot read\n", path.c_str());
       return 1;
     }
-    RunWithDerived(input);
+    RunWithDerived(Bytes(std::istreambuf_iterator<char>(file), std::istreambuf_iterator<char>()));
   }
   std::printf("replayed %zu inputs from %zu files\n", runs, files.size());
   return 0;

@@ -1,73 +1,39 @@
 #include "protocol/Dispatch.h"
 
+#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
 #include <cstdint>
-#include <string>
+#include <optional>
 #include <vector>
 
 namespace tavrin::protocol {
 namespace {
 
-// Records each call with its arguments and keeps its reply callback for the test to invoke, so a
-// reply can be sent later, twice, or never, as the service does.
-class RecordingService : public RuvoReportingServiceProtocol {
+using ::testing::_;
+using ::testing::Eq;
+using ::testing::InvokeArgument;
+using ::testing::SaveArg;
+using Protocol = RuvoReportingServiceProtocol;
+using IDs = std::optional<std::vector<int64_t>>;
+
+class MockService : public Protocol {
  public:
-  std::vector<std::string> calls;
-  BoolReply boolReply;
-  ServiceTypeReply serviceTypeReply;
-  ErrorReply errorReply;
-  DictionaryReply dictionaryReply;
-  ReportersReply reportersReply;
-  Dictionary lastDictionary;
-  std::optional<std::vector<int64_t>> lastReporterIDs;
-
-  void createReportingSession(int64_t id, BoolReply reply) override {
-    Keep("create " + std::to_string(id), boolReply, std::move(reply));
-  }
-  void setServiceType(uint16_t serviceType, int64_t id, BoolReply reply) override {
-    Keep("setServiceType " + std::to_string(serviceType) + " " + std::to_string(id), boolReply,
-         std::move(reply));
-  }
-  void getServiceNameForReporterID(int64_t id, ServiceTypeReply reply) override {
-    Keep("getServiceName " + std::to_string(id), serviceTypeReply, std::move(reply));
-  }
-  void setConfiguration(const Dictionary& configuration, int64_t id, BoolReply reply) override {
-    lastDictionary = configuration;
-    Keep("setConfiguration " + std::to_string(id), boolReply, std::move(reply));
-  }
-  void startReportingSessionForID(int64_t id, BoolReply reply) override {
-    Keep("start " + std::to_string(id), boolReply, std::move(reply));
-  }
-  void sendMessage(const Dictionary& message, uint32_t category, uint16_t type,
-                   const std::optional<std::vector<int64_t>>& ids, ErrorReply reply) override {
-    lastDictionary = message;
-    lastReporterIDs = ids;
-    Keep("send " + std::to_string(category) + " " + std::to_string(type), errorReply,
-         std::move(reply));
-  }
-  void stopReportingSessionForID(int64_t id, BoolReply reply) override {
-    Keep("stop " + std::to_string(id), boolReply, std::move(reply));
-  }
-  void destroyReportingSession(int64_t id, BoolReply reply) override {
-    Keep("destroy " + std::to_string(id), boolReply, std::move(reply));
-  }
-  void reporterID(int64_t id, DictionaryReply valid) override {
-    Keep("valid " + std::to_string(id), dictionaryReply, std::move(valid));
-  }
-  void getAllReporters(ReportersReply reply) override {
-    Keep("all", reportersReply, std::move(reply));
-  }
-  void killService(BoolReply reply) override { Keep("kill", boolReply, std::move(reply)); }
-
- private:
-  template <typename Callback>
-  void Keep(std::string call, Callback& slot, Callback reply) {
-    calls.push_back(std::move(call));
-    slot = std::move(reply);
-  }
+  MOCK_METHOD(void, createReportingSession, (int64_t, BoolReply), (override));
+  MOCK_METHOD(void, setServiceType, (uint16_t, int64_t, BoolReply), (override));
+  MOCK_METHOD(void, getServiceNameForReporterID, (int64_t, ServiceTypeReply), (override));
+  MOCK_METHOD(void, setConfiguration, (const Dictionary&, int64_t, BoolReply), (override));
+  MOCK_METHOD(void, startReportingSessionForID, (int64_t, BoolReply), (override));
+  MOCK_METHOD(void, sendMessage, (const Dictionary&, uint32_t, uint16_t, const IDs&, ErrorReply),
+              (override));
+  MOCK_METHOD(void, stopReportingSessionForID, (int64_t, BoolReply), (override));
+  MOCK_METHOD(void, destroyReportingSession, (int64_t, BoolReply), (override));
+  MOCK_METHOD(void, reporterID, (int64_t, DictionaryReply), (override));
+  MOCK_METHOD(void, getAllReporters, (ReportersReply), (override));
+  MOCK_METHOD(void, killService, (BoolReply), (override));
 };
 
+// A strict service: a call the test did not expect, or with other arguments, fails it.
 class DispatchTest : public ::testing::Test {
  protected:
   void Run(Request request) {
@@ -78,99 +44,103 @@ class DispatchTest : public ::testing::Test {
     });
   }
 
-  RecordingService service_;
+  ::testing::StrictMock<MockService> service_;
   std::vector<Reply> sent_;
 };
 
-TEST_F(DispatchTest, BooleanOperationsReachTheServiceAndReplyUnderTheirCall) {
-  Run({1, CreateReportingSession{-4}});
-  Run({2, SetServiceType{12, 4}});
-  Run({3, StartReportingSessionForID{4}});
-  Run({4, StopReportingSessionForID{4}});
-  Run({5, DestroyReportingSession{4}});
-  Run({6, KillService{}});
-  EXPECT_EQ(service_.calls, (std::vector<std::string>{"create -4", "setServiceType 12 4", "start 4",
-                                                      "stop 4", "destroy 4", "kill"}));
-  // Only the last callback is kept; it answers under call 6.
-  service_.boolReply(true);
-  ASSERT_EQ(sent_.size(), 1u);
-  EXPECT_EQ(sent_[0].call, 6u);
-  EXPECT_EQ(sent_[0].status, Status::kOk);
+TEST_F(DispatchTest, EveryOperationReachesTheServiceAndItsReplyGoesOutUnderItsCall) {
+  const Dictionary configuration{{"device_name", "dock"}};
+  const Dictionary message{{"k", 1}};
+  const Dictionary validity{{"reporterID", 8}, {"serviceType", 2}};
+  EXPECT_CALL(service_, createReportingSession(-4, _)).WillOnce(InvokeArgument<1>(true));
+  EXPECT_CALL(service_, setServiceType(12, 4, _)).WillOnce(InvokeArgument<2>(false));
+  EXPECT_CALL(service_, getServiceNameForReporterID(0, _))
+      .WillOnce(InvokeArgument<1>(uint16_t{0xffff}));
+  EXPECT_CALL(service_, setConfiguration(configuration, 8, _)).WillOnce(InvokeArgument<2>(true));
+  EXPECT_CALL(service_, startReportingSessionForID(4, _)).WillOnce(InvokeArgument<1>(true));
+  EXPECT_CALL(service_, sendMessage(message, 0x10002, 3, Eq(IDs{{5, 6}}), _))
+      .WillOnce(InvokeArgument<4>(std::nullopt));
+  EXPECT_CALL(service_, stopReportingSessionForID(4, _)).WillOnce(InvokeArgument<1>(true));
+  EXPECT_CALL(service_, destroyReportingSession(4, _)).WillOnce(InvokeArgument<1>(true));
+  EXPECT_CALL(service_, reporterID(8, _)).WillOnce(InvokeArgument<1>(validity));
+  EXPECT_CALL(service_, getAllReporters(_))
+      .WillOnce(InvokeArgument<0>(std::vector<int64_t>{-1, 8}));
+  EXPECT_CALL(service_, killService(_)).WillOnce(InvokeArgument<0>(true));
+  const Arguments operations[] = {
+      CreateReportingSession{-4},
+      SetServiceType{12, 4},
+      GetServiceNameForReporterID{0},
+      SetConfiguration{configuration, 8},
+      StartReportingSessionForID{4},
+      SendMessage{message, 0x10002, 3, std::vector<int64_t>{5, 6}},
+      StopReportingSessionForID{4},
+      DestroyReportingSession{4},
+      ReporterIDValid{8},
+      GetAllReporters{},
+      KillService{},
+  };
+  for (size_t i = 0; i < std::size(operations); ++i) Run({i + 1, operations[i]});
+
+  ASSERT_EQ(sent_.size(), std::size(operations));
+  for (size_t i = 0; i < sent_.size(); ++i) {
+    EXPECT_EQ(sent_[i].call, i + 1);
+    EXPECT_EQ(sent_[i].status, Status::kOk) << i;
+  }
   EXPECT_EQ(BoolReplyValue(sent_[0].value), true);
+  EXPECT_EQ(BoolReplyValue(sent_[1].value), false);
+  EXPECT_EQ(ServiceTypeReplyValue(sent_[2].value), 0xffff);
+  EXPECT_TRUE(IsNilReplyValue(sent_[5].value));
+  EXPECT_EQ(ValidityReplyValue(sent_[8].value), validity);
+  EXPECT_EQ(ReportersReplyValue(sent_[9].value), (std::vector<int64_t>{-1, 8}));
 }
 
-TEST_F(DispatchTest, HeldStartReplyIsSentWhenInvokedLater) {
+// A reply goes out whenever and as often as the service invokes it, under its own call; a nil
+// call still runs its operation but sends nothing.
+TEST_F(DispatchTest, RepliesGoWhenAndAsOftenAsInvokedAndNeverForANilCall) {
+  Protocol::BoolReply held, stop;
+  Protocol::ServiceTypeReply name;
+  EXPECT_CALL(service_, startReportingSessionForID(7, _)).WillOnce(SaveArg<1>(&held));
+  EXPECT_CALL(service_, stopReportingSessionForID(7, _)).WillOnce(SaveArg<1>(&stop));
+  EXPECT_CALL(service_, getServiceNameForReporterID(0, _)).WillOnce(SaveArg<1>(&name));
+  EXPECT_CALL(service_, createReportingSession(1, _)).WillOnce(InvokeArgument<1>(true));
+  EXPECT_CALL(service_, getAllReporters(_)).WillOnce(InvokeArgument<0>(std::vector<int64_t>{1}));
   Run({21, StartReportingSessionForID{7}});
-  auto held = service_.boolReply;
   Run({22, StopReportingSessionForID{7}});
-  auto stop = service_.boolReply;
+  Run({9, GetServiceNameForReporterID{0}});
+  Run({std::nullopt, CreateReportingSession{1}});
+  Run({std::nullopt, GetAllReporters{}});
+  Run({std::nullopt, GetStatus{}});
   EXPECT_TRUE(sent_.empty());
   held(true);
   stop(true);
-  ASSERT_EQ(sent_.size(), 2u);
+  name(0xffff);
+  name(0xffff);
+  ASSERT_EQ(sent_.size(), 4u);
   EXPECT_EQ(sent_[0].call, 21u);
   EXPECT_EQ(sent_[1].call, 22u);
+  EXPECT_EQ(sent_[2].call, 9u);
+  EXPECT_EQ(sent_[3].call, 9u);
+  EXPECT_EQ(ServiceTypeReplyValue(sent_[3].value), 0xffff);
 }
 
-TEST_F(DispatchTest, ReplyInvokedTwiceIsSentTwice) {
-  Run({9, GetServiceNameForReporterID{0}});
-  service_.serviceTypeReply(0xffff);
-  service_.serviceTypeReply(0xffff);
+TEST_F(DispatchTest, AFailedSendAndAStatusRequestAreOperationErrors) {
+  EXPECT_CALL(service_, sendMessage(Dictionary::object(), 1, 1, Eq(std::nullopt), _))
+      .WillOnce(InvokeArgument<4>(
+          Error{std::string(kReportingErrorDomain), kReportingDisabledCode, "off"}));
+  Run({31, SendMessage{Dictionary::object(), 1, 1, std::nullopt}});
+  // Only the listener can answer a status request; the service never sees one.
+  Run({32, GetStatus{}});
   ASSERT_EQ(sent_.size(), 2u);
-  for (const Reply& reply : sent_) {
-    EXPECT_EQ(reply.call, 9u);
-    EXPECT_EQ(ServiceTypeReplyValue(reply.value), 0xffff);
+  const std::pair<const char*, int64_t> errors[] = {{"com.quorvex.audio.reporting", 1},
+                                                    {"com.quorvex.tavrin.protocol", 1}};
+  for (size_t i = 0; i < 2; ++i) {
+    EXPECT_EQ(sent_[i].call, 31u + i);
+    EXPECT_EQ(sent_[i].status, Status::kOperationError);
+    const OptionalError error = ReplyError(sent_[i]);
+    ASSERT_TRUE(error) << i;
+    EXPECT_EQ(error->domain, errors[i].first);
+    EXPECT_EQ(error->code, errors[i].second);
   }
-}
-
-TEST_F(DispatchTest, NilCallRunsTheOperationAndSendsNothing) {
-  Run({std::nullopt, CreateReportingSession{1}});
-  service_.boolReply(true);
-  Run({std::nullopt, GetAllReporters{}});
-  service_.reportersReply({1, 2});
-  EXPECT_EQ(service_.calls, (std::vector<std::string>{"create 1", "all"}));
-  EXPECT_TRUE(sent_.empty());
-}
-
-TEST_F(DispatchTest, SendMessageRepliesNilOnSuccessAndStatus1OnError) {
-  Dictionary message = Dictionary::object();
-  message["k"] = 1;
-  Run({30, SendMessage{message, 0x10002, 3, std::vector<int64_t>{5, 6}}});
-  EXPECT_EQ(service_.calls.back(), "send 65538 3");
-  EXPECT_EQ(service_.lastDictionary, message);
-  EXPECT_EQ(service_.lastReporterIDs, (std::vector<int64_t>{5, 6}));
-  service_.errorReply(std::nullopt);
-
-  Run({31, SendMessage{message, 1, 1, std::nullopt}});
-  EXPECT_FALSE(service_.lastReporterIDs.has_value());
-  service_.errorReply(Error{std::string(kReportingErrorDomain), kReportingDisabledCode, "off"});
-
-  ASSERT_EQ(sent_.size(), 2u);
-  EXPECT_EQ(sent_[0].call, 30u);
-  EXPECT_EQ(sent_[0].status, Status::kOk);
-  EXPECT_TRUE(IsNilReplyValue(sent_[0].value));
-  EXPECT_EQ(sent_[1].call, 31u);
-  EXPECT_EQ(sent_[1].status, Status::kOperationError);
-  const OptionalError error = ReplyError(sent_[1]);
-  ASSERT_TRUE(error);
-  EXPECT_EQ(error->domain, "com.quorvex.audio.reporting");
-  EXPECT_EQ(error->code, 1);
-}
-
-TEST_F(DispatchTest, QueriesReplyWithTheirValueKinds) {
-  Dictionary configuration = Dictionary::object();
-  configuration["device_name"] = "dock";
-  Run({40, SetConfiguration{configuration, 8}});
-  EXPECT_EQ(service_.lastDictionary, configuration);
-
-  Run({41, ReporterIDValid{8}});
-  service_.dictionaryReply(Dictionary{{"reporterID", 8}, {"serviceType", 2}});
-  Run({42, GetAllReporters{}});
-  service_.reportersReply({-1, 8});
-  ASSERT_EQ(sent_.size(), 2u);
-  EXPECT_TRUE(ValidityReplyValue(sent_[0].value));
-  EXPECT_EQ(sent_[0].value["reporterID"], 8);
-  EXPECT_EQ(ReportersReplyValue(sent_[1].value), (std::vector<int64_t>{-1, 8}));
 }
 
 }  // namespace

@@ -73,10 +73,8 @@ TEST(MessagePackTest, DepthCountsArraysAndMapsOneLevelEach) {
   EXPECT_EQ(ScanMessagePack(Pack().array(2).uint(1).array(0)).depth, 2);
   // The deepest branch counts, not the last one.
   EXPECT_EQ(ScanMessagePack(Pack().array(2).map(1).str("k").array(1).nil().uint(1)).depth, 3);
-}
-
-// The limit itself and one more, through a request, are in CodecTest's nesting case.
-TEST(MessagePackTest, AnEmptyContainerPastTheLimitIsTooDeep) {
+  // An empty container past the limit is too deep. (The limit itself and one more, through a
+  // request, are in CodecTest's nesting case.)
   Pack pack;
   for (int i = 0; i < kMaxNestingDepth; ++i) pack.array(1);
   pack.map(0);
@@ -117,32 +115,27 @@ TEST(MessagePackTest, EveryPrefixOfAValueIsTruncated) {
   }
 }
 
-TEST(MessagePackTest, TrailingAndNeverUsedBytesAreRefused) {
-  Bytes bytes = Pack().array(1).uint(1);
-  bytes.push_back(0xc0);
-  const DecodedValue decoded = DecodeMessagePack(bytes);
-  EXPECT_EQ(decoded.scan.form, Form::kTrailingBytes);
-  EXPECT_EQ(decoded.scan.offset, 2u);
-  EXPECT_FALSE(decoded.value);
-  EXPECT_EQ(ScanMessagePack(Pack().array(2).uint(1).raw({0xc1})).form, Form::kInvalidByte);
-}
-
 // Declared lengths are checked against what is left before anything is believed.
-TEST(MessagePackTest, HugeDeclaredLengthsAreTruncationsNotAllocations) {
-  const std::vector<Bytes> claims = {
-      Pack().big(0xdb, 0xffffffff, 4).str("abc"),                 // str32 of 4 GB
-      Pack().big(0xdd, 0xffffffff, 4).nil(),                      // array32 of 4G elements
-      Pack().big(0xdf, 0xffffffff, 4).str("k").nil(),             // map32 of 4G pairs
-      Pack().array(2).uint(1).big(0xc6, 0xfffffff0, 4),           // bin32
-      Pack().array(2).uint(1).big(0xc9, 0xfffffff0, 4).raw({1}),  // ext32
-      Pack().big(0xdc, 3, 2).nil().nil(),                         // one element short
-      Pack().map(1).str("k"),                                     // a key without its value
+TEST(MessagePackTest, FormFaultsAreFoundAndNothingIsBuilt) {
+  Bytes trailing = Pack().array(1).uint(1);
+  trailing.push_back(0xc0);
+  const std::vector<std::pair<Bytes, Form>> cases = {
+      {trailing, Form::kTrailingBytes},
+      {Pack().array(2).uint(1).raw({0xc1}), Form::kInvalidByte},
+      {Pack().big(0xdb, 0xffffffff, 4).str("abc"), Form::kTruncated},        // str32 of 4 GB
+      {Pack().big(0xdd, 0xffffffff, 4).nil(), Form::kTruncated},             // array32, 4G elements
+      {Pack().big(0xdf, 0xffffffff, 4).str("k").nil(), Form::kTruncated},    // map32 of 4G pairs
+      {Pack().array(2).uint(1).big(0xc6, 0xfffffff0, 4), Form::kTruncated},  // bin32
+      {Pack().array(2).uint(1).big(0xc9, 0xfffffff0, 4).raw({1}), Form::kTruncated},  // ext32
+      {Pack().big(0xdc, 3, 2).nil().nil(), Form::kTruncated},  // one element short
+      {Pack().map(1).str("k"), Form::kTruncated},              // a key without its value
   };
-  for (size_t i = 0; i < claims.size(); ++i) {
-    const DecodedValue decoded = DecodeMessagePack(claims[i]);
-    EXPECT_EQ(decoded.scan.form, Form::kTruncated) << "claim " << i;
-    EXPECT_FALSE(decoded.value);
+  for (size_t i = 0; i < cases.size(); ++i) {
+    const DecodedValue decoded = DecodeMessagePack(cases[i].first);
+    EXPECT_EQ(decoded.scan.form, cases[i].second) << "case " << i;
+    EXPECT_FALSE(decoded.value) << "case " << i;
   }
+  EXPECT_EQ(ScanMessagePack(trailing).offset, 2u);
 }
 
 TEST(MessagePackTest, BinAndExtAreNamedAndNotParsed) {

@@ -386,9 +386,7 @@ TEST_F(SessionTest, MessageIdsCountPerCategoryAndType) {
   EXPECT_EQ(session->messageTypeCounts(),
             (Dictionary{{"Toolbox_Generic_Start", 3}, {"Toolbox_Generic_Stop", 1}}));
   EXPECT_EQ(traces.Count(trace::kMessageSent), 4u);
-
   // Named in full, sent with the low 16 bits.
-  platform.dispatcher.RunUntilIdle();
   for (const auto& message : platform.telvoro.LastSession()->Messages()) {
     EXPECT_EQ(message.category, 1);
   }
@@ -494,7 +492,23 @@ TEST_F(SessionTest, OtherSingleMessagesGoAtOnceWithoutTheClientsUserInfoAndRepor
 
 constexpr const char* kCallbackID = "RuvoReportingService 42";
 
-TEST_F(SessionTest, TelephonyAndLongFormAudioRegisterDeviceThenUI) {
+// Telephony and long-form audio register device then UI callbacks at start and unregister them at
+// stop; other types, never-started sessions and device class 6 never track.
+TEST_F(SessionTest, OnlyTelephonyAndLongFormAudioTrackOrientation) {
+  for (uint16_t type : {uint16_t{0}, uint16_t{3}, uint16_t{8}, uint16_t{0xFFFF}}) {
+    auto session = Started(42, type);
+    EXPECT_FALSE(session->orientationCallbackID().has_value()) << type;
+    session->stop();
+  }
+  Create(42, 2)->stop();  // never started: nothing to unregister
+  platform.deviceInfo.SetInt32(kDeviceInfoDeviceClassNumber, 6);
+  auto classSix = Started(42, 2);
+  EXPECT_FALSE(classSix->shouldReportOrientation());
+  EXPECT_FALSE(classSix->orientationCallbackID().has_value());
+  EXPECT_TRUE(platform.orientation.History().empty());
+  platform.deviceInfo.SetInt32(kDeviceInfoDeviceClassNumber, 5);
+  EXPECT_TRUE(classSix->shouldReportOrientation());
+
   for (uint16_t type : {uint16_t{2}, uint16_t{7}}) {
     const size_t before = platform.orientation.History().size();
     auto session = Started(42, type);
@@ -515,23 +529,6 @@ TEST_F(SessionTest, TelephonyAndLongFormAudioRegisterDeviceThenUI) {
       EXPECT_EQ(history[before + i].id, kCallbackID) << i;
     }
   }
-}
-
-TEST_F(SessionTest, OtherServiceTypesDeviceClassSixAndNeverStartedSessionsNeverTrack) {
-  for (uint16_t type : {uint16_t{0}, uint16_t{3}, uint16_t{8}, uint16_t{0xFFFF}}) {
-    auto session = Started(42, type);
-    EXPECT_FALSE(session->orientationCallbackID().has_value()) << type;
-    session->stop();
-  }
-  Create(42, 2)->stop();  // never started: nothing to unregister
-  platform.deviceInfo.SetInt32(kDeviceInfoDeviceClassNumber, 6);
-  auto session = Started(42, 2);
-  EXPECT_FALSE(session->shouldReportOrientation());
-  EXPECT_FALSE(session->orientationCallbackID().has_value());
-  EXPECT_TRUE(platform.orientation.History().empty());
-
-  platform.deviceInfo.SetInt32(kDeviceInfoDeviceClassNumber, 5);
-  EXPECT_TRUE(session->shouldReportOrientation());
 }
 
 TEST_F(SessionTest, TimesAreRoundedToWholeMilliseconds) {
