@@ -12,7 +12,6 @@
 #include <csignal>
 #include <cstdlib>
 #include <filesystem>
-#include <fstream>
 #include <functional>
 
 #include "tests/support/StoreFiles.h"
@@ -47,8 +46,8 @@ TEST(ServiceLifecycleE2eTest, SigtermSendsTheAlarmsMessagesStillHeldBack) {
 }
 
 // A session open when the service is killed: the next start sends its summary, marked as
-// recovered in the store and in the summary file's name, covering every message the store had
-// committed, and removes the spool it came from.
+// recovered in the store, covering every message the store had committed, writes its summary
+// file and removes the spool it came from.
 TEST(ServiceLifecycleE2eTest, AfterSigkillTheNextStartSendsTheOpenSessionsSummary) {
   const std::string root = testing::MakeTempDirectory("tavrin-e2e-");
   testing::WriteFileAtomically(root + "/etc/device.toml", "InternalBuild = true\n");
@@ -98,18 +97,9 @@ TEST(ServiceLifecycleE2eTest, AfterSigkillTheNextStartSendsTheOpenSessionsSummar
   EXPECT_EQ(testing::QueryStoreColumn(service.DatabasePath(),
                                       "SELECT count(*) FROM sessions WHERE recovered = 1"),
             std::vector<std::string>{"1"});
-
-  std::vector<std::string> files;
-  for (const auto& entry :
-       std::filesystem::directory_iterator(root + "/log/DiagnosticLogs/Audio/Reporting")) {
-    files.push_back(entry.path().filename().string());
-  }
-  ASSERT_EQ(files.size(), 1u);
-  EXPECT_TRUE(files[0].ends_with("-tavrin-unknown-haptics-recovered.json")) << files[0];
-  std::ifstream in(root + "/log/DiagnosticLogs/Audio/Reporting/" + files[0]);
-  const Value file = Value::parse(in);
-  ASSERT_EQ(file.size(), size_t(kMessages + 2));
-  EXPECT_EQ(file[kMessages + 1], (Value{{"Undefined_Unknown_1", event}}));
+  // One summary file: its name and entries are the summary suite's business.
+  const std::filesystem::path files = root + "/log/DiagnosticLogs/Audio/Reporting";
+  EXPECT_EQ(std::distance(std::filesystem::directory_iterator(files), {}), 1);
   EXPECT_TRUE(std::filesystem::is_empty(root + "/lib/spool"));
 }
 

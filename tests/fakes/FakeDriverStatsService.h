@@ -89,7 +89,7 @@ class FakeDriverStatsService final : public DriverStatsService {
   std::vector<Channel> channels_;  // index = id
   std::map<Query, Failure> copyFailures_;
   std::map<Query, Failure> sampleFailures_;
-  std::optional<Failure> deltaFailure_;
+  std::map<Query, Failure> deltaFailures_;  // under the empty query
   std::vector<Query> noChannels_;
   std::map<DriverSubscription, Query> subscriptions_;
   DriverSubscription nextSubscription_ = 100;
