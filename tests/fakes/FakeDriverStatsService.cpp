@@ -51,22 +51,6 @@ void FakeDriverStatsService::AnswerNoChannels(Name group, Name subgroup) {
   noChannels_.emplace_back(std::move(group), std::move(subgroup));
 }
 
-std::vector<FakeDriverStatsService::DeltaCall> FakeDriverStatsService::DeltaCalls() const {
-  std::lock_guard lock(mutex_);
-  return deltaCalls_;
-}
-
-int FakeDriverStatsService::CreateSubscriptionCalls() const {
-  std::lock_guard lock(mutex_);
-  return createSubscriptionCalls_;
-}
-
-std::vector<std::pair<FakeDriverStatsService::Name, FakeDriverStatsService::Name>>
-FakeDriverStatsService::Queries() const {
-  std::lock_guard lock(mutex_);
-  return queries_;
-}
-
 bool FakeDriverStatsService::Fire(std::map<Query, Failure>& failures, const Query& query,
                                   OptionalError* error) {
   const auto it = failures.find(query);
