@@ -231,14 +231,6 @@ TEST_F(ClientLibraryE2eTest, BadRequestsAndRefusalsAreErrorsAndTheConnectionStay
   EXPECT_EQ(binary.error().domain, protocol::kProtocolErrorDomain);
   EXPECT_EQ(binary.error().serviceCode, 6);
 
-  testing::WriteFileAtomically(service.DefaultsPath(), "disable_reporting = true\n");
-  ASSERT_TRUE(service.WaitForLog("re-reading tavrin defaults")) << service.Log();
-  auto disabled = client->sendMessage({{"a", 1}}, 1, 1, std::nullopt, kWait);
-  ASSERT_FALSE(disabled);
-  // Its domain and code reach tavrinctl's message, checked in its e2e suite.
-  EXPECT_EQ(disabled.error().code, Errc::kOperationError);
-  EXPECT_NE(disabled.error().message.find("disable_reporting"), std::string::npos);
-
   EXPECT_TRUE(client->connected());
   EXPECT_TRUE(client->createReportingSession(31, kWait));
 }
@@ -299,6 +291,7 @@ TEST_F(ClientLibraryE2eTest, KillServiceIsAnsweredByTheServiceEnding) {
   auto killed = client->killService(kWait);
   EXPECT_TRUE(killed) << killed.error().message;
   EXPECT_EQ(service.WaitForExit(), 2);
+  EXPECT_EQ(service.LogCount("DESTROYING SERVICE"), 1u);
   EXPECT_FALSE(client->connected());
 }
 

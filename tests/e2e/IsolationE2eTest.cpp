@@ -13,8 +13,6 @@
 #include <algorithm>
 #include <chrono>
 #include <csignal>
-#include <cstdlib>
-#include <filesystem>
 #include <fstream>
 #include <functional>
 #include <memory>
@@ -368,68 +366,6 @@ TEST(IsolationLimitsE2eTest, ManyClientsThatNeverReadCannotExhaustTheService) {
   EXPECT_GT(service.LogCount("the largest reply backlog"), 0u) << "the total was never enforced";
   EXPECT_EQ(service.Stop(), 0);
   EXPECT_EQ(service.LogCount("reply backlog 0"), 0u) << service.Log();
-}
-
-// A store whose file system fills up drops records, says so once with the reason and counts them,
-// and takes writes again as soon as there is room, without a restart. The state directory is a
-// small tmpfs of its own, so the test needs root (mount).
-TEST_F(IsolationE2eTest, AFullStoreDropsAndCountsThenWritesAgainWhenThereIsRoom) {
-  TavrindProcess service;
-  const std::string lib = service.root() + "/lib";
-  std::filesystem::create_directories(lib);
-  if (::system(("mount -t tmpfs -o size=2m tmpfs " + lib + " 2>/dev/null").c_str()) != 0) {
-    GTEST_SKIP() << "cannot mount a tmpfs here";
-  }
-  struct Unmount {
-    std::string path;
-    ~Unmount() { (void)::system(("umount -l " + path).c_str()); }
-  } unmount{lib};
-  ASSERT_TRUE(service.Start()) << service.Log();
-  ASSERT_TRUE(testing::WaitUntil([&] { return Mode(service.DatabasePath()) != 0xFFFFu; }));
-  TestClient client(service.SocketPath());
-  uint64_t call = 0;
-  auto send = [&](int count, const std::string& tag) {
-    for (int i = 0; i < count; ++i) {
-      const auto status = Ask(client, ++call, Message({{tag, std::string(2000, 'x')}}));
-      if (status != protocol::Status::kOk) return false;
-    }
-    return true;
-  };
-  auto rows = [&](const std::string& tag) {
-    auto found = testing::QueryStore(
-        service.DatabasePath(),
-        "SELECT count(*) FROM single_messages WHERE payload LIKE '%\"" + tag + "\"%'");
-    return found.empty() ? std::string("?") : found[0][0];
-  };
-  ASSERT_TRUE(send(5, "before")) << service.Log();
-  ASSERT_TRUE(testing::WaitUntil([&] { return rows("before") == "5"; })) << service.Log();
-
-  // Fill what is left of the file system.
-  const std::string filler = lib + "/filler";
-  {
-    std::ofstream out(filler, std::ios::binary);
-    const std::string block(64 * 1024, '\0');
-    while (out.write(block.data(), block.size())) {
-    }
-  }
-  ASSERT_TRUE(send(200, "full")) << "the service must go on answering while it drops";
-  ASSERT_TRUE(service.WaitForLog("records are dropped until a write succeeds again"))
-      << service.Log();
-  EXPECT_EQ(service.LogCount("records are dropped until a write succeeds again"), 1u);
-
-  std::filesystem::remove(filler);
-  // The first batch after the room came back is written through a new connection.
-  ASSERT_TRUE(testing::WaitUntil([&] {
-    return send(1, "after") && service.LogCount("is written again") == 1;
-  })) << service.Log();
-  ASSERT_TRUE(send(20, "after2"));
-  EXPECT_TRUE(testing::WaitUntil([&] { return rows("after2") == "20"; })) << service.Log();
-  EXPECT_EQ(rows("before"), "5");
-  const std::string log = service.Log();
-  const size_t again = log.find("is written again (");
-  ASSERT_NE(again, std::string::npos);
-  EXPECT_GT(std::stoul(log.substr(again + 18)), 0u) << "the dropped records were not counted";
-  EXPECT_EQ(service.Stop(), 0) << service.Log();
 }
 
 // Settings fail closed: a file that does not parse at start, or a switch of the wrong type, never

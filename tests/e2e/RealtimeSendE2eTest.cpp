@@ -10,7 +10,6 @@
 #include <pthread.h>
 #include <unistd.h>
 
-#include <atomic>
 #include <csignal>
 #include <cstdlib>
 #include <filesystem>

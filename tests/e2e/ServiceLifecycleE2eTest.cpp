@@ -1,6 +1,7 @@
-// How the service's process ends on request and starts from a socket passed to it. The held
-// start answer, the store's rows and their commit before a SIGTERM exit are covered by the
-// protocol, client library and concurrent clients suites.
+// How the service's process stops, recovers after a kill, talks to its service manager and starts
+// from a socket passed to it. killService's exit is in the client library suite; the held start
+// answer, the store's rows and their commit before a SIGTERM exit are covered by the protocol,
+// client library and concurrent clients suites.
 
 #include <gtest/gtest.h>
 
@@ -9,10 +10,8 @@
 #include <sys/un.h>
 
 #include <csignal>
-#include <cstdio>
 #include <cstdlib>
 #include <filesystem>
-#include <fstream>
 #include <functional>
 
 #include "tests/support/StoreFiles.h"
@@ -23,16 +22,6 @@ namespace {
 
 using testing::TavrindProcess;
 using testing::TestClient;
-
-TEST(ServiceLifecycleE2eTest, KillServiceEndsTheProcessWithStatusTwoAndNoReply) {
-  TavrindProcess service;
-  ASSERT_TRUE(service.Start()) << service.Log();
-  TestClient client(service.SocketPath());
-  client.Send(1, protocol::KillService{});
-  EXPECT_FALSE(client.Read(std::chrono::milliseconds(2000)).has_value());
-  EXPECT_EQ(service.WaitForExit(), 2);
-  EXPECT_EQ(service.LogCount("DESTROYING SERVICE"), 1u);
-}
 
 // Single messages of the "alarms" service type wait up to 59 s on a timer; a SIGTERM sends the
 // ones still waiting instead of dropping them.
@@ -57,8 +46,8 @@ TEST(ServiceLifecycleE2eTest, SigtermSendsTheAlarmsMessagesStillHeldBack) {
 }
 
 // A session open when the service is killed: the next start sends its summary, marked as
-// recovered in the store and in the summary file's name, covering every message the store had
-// committed, and removes the spool it came from.
+// recovered in the store, covering every message the store had committed, writes its summary
+// file and removes the spool it came from.
 TEST(ServiceLifecycleE2eTest, AfterSigkillTheNextStartSendsTheOpenSessionsSummary) {
   const std::string root = testing::MakeTempDirectory("tavrin-e2e-");
   testing::WriteFileAtomically(root + "/etc/device.toml", "InternalBuild = true\n");
@@ -108,18 +97,9 @@ TEST(ServiceLifecycleE2eTest, AfterSigkillTheNextStartSendsTheOpenSessionsSummar
   EXPECT_EQ(testing::QueryStoreColumn(service.DatabasePath(),
                                       "SELECT count(*) FROM sessions WHERE recovered = 1"),
             std::vector<std::string>{"1"});
-
-  std::vector<std::string> files;
-  for (const auto& entry :
-       std::filesystem::directory_iterator(root + "/log/DiagnosticLogs/Audio/Reporting")) {
-    files.push_back(entry.path().filename().string());
-  }
-  ASSERT_EQ(files.size(), 1u);
-  EXPECT_TRUE(files[0].ends_with("-tavrin-unknown-haptics-recovered.json")) << files[0];
-  std::ifstream in(root + "/log/DiagnosticLogs/Audio/Reporting/" + files[0]);
-  const Value file = Value::parse(in);
-  ASSERT_EQ(file.size(), size_t(kMessages + 2));
-  EXPECT_EQ(file[kMessages + 1], (Value{{"Undefined_Unknown_1", event}}));
+  // One summary file: its name and entries are the summary suite's business.
+  const std::filesystem::path files = root + "/log/DiagnosticLogs/Audio/Reporting";
+  EXPECT_EQ(std::distance(std::filesystem::directory_iterator(files), {}), 1);
   EXPECT_TRUE(std::filesystem::is_empty(root + "/lib/spool"));
 }
 
@@ -129,9 +109,7 @@ TEST(ServiceLifecycleE2eTest, TellsTheServiceManagerItIsReadyAliveAndStopping) {
   const std::string directory = testing::MakeTempDirectory("tavrin-notify-");
   const std::string path = directory + "/notify.sock";
   const int manager = ::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  std::snprintf(address.sun_path, sizeof address.sun_path, "%s", path.c_str());
+  sockaddr_un address = testing::UnixAddress(path);
   ASSERT_EQ(::bind(manager, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
   const timeval wait{0, 100'000};
   ::setsockopt(manager, SOL_SOCKET, SO_RCVTIMEO, &wait, sizeof wait);
@@ -145,13 +123,7 @@ TEST(ServiceLifecycleE2eTest, TellsTheServiceManagerItIsReadyAliveAndStopping) {
       if (size > 0) heard += std::string(buffer, size_t(size)) + "\n";
     }
   };
-  auto count = [&](const std::string& needle) {
-    size_t n = 0;
-    for (size_t at = heard.find(needle); at != std::string::npos; at = heard.find(needle, at + 1)) {
-      ++n;
-    }
-    return n;
-  };
+  auto count = [&](const std::string& needle) { return testing::Occurrences(heard, needle); };
 
   TavrindProcess service;
   ::setenv("NOTIFY_SOCKET", path.c_str(), 1);

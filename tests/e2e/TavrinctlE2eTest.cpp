@@ -125,8 +125,11 @@ TEST(TavrinctlE2eTest, RecordFromAHereDocumentLeavesRowsAndASummaryThatEventsAnd
   EXPECT_EQ(rows[1]["payload"], Json({{"level", 5}, {"route", "speaker"}}));
   EXPECT_EQ(rows[2]["payload"]["level"], "3,5");
 
-  const std::vector<Json> files = JsonLines(Sh(ctl + " --json summaries").out);
-  ASSERT_EQ(files.size(), 1u);
+  // The summary file is written on the session's queue, not in step with the store.
+  std::vector<Json> files;
+  ASSERT_TRUE(WaitUntil([&] {
+    return (files = JsonLines(Sh(ctl + " --json summaries").out)).size() == 1;
+  })) << files.size();
   const std::string name = files[0]["name"];
   EXPECT_NE(name.find("-tavrin-player-haptics.json"), std::string::npos) << name;
   const Outcome show = Sh(ctl + " summaries show latest");

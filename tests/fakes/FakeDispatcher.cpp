@@ -50,7 +50,7 @@ struct FakeDispatcher::State {
 
 namespace {
 
-class FakeQueue final : public SerialQueue {
+class FakeQueue final : public SerialQueue, public std::enable_shared_from_this<FakeQueue> {
  public:
   FakeQueue(const std::shared_ptr<FakeDispatcher::State>& state, std::string label,
             QualityOfService qos)
@@ -71,7 +71,7 @@ class FakeQueue final : public SerialQueue {
     if (state->closed) return;
     // The fire function holds the queue, as a pending timer does in the real dispatcher.
     state->delayed.emplace(state->NextKeyLocked(delay),
-                           [self = shared_from_this_queue(), work = std::move(work)]() mutable {
+                           [self = shared_from_this(), work = std::move(work)]() mutable {
                              self->Async(std::move(work));
                            });
   }
@@ -106,26 +106,15 @@ class FakeQueue final : public SerialQueue {
 
   bool BelongsTo(const FakeDispatcher::State* state) const { return state_.lock().get() == state; }
 
-  std::shared_ptr<FakeQueue> shared_from_this_queue() { return self_.lock(); }
-  void SetSelf(const std::shared_ptr<FakeQueue>& self) { self_ = self; }
-
   // Guarded by State::mutex.
   std::deque<std::pair<uint64_t, Work>> items;
   unsigned suspensions = 0;
 
  private:
   const std::weak_ptr<FakeDispatcher::State> state_;
-  std::weak_ptr<FakeQueue> self_;
   const std::string label_;
   const QualityOfService qos_;
 };
-
-std::shared_ptr<FakeQueue> MakeQueue(const std::shared_ptr<FakeDispatcher::State>& state,
-                                     std::string label, QualityOfService qos) {
-  auto queue = std::make_shared<FakeQueue>(state, std::move(label), qos);
-  queue->SetSelf(queue);
-  return queue;
-}
 
 // Shared by a timer and the work it has handed to its queue.
 struct TimerState {
@@ -192,14 +181,14 @@ FakeDispatcher::FakeDispatcher()
     : ownClock_(std::make_unique<FakeClock>()),
       clock_(*ownClock_),
       state_(std::make_shared<State>(clock_)),
-      background_(*(state_->background =
-                        MakeQueue(state_, kBackgroundLabel, QualityOfService::kBackground))) {}
+      background_(*(state_->background = std::make_shared<FakeQueue>(
+                        state_, kBackgroundLabel, QualityOfService::kBackground))) {}
 
 FakeDispatcher::FakeDispatcher(FakeClock& clock)
     : clock_(clock),
       state_(std::make_shared<State>(clock_)),
-      background_(*(state_->background =
-                        MakeQueue(state_, kBackgroundLabel, QualityOfService::kBackground))) {}
+      background_(*(state_->background = std::make_shared<FakeQueue>(
+                        state_, kBackgroundLabel, QualityOfService::kBackground))) {}
 
 FakeDispatcher::~FakeDispatcher() {
   std::vector<std::shared_ptr<FakeQueue>> queues;
@@ -221,7 +210,7 @@ FakeDispatcher::~FakeDispatcher() {
 }
 
 SerialQueuePtr FakeDispatcher::CreateSerialQueue(std::string label, QualityOfService qos) {
-  auto queue = MakeQueue(state_, std::move(label), qos);
+  auto queue = std::make_shared<FakeQueue>(state_, std::move(label), qos);
   std::lock_guard lock(state_->mutex);
   state_->queues.push_back(queue);
   return queue;

@@ -43,28 +43,12 @@ void FakeDriverStatsService::FailCreateSamples(Name group, Name subgroup, Failur
 
 void FakeDriverStatsService::FailCreateSamplesDelta(Failure failure) {
   std::lock_guard lock(mutex_);
-  deltaFailure_ = failure;
+  deltaFailures_[{}] = failure;
 }
 
 void FakeDriverStatsService::AnswerNoChannels(Name group, Name subgroup) {
   std::lock_guard lock(mutex_);
   noChannels_.emplace_back(std::move(group), std::move(subgroup));
-}
-
-std::vector<FakeDriverStatsService::DeltaCall> FakeDriverStatsService::DeltaCalls() const {
-  std::lock_guard lock(mutex_);
-  return deltaCalls_;
-}
-
-int FakeDriverStatsService::CreateSubscriptionCalls() const {
-  std::lock_guard lock(mutex_);
-  return createSubscriptionCalls_;
-}
-
-std::vector<std::pair<FakeDriverStatsService::Name, FakeDriverStatsService::Name>>
-FakeDriverStatsService::Queries() const {
-  std::lock_guard lock(mutex_);
-  return queries_;
 }
 
 bool FakeDriverStatsService::Fire(std::map<Query, Failure>& failures, const Query& query,
@@ -141,11 +125,7 @@ std::optional<DriverSampleSet> FakeDriverStatsService::CreateSamplesDelta(
   std::lock_guard lock(mutex_);
   deltaCalls_.push_back(
       DeltaCall{earlier ? std::optional<DriverSampleSet>(*earlier) : std::nullopt, current});
-  if (deltaFailure_ && deltaFailure_->times != 0) {
-    if (deltaFailure_->times > 0) --deltaFailure_->times;
-    if (error != nullptr) *error = Error{kErrorDomain, deltaFailure_->code, "injected failure"};
-    if (!deltaFailure_->withResult) return std::nullopt;
-  }
+  if (Fire(deltaFailures_, {}, error) && !deltaFailures_[{}].withResult) return std::nullopt;
   std::unordered_map<size_t, int64_t> before;
   if (earlier != nullptr) {
     for (const auto& sample : earlier->at("samples")) {

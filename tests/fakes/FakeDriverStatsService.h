@@ -51,10 +51,10 @@ class FakeDriverStatsService final : public DriverStatsService {
     std::optional<DriverSampleSet> earlier;  // none when null was passed
     DriverSampleSet current;
   };
-  std::vector<DeltaCall> DeltaCalls() const;
-  int CreateSubscriptionCalls() const;
+  std::vector<DeltaCall> DeltaCalls() const { return Locked(deltaCalls_); }
+  int CreateSubscriptionCalls() const { return Locked(createSubscriptionCalls_); }
   // The queries CopyChannelsInGroup was asked, in order.
-  std::vector<std::pair<Name, Name>> Queries() const;
+  std::vector<std::pair<Name, Name>> Queries() const { return Locked(queries_); }
 
   std::optional<DriverChannels> CopyChannelsInGroup(const std::optional<std::string>& group,
                                                     const std::optional<std::string>& subgroup,
@@ -82,6 +82,11 @@ class FakeDriverStatsService final : public DriverStatsService {
     int64_t value = 0;
   };
   using Query = std::pair<Name, Name>;
+  template <typename T>
+  T Locked(const T& member) const {
+    std::lock_guard lock(mutex_);
+    return member;
+  }
   // True (and *error filled) when the scripted failure for `query` fires now; consumes one use.
   static bool Fire(std::map<Query, Failure>& failures, const Query& query, OptionalError* error);
 
@@ -89,7 +94,7 @@ class FakeDriverStatsService final : public DriverStatsService {
   std::vector<Channel> channels_;  // index = id
   std::map<Query, Failure> copyFailures_;
   std::map<Query, Failure> sampleFailures_;
-  std::optional<Failure> deltaFailure_;
+  std::map<Query, Failure> deltaFailures_;  // under the empty query
   std::vector<Query> noChannels_;
   std::map<DriverSubscription, Query> subscriptions_;
   DriverSubscription nextSubscription_ = 100;

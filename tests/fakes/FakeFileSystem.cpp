@@ -145,16 +145,6 @@ std::vector<std::string> FakeFileSystem::ListFiles(const std::string& path) {
   return names;
 }
 
-void FakeFileSystem::FailCreateDirectories(OptionalError error) {
-  std::lock_guard lock(mutex_);
-  createError_ = std::move(error);
-}
-
-void FakeFileSystem::FailWrites(OptionalError error) {
-  std::lock_guard lock(mutex_);
-  writeError_ = std::move(error);
-}
-
 void FakeFileSystem::AddDirectory(const std::string& path, unsigned mode) {
   std::lock_guard lock(mutex_);
   AddDirectoryLocked(Normalize(path), mode);
@@ -171,26 +161,6 @@ std::optional<std::string> FakeFileSystem::ReadFile(const std::string& path) con
   const auto found = files_.find(Normalize(path));
   if (found == files_.end()) return std::nullopt;
   return found->second;
-}
-
-std::map<std::string, std::string> FakeFileSystem::Files() const {
-  std::lock_guard lock(mutex_);
-  return files_;
-}
-
-std::map<std::string, unsigned> FakeFileSystem::Directories() const {
-  std::lock_guard lock(mutex_);
-  return directories_;
-}
-
-std::vector<std::pair<std::string, unsigned>> FakeFileSystem::CreateDirectoriesCalls() const {
-  std::lock_guard lock(mutex_);
-  return createCalls_;
-}
-
-std::vector<std::string> FakeFileSystem::WriteCalls() const {
-  std::lock_guard lock(mutex_);
-  return writeCalls_;
 }
 
 }  // namespace tavrin::testing

@@ -1,6 +1,5 @@
 #pragma once
 
-#include <cstddef>
 #include <map>
 #include <memory>
 #include <mutex>
@@ -39,24 +38,36 @@ class FakeFileSystem final : public FileSystem {
 
   // Every CreateDirectories call, or every committed write, fails with `error` while it is set (and
   // changes nothing).
-  void FailCreateDirectories(OptionalError error);
-  void FailWrites(OptionalError error);
+  void FailCreateDirectories(OptionalError error) { Set(createError_, std::move(error)); }
+  void FailWrites(OptionalError error) { Set(writeError_, std::move(error)); }
 
   // Adds a directory (and its parents) directly, as if it had been there before.
   void AddDirectory(const std::string& path, unsigned mode = 0755);
 
   std::optional<std::string> ReadFile(const std::string& path) const;
   // Every file by path.
-  std::map<std::string, std::string> Files() const;
+  std::map<std::string, std::string> Files() const { return Locked(files_); }
   // Every directory by path, with its mode.
-  std::map<std::string, unsigned> Directories() const;
-  std::vector<std::pair<std::string, unsigned>> CreateDirectoriesCalls() const;
-  std::vector<std::string> WriteCalls() const;
+  std::map<std::string, unsigned> Directories() const { return Locked(directories_); }
+  std::vector<std::pair<std::string, unsigned>> CreateDirectoriesCalls() const {
+    return Locked(createCalls_);
+  }
+  std::vector<std::string> WriteCalls() const { return Locked(writeCalls_); }
 
   static std::string Normalize(std::string_view path);
 
  private:
   class Writer;
+  template <typename T>
+  T Locked(const T& member) const {
+    std::lock_guard lock(mutex_);
+    return member;
+  }
+  template <typename T>
+  void Set(T& member, T value) {
+    std::lock_guard lock(mutex_);
+    member = std::move(value);
+  }
   void AddDirectoryLocked(const std::string& path, unsigned mode);
   // Checks a write of `path` and records the call.
   OptionalError CheckWriteLocked(const std::string& path);

@@ -53,29 +53,9 @@ LogHandle FakeLogSystem::RegisterLogScope(bool enabled, uint32_t code, std::stri
 
 LogScope& FakeLogSystem::DefaultLog() { return *defaultScope_; }
 
-void FakeLogSystem::FailRegistrations(bool fail) {
-  std::lock_guard lock(mutex_);
-  failRegistrations_ = fail;
-}
-
-void FakeLogSystem::SetVerbose(bool verbose) {
-  std::lock_guard lock(mutex_);
-  verbose_ = verbose;
-}
-
-bool FakeLogSystem::Verbose() const {
-  std::lock_guard lock(mutex_);
-  return verbose_;
-}
-
 void FakeLogSystem::Append(const std::string& scope, LogLevel level, std::string_view text) {
   std::lock_guard lock(mutex_);
   lines_.push_back(LoggedLine{scope, level, std::string(text)});
-}
-
-std::vector<LoggedLine> FakeLogSystem::Lines() const {
-  std::lock_guard lock(mutex_);
-  return lines_;
 }
 
 std::vector<LoggedLine> FakeLogSystem::Matching(std::string_view needle) const {
@@ -98,11 +78,6 @@ size_t FakeLogSystem::Count(std::string_view needle, LogLevel level) const {
 void FakeLogSystem::Clear() {
   std::lock_guard lock(mutex_);
   lines_.clear();
-}
-
-std::map<std::string, FakeLogSystem::Registration> FakeLogSystem::Registrations() const {
-  std::lock_guard lock(mutex_);
-  return registrations_;
 }
 
 }  // namespace tavrin::testing

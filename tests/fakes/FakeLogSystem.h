@@ -30,10 +30,10 @@ class FakeLogSystem final : public LogSystem {
   LogScope& DefaultLog() override;
 
   // Makes RegisterLogScope answer nullptr, as a failed registration does.
-  void FailRegistrations(bool fail);
-  void SetVerbose(bool verbose);
+  void FailRegistrations(bool fail) { Set(failRegistrations_, fail); }
+  void SetVerbose(bool verbose) { Set(verbose_, verbose); }
 
-  std::vector<LoggedLine> Lines() const;
+  std::vector<LoggedLine> Lines() const { return Locked(lines_); }
   // Lines whose text contains `needle` (and, when given, have `level`).
   std::vector<LoggedLine> Matching(std::string_view needle) const;
   size_t Count(std::string_view needle) const;
@@ -49,12 +49,22 @@ class FakeLogSystem final : public LogSystem {
     std::string verbosityKey;
     int level;
   };
-  std::map<std::string, Registration> Registrations() const;
+  std::map<std::string, Registration> Registrations() const { return Locked(registrations_); }
 
  private:
   class Scope;
   void Append(const std::string& scope, LogLevel level, std::string_view text);
-  bool Verbose() const;
+  bool Verbose() const { return Locked(verbose_); }
+  template <typename T>
+  T Locked(const T& member) const {
+    std::lock_guard lock(mutex_);
+    return member;
+  }
+  template <typename T>
+  void Set(T& member, T value) {
+    std::lock_guard lock(mutex_);
+    member = std::move(value);
+  }
 
   mutable std::mutex mutex_;
   std::vector<LoggedLine> lines_;

@@ -27,17 +27,6 @@ void FakeTelvoroSession::StartConfiguration(std::function<void(const BackendList
   }
 }
 
-bool FakeTelvoroSession::AnswerDiscovery(const BackendList& backends) {
-  std::function<void(const BackendList&)> done;
-  {
-    std::lock_guard lock(mutex_);
-    done = std::exchange(pendingDiscovery_, nullptr);
-  }
-  if (!done) return false;
-  done(backends);
-  return true;
-}
-
 // A refused message is dropped as by a full queue; an accepted one counts as committed at once.
 bool FakeTelvoroSession::SendSessionMessage(uint16_t category, uint16_t type,
                                             const Dictionary& payload, Error* error,
@@ -71,7 +60,16 @@ std::string FakeTelvoroSession::Description() const {
 
 size_t FakeTelvoroService::AnswerPendingDiscoveries(const BackendList& backends) {
   size_t answered = 0;
-  for (const auto& session : Sessions()) answered += session->AnswerDiscovery(backends) ? 1 : 0;
+  for (const auto& session : Sessions()) {
+    std::function<void(const BackendList&)> done;
+    {
+      std::lock_guard lock(session->mutex_);
+      done = std::exchange(session->pendingDiscovery_, nullptr);
+    }
+    if (!done) continue;
+    done(backends);
+    ++answered;
+  }
   return answered;
 }
 

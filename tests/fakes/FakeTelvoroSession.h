@@ -37,8 +37,6 @@ class FakeTelvoroSession final : public TelvoroSession {
   void FlushMessages(std::function<void(const OptionalError&)> done) override;
   std::string Description() const override;
 
-  // Answers a discovery that is still waiting; false when there is none.
-  bool AnswerDiscovery(const BackendList& backends);
   bool DiscoveryPending() const { return static_cast<bool>(Locked(pendingDiscovery_)); }
 
   const Dictionary& SessionInfo() const { return sessionInfo_; }
@@ -51,6 +49,7 @@ class FakeTelvoroSession final : public TelvoroSession {
   std::vector<size_t> MessagesAtFlush() const { return Locked(messagesAtFlush_); }
 
  private:
+  friend class FakeTelvoroService;
   template <typename T>
   T Locked(const T& member) const {
     std::lock_guard lock(mutex_);

@@ -47,29 +47,13 @@ class Pack {
 
   // `bits` is the value in two's complement; the format keeps its low bytes.
   Pack& integer(IntFormat format, uint64_t bits) {
-    switch (format) {
-      case IntFormat::kPositiveFixint:
-        return raw({static_cast<uint8_t>(bits & 0x7f)});
-      case IntFormat::kNegativeFixint:
-        return raw({static_cast<uint8_t>(0xe0 | (bits & 0x1f))});
-      case IntFormat::kUint8:
-        return big(0xcc, bits, 1);
-      case IntFormat::kUint16:
-        return big(0xcd, bits, 2);
-      case IntFormat::kUint32:
-        return big(0xce, bits, 4);
-      case IntFormat::kUint64:
-        return big(0xcf, bits, 8);
-      case IntFormat::kInt8:
-        return big(0xd0, bits, 1);
-      case IntFormat::kInt16:
-        return big(0xd1, bits, 2);
-      case IntFormat::kInt32:
-        return big(0xd2, bits, 4);
-      case IntFormat::kInt64:
-        return big(0xd3, bits, 8);
+    if (format == IntFormat::kPositiveFixint) return raw({static_cast<uint8_t>(bits & 0x7f)});
+    if (format == IntFormat::kNegativeFixint) {
+      return raw({static_cast<uint8_t>(0xe0 | (bits & 0x1f))});
     }
-    return *this;
+    // uint8..uint64 are 0xcc..0xcf and int8..int64 0xd0..0xd3, of 1, 2, 4 and 8 bytes.
+    const int index = static_cast<int>(format) - static_cast<int>(IntFormat::kUint8);
+    return big(static_cast<uint8_t>(0xcc + index), bits, 1 << (index % 4));
   }
   // Smallest unsigned or fix format for a non-negative number.
   Pack& uint(uint64_t value) {

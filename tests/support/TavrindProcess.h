@@ -4,23 +4,16 @@
 // e2e test executable can use it without another library.
 
 #include <fcntl.h>
-#include <poll.h>
 #include <signal.h>
-#include <sys/socket.h>
-#include <sys/stat.h>
-#include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <chrono>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
+#include <iterator>
 #include <optional>
-#include <sstream>
 #include <string>
-#include <thread>
-#include <variant>
 #include <vector>
 
 #include "tests/support/TestClient.h"
@@ -76,13 +69,7 @@ class TavrindProcess {
       ::execv(raw[0], raw.data());
       ::_exit(127);
     }
-    const auto deadline = std::chrono::steady_clock::now() + kE2eTimeout;
-    while (std::chrono::steady_clock::now() < deadline) {
-      if (Exited()) return false;
-      if (CanConnect()) return true;
-      std::this_thread::sleep_for(std::chrono::milliseconds(20));
-    }
-    return false;
+    return WaitUntil([&] { return Exited() || TestClient(SocketPath()).connected(); }) && pid_ > 0;
   }
 
   // Sends `signal` and waits for the exit status (nullopt when it did not exit in time).
@@ -93,36 +80,17 @@ class TavrindProcess {
   }
 
   std::optional<int> WaitForExit() {
-    const auto deadline = std::chrono::steady_clock::now() + kE2eTimeout;
-    while (std::chrono::steady_clock::now() < deadline) {
-      if (Exited()) return exitStatus_;
-      std::this_thread::sleep_for(std::chrono::milliseconds(10));
-    }
-    return std::nullopt;
+    return WaitUntil([&] { return Exited(); }) ? exitStatus_ : std::nullopt;
   }
 
   std::string Log() const {
     std::ifstream in(logPath_);
-    std::stringstream text;
-    text << in.rdbuf();
-    return text.str();
+    return {std::istreambuf_iterator<char>(in), {}};
   }
-  size_t LogCount(const std::string& needle) const {
-    const std::string log = Log();
-    size_t count = 0;
-    for (size_t at = log.find(needle); at != std::string::npos; at = log.find(needle, at + 1)) {
-      ++count;
-    }
-    return count;
-  }
+  size_t LogCount(const std::string& needle) const { return Occurrences(Log(), needle); }
   // Waits until the log holds `needle` at least `count` times.
   bool WaitForLog(const std::string& needle, size_t count = 1) const {
-    const auto deadline = std::chrono::steady_clock::now() + kE2eTimeout;
-    while (std::chrono::steady_clock::now() < deadline) {
-      if (LogCount(needle) >= count) return true;
-      std::this_thread::sleep_for(std::chrono::milliseconds(20));
-    }
-    return false;
+    return WaitUntil([&] { return LogCount(needle) >= count; });
   }
 
   const std::string& root() const { return root_; }
@@ -132,7 +100,6 @@ class TavrindProcess {
   std::string DatabasePath() const { return root_ + "/lib/tavrin.db"; }
   std::string DefaultsPath() const { return root_ + "/etc/com.quorvex.tavrin.toml"; }
   pid_t pid() const { return pid_; }
-  std::optional<int> exitStatus() const { return exitStatus_; }
 
  private:
   bool Exited() {
@@ -144,18 +111,6 @@ class TavrindProcess {
       return true;
     }
     return false;
-  }
-
-  bool CanConnect() const {
-    const int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    const std::string path = SocketPath();
-    std::snprintf(address.sun_path, sizeof(address.sun_path), "%s", path.c_str());
-    const bool connected =
-        ::connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof(address)) == 0;
-    ::close(fd);
-    return connected;
   }
 
   std::string root_;

@@ -31,13 +31,27 @@ inline std::string MakeTempDirectory(const char* prefix) {
   return pattern;
 }
 
+inline sockaddr_un UnixAddress(const std::string& path) {
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  std::snprintf(address.sun_path, sizeof(address.sun_path), "%s", path.c_str());
+  return address;
+}
+
+// How many times `needle` occurs in `text`.
+inline size_t Occurrences(const std::string& text, const std::string& needle) {
+  size_t count = 0;
+  for (size_t at = text.find(needle); at != std::string::npos; at = text.find(needle, at + 1)) {
+    ++count;
+  }
+  return count;
+}
+
 // A unix socket bound at `path`, listening when `listen` is set (-1 on failure). Closed unheard,
 // it leaves the file a service that is gone leaves behind.
 inline int BindUnixSocket(const std::string& path, bool listen) {
   const int fd = ::socket(AF_UNIX, SOCK_STREAM, 0);
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  std::snprintf(address.sun_path, sizeof(address.sun_path), "%s", path.c_str());
+  sockaddr_un address = UnixAddress(path);
   if (::bind(fd, reinterpret_cast<sockaddr*>(&address), sizeof(address)) != 0 ||
       (listen && ::listen(fd, 16) != 0)) {
     ::close(fd);
@@ -63,9 +77,7 @@ class TestClient {
  public:
   explicit TestClient(const std::string& socketPath) {
     fd_ = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    std::snprintf(address.sun_path, sizeof(address.sun_path), "%s", socketPath.c_str());
+    sockaddr_un address = UnixAddress(socketPath);
     connected_ = ::connect(fd_, reinterpret_cast<sockaddr*>(&address), sizeof(address)) == 0;
   }
   ~TestClient() { Close(); }

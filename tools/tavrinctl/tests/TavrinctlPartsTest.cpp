@@ -31,6 +31,18 @@ void WriteFile(const std::string& path, const std::string& text) {
   std::ofstream(path, std::ios::binary) << text;
 }
 
+// Runs `sql` on the store at `path`, creating it, as the service's writer would leave it.
+void ExecSql(const std::string& path, const std::string& sql) {
+  sqlite3* db = nullptr;
+  ASSERT_EQ(sqlite3_open(path.c_str(), &db), SQLITE_OK);
+  EXPECT_EQ(sqlite3_exec(db, sql.c_str(), nullptr, nullptr, nullptr), SQLITE_OK) << sql;
+  sqlite3_close(db);
+}
+
+constexpr const char* kMessagesTable =
+    "CREATE TABLE session_messages(row INTEGER PRIMARY KEY, session_row INTEGER, reporter_id "
+    "INTEGER, category INTEGER, type INTEGER, payload TEXT, received_at REAL);";
+
 TEST(TavrinctlParsersTest, TimeBoundsAreAbsoluteWithoutAUnitAndRelativeToNowWithOne) {
   const double now = 1'700'000'000.0;
   std::string error;
@@ -224,30 +236,23 @@ class TavrinctlStoreTest : public ::testing::Test {
  protected:
   void SetUp() override {
     path_ = directory_.path("tavrin.db");
-    sqlite3* db = nullptr;
-    ASSERT_EQ(sqlite3_open(path_.c_str(), &db), SQLITE_OK);
-    EXPECT_EQ(
-        sqlite3_exec(
-            db,
-            "CREATE TABLE sessions(row INTEGER PRIMARY KEY, reporter_id INTEGER, session_info "
-            "TEXT, user_info TEXT, created_at REAL, flushed_at REAL);"
-            "CREATE TABLE session_messages(row INTEGER PRIMARY KEY, session_row INTEGER, "
-            "reporter_id INTEGER, category INTEGER, type INTEGER, payload TEXT, received_at REAL);"
+    ExecSql(
+        path_,
+        "CREATE TABLE sessions(row INTEGER PRIMARY KEY, reporter_id INTEGER, session_info "
+        "TEXT, user_info TEXT, created_at REAL, flushed_at REAL);" +
+            std::string(kMessagesTable) +
             "CREATE TABLE single_messages(row INTEGER PRIMARY KEY, session_info TEXT, user_info "
             "TEXT, category INTEGER, type INTEGER, payload TEXT, received_at REAL);"
             "CREATE TABLE analytics_events(row INTEGER PRIMARY KEY, name TEXT, payload TEXT, "
             "received_at REAL);"
-            "CREATE TABLE power_events(row INTEGER PRIMARY KEY, agent INTEGER, name TEXT, payload "
-            "TEXT, received_at REAL);"
+            "CREATE TABLE power_events(row INTEGER PRIMARY KEY, agent INTEGER, name TEXT, "
+            "payload TEXT, received_at REAL);"
             "INSERT INTO sessions VALUES(1, 7, '{\"ServiceName\":\"generic\"}', '{}', 100, NULL);"
             "INSERT INTO session_messages VALUES(1, 1, 7, 1, 0, '{\"level\":3}', 101.0);"
             "INSERT INTO session_messages VALUES(2, 1, 8, 1, 0, 'not json', 104.0);"
             "INSERT INTO single_messages VALUES(1, '{}', '{}', 2, 0, '{\"alone\":1}', 102.0);"
             "INSERT INTO analytics_events VALUES(1, 'com.quorvex.tavrin.x', '{\"n\":1}', 103);"
-            "INSERT INTO power_events VALUES(1, 4, 'Mediane_Haptics', '{}', 101.0);",
-            nullptr, nullptr, nullptr),
-        SQLITE_OK);
-    sqlite3_close(db);
+            "INSERT INTO power_events VALUES(1, 4, 'Mediane_Haptics', '{}', 101.0);");
   }
 
   // The rows a query set up by `setup` answers, as table#row.
@@ -320,9 +325,8 @@ class TavrinctlReportTest : public ::testing::Test {
   void SetUp() override {
     std::string sql =
         "BEGIN; CREATE TABLE sessions(row INTEGER PRIMARY KEY, reporter_id INTEGER, session_info "
-        "TEXT, user_info TEXT, created_at REAL, flushed_at REAL, recovered INTEGER);"
-        "CREATE TABLE session_messages(row INTEGER PRIMARY KEY, session_row INTEGER, "
-        "reporter_id INTEGER, category INTEGER, type INTEGER, payload TEXT, received_at REAL);"
+        "TEXT, user_info TEXT, created_at REAL, flushed_at REAL, recovered INTEGER);" +
+        std::string(kMessagesTable) +
         "INSERT INTO sessions VALUES(1, 7, '{}', '{\"ServiceName\":\"a_session\"}', 1000, 1100, 1);"
         "INSERT INTO sessions VALUES(2, 7, '{}', '{}', 2000, NULL, 0);";
     auto message = [&](int session, int category, int type, std::string_view payload, double at) {
@@ -340,10 +344,7 @@ class TavrinctlReportTest : public ::testing::Test {
             R"("device_orientation_time":"2,50"})",
             1099.5);
     message(2, 1, 0, R"({"level":1})", 2001);
-    sqlite3* db = nullptr;
-    ASSERT_EQ(sqlite3_open(directory_.path("tavrin.db").c_str(), &db), SQLITE_OK);
-    EXPECT_EQ(sqlite3_exec(db, (sql + "COMMIT;").c_str(), nullptr, nullptr, nullptr), SQLITE_OK);
-    sqlite3_close(db);
+    ExecSql(directory_.path("tavrin.db"), sql + "COMMIT;");
   }
 
   ReportSession Session(int64_t row) {

@@ -7,7 +7,6 @@
 
 #include <gtest/gtest.h>
 
-#include "Statistics/RuvoReportingDriverUtility.h"
 #include "tests/fakes/FakeLogSystem.h"
 #include "tests/support/TempCountersTree.h"
 
@@ -76,10 +75,12 @@ class CountersTreeDriverStatsTest : public ::testing::Test {
 };
 
 // Groups and subgroups come in name order, a group's own channels first. Dot names (a writer's
-// temporary file) are never channels, and names that would leave the root match nothing.
+// temporary file) and files below a subgroup are never channels, and names that would leave the
+// root match nothing.
 TEST_F(CountersTreeDriverStatsTest, AbsentNamesMatchAnyAndNoNameLeavesTheRoot) {
   for (auto rel : {"Speaker/temperature", "Speaker/MCA/resets", "Other/MCA/resets",
-                   "Haptics/Stats/kicks", "Haptics/clicks", "Haptics/Other/hums", ".hidden/c"}) {
+                   "Haptics/Stats/kicks", "Haptics/clicks", "Haptics/Other/hums", ".hidden/c",
+                   "Haptics/Stats/Deep/x"}) {  // below a subgroup: never a channel
     tree_.write(rel, 1);
   }
   std::ofstream(tree_.path("Haptics/.clicks.tmp")) << "1\n";
@@ -212,24 +213,6 @@ TEST_F(CountersTreeDriverStatsTest, AQueryThatFoundNothingSeesTheTreeWhenItAppea
   EXPECT_EQ(Read(Samples()), (Values{{"resets", 2}, {"xruns", 4}}));
   // A name that can never be in the tree is not worth looking for again.
   EXPECT_EQ(service_.ChannelCount(*service_.CopyChannelsInGroup("..", {}, 0, &error)), 0);
-}
-
-// The same through the service's driver table, which subscribes once at start: a session that
-// starts after the tree appeared gets its counters.
-TEST_F(CountersTreeDriverStatsTest, TheDriverTableSubscribedBeforeTheTreeExistedReadsItLater) {
-  tree_.remove("");
-  RuvoReportingDriverUtility::ResetLogScopeForTesting();
-  RuvoReportingDriverUtility utility(service_);
-  EXPECT_EQ(utility.ioChannelSubscriptions().size(), 4u);
-  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(utility.getSnapShot()), std::nullopt);
-  tree_.write("Speaker/xruns", 5);
-  tree_.write("Haptics/Stats/kicks", 1);
-  const Dictionary start = utility.getSnapShot();
-  tree_.write("Speaker/xruns", 8);
-  tree_.write("Speaker/Amp/MCA/deep", 1);  // below a subgroup: never a channel
-  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(start),
-            (Dictionary{{"Speaker_xruns", 3}}));
-  RuvoReportingDriverUtility::ResetLogScopeForTesting();
 }
 
 }  // namespace
