@@ -9,6 +9,8 @@ packages=(
   g++ cmake ninja-build pkg-config git ccache make
   # tests, benchmarks, formatting
   libgtest-dev libgmock-dev libbenchmark-dev clang-format clang-tidy
+  # the report opened in a real browser (headless), by a Python driver
+  chromium python3
   # libraries of the service
   libasio-dev libspdlog-dev libfmt-dev libsystemd-dev systemtap-sdt-dev libtomlplusplus-dev
   nlohmann-json3-dev libsqlite3-dev sqlite3 librdkafka-dev libsdbus-c++-dev libcli11-dev

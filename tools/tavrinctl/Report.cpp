@@ -423,6 +423,8 @@ std::string RenderReportHtml(const ReportSession& session) {
       "<title>tavrin session {0} (reporter {1})</title>\n<style>body{{font:14px sans-serif;"
       "margin:1em 2em}}table{{border-collapse:collapse}}td,th{{border:1px solid #ccc;"
       "padding:2px 6px;text-align:left;vertical-align:top}}td{{overflow-wrap:anywhere}}"
+      // Long values must not squeeze the key column down to one character.
+      "td:first-child{{min-width:16em}}"
       "svg{{display:block;margin:4px 0}}</style></head><body>\n"
       "<h1>Session {0} of reporter {1}</h1>\n<table>\n",
       session.row, reporter);
