@@ -379,11 +379,12 @@ struct ThroughputResult {
 // every message before it) and, once the count is final, stops its session: the stop is timed on
 // its own, because it summarises everything the session aggregated.
 //
-// `stopped`, when given, is called with the store file's path once the service has stopped and
-// before its root is removed.
+// `stopped`, when given, is called once the service has stopped and before its root is removed,
+// with the store file's path and the number of analytics_events rows before the first message.
 inline std::optional<ThroughputResult> RunThroughput(
     const BenchMessage& message, int clients, int64_t messages, int64_t window,
-    const std::function<void(const std::string& databasePath)>& stopped = {}) {
+    const std::function<void(const std::string& databasePath, int64_t analyticsBefore)>& stopped =
+        {}) {
   TavrindProcess service;
   if (!service.Start()) {
     std::fprintf(stderr, "tavrind did not start: %s\n", service.Log().c_str());
@@ -523,7 +524,7 @@ inline std::optional<ThroughputResult> RunThroughput(
   connections.clear();
   if (!StopService(service)) return std::nullopt;
   result.analyticsRows = store.Count("analytics_events") - analyticsBefore;
-  if (stopped) stopped(service.DatabasePath());
+  if (stopped) stopped(service.DatabasePath(), analyticsBefore);
   result.lossLines = LossLines(service);
   return result;
 }
