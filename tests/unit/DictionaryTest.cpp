@@ -7,6 +7,7 @@
 #include <cstdint>
 #include <limits>
 #include <string>
+#include <vector>
 
 namespace tavrin {
 namespace {
@@ -70,6 +71,23 @@ TEST(DictionaryTest, InvalidUtf8NeverThrows) {
   EXPECT_NO_THROW(ValueText(dictionary));
   EXPECT_EQ(ValueText(dictionary),
             "{\"ok\xEF\xBF\xBD\xEF\xBF\xBD\":[\"ok\xEF\xBF\xBD\xEF\xBF\xBD\"]}");
+}
+
+// The service writes its own JSON text; it must be the library's, byte for byte, whatever the
+// strings hold and whatever the numbers are.
+TEST(DictionaryTest, JsonTextIsTheLibrarysCompactDump) {
+  const std::vector<Value> values = {
+      Value::object(
+          {{"plain", "ascii text"}, {"a \"quote\"", "back\\slash"}, {"tab\t", "line\x1F"}}),
+      Value::array({"caf\xC3\xA9 \xE2\x82\xAC \xF0\x9F\x8E\xB5", "bad\xC3", "\x80", "\x7F", ""}),
+      Value::array({2.0, -0.0, 0.1, 1e300, 5e-324, -1.5e-7, 123456789.125, 1e15, 1e16}),
+      Value::array({std::numeric_limits<int64_t>::min(), std::numeric_limits<uint64_t>::max(), 0}),
+      Value::object({{"\xFF", Value::object({{"x", Value::array({true, false, nullptr})}})}}),
+      Value::binary({1, 2, 3}),
+  };
+  for (const Value& value : values) {
+    EXPECT_EQ(JsonText(value), value.dump(-1, ' ', false, Value::error_handler_t::replace));
+  }
 }
 
 TEST(DictionaryTest, FmtPrintsAValueInItsTextForm) {
