@@ -35,6 +35,12 @@ class SerialQueue : public WorkQueue {
   virtual void Resume() = 0;
   // True on the thread while it runs an item of this queue.
   virtual bool IsCurrent() const = 0;
+  // Runs `work` on the calling thread, before returning, when the queue is idle (nothing queued,
+  // nothing running, not suspended); otherwise as Async. For a caller that waits for the item's
+  // answer and whose thread may do the queue's short work itself: the item runs in its place in
+  // the queue's order, without a hand-over to another thread and back. Implementations without a
+  // cheaper road may queue it.
+  virtual void RunOrAsync(Work work) { Async(std::move(work)); }
 };
 using SerialQueuePtr = std::shared_ptr<SerialQueue>;
 

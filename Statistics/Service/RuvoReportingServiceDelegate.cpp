@@ -367,9 +367,15 @@ void RuvoReportingServerInstance::setClientProcessName(std::optional<std::string
   clientProcessName_ = std::move(name);
 }
 
-void RuvoReportingServerInstance::enqueue(std::function<void(RuvoReportingServerInstance&)> work) {
+void RuvoReportingServerInstance::enqueue(std::function<void(RuvoReportingServerInstance&)> work,
+                                          bool answerWaits) {
   if (!workQueue_) return;
-  workQueue_->Async([self = shared_from_this(), work = std::move(work)] { work(*self); });
+  auto item = [self = shared_from_this(), work = std::move(work)] { work(*self); };
+  if (answerWaits) {
+    workQueue_->RunOrAsync(std::move(item));
+  } else {
+    workQueue_->Async(std::move(item));
+  }
 }
 
 RuvoReportingSessionPtr RuvoReportingServerInstance::findReportingSessionForID(
@@ -471,11 +477,14 @@ void RuvoReportingServerInstance::sendMessage(
     const std::optional<std::vector<int64_t>>& reporterIDs, ErrorReply reply) {
   TLOG_DEBUG(RuvoReportingServiceDelegate::ServiceLog(), "sending message for reporter {}",
              reporterIDs ? JsonText(Value(*reporterIDs)) : std::string("(null)"));
-  enqueue([message, category, type, reporterIDs,
-           reply = std::move(reply)](RuvoReportingServerInstance& self) {
-    EmitTracePoint(trace::kClientSend);
-    self.sendMessageOnQueue(message, category, type, reporterIDs, reply);
-  });
+  const bool answerWaits = static_cast<bool>(reply);
+  enqueue(
+      [message, category, type, reporterIDs,
+       reply = std::move(reply)](RuvoReportingServerInstance& self) {
+        EmitTracePoint(trace::kClientSend);
+        self.sendMessageOnQueue(message, category, type, reporterIDs, reply);
+      },
+      answerWaits);
 }
 
 void RuvoReportingServerInstance::sendMessageOnQueue(

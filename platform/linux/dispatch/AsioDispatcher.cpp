@@ -169,6 +169,32 @@ class AsioSerialQueue final : public SerialQueue,
     });
   }
 
+  void RunOrAsync(Work work) override {
+    if (!work) return;
+    if (!core_->Accepting()) {
+      core_->CountDropped();
+      return;
+    }
+    bool runHere = false;
+    bool schedule = false;
+    {
+      std::lock_guard lock(mutex_);
+      core_->ItemsQueued();
+      if (!scheduled_ && suspensions_ == 0 && items_.empty()) {
+        // This thread is the queue's pump for one item: whatever comes meanwhile waits behind it.
+        runHere = scheduled_ = true;
+      } else {
+        items_.push_back(std::move(work));
+        if (!scheduled_ && suspensions_ == 0) schedule = scheduled_ = true;
+      }
+    }
+    if (runHere) {
+      Run(work);
+      schedule = HasMoreToRun();
+    }
+    if (schedule) SchedulePump();
+  }
+
   const std::string& Label() const override { return label_; }
   QualityOfService Qos() const override { return qos_; }
 
@@ -212,21 +238,30 @@ class AsioSerialQueue final : public SerialQueue,
         work = std::move(items_.front());
         items_.pop_front();
       }
-      const void* previous = tCurrentQueue;
-      tCurrentQueue = this;
-      core_->RunItem(label_, work);
-      work = nullptr;  // the item's captures are released while it still counts as current
-      tCurrentQueue = previous;
-      core_->ItemsGone();
+      Run(work);
     }
-    {
-      std::lock_guard lock(mutex_);
-      if (suspensions_ > 0 || items_.empty()) {
-        scheduled_ = false;
-        return;
-      }
+    if (HasMoreToRun()) SchedulePump();
+  }
+
+  // Runs one item taken off the queue by the caller, which holds scheduled_.
+  void Run(Work& work) {
+    const void* previous = tCurrentQueue;
+    tCurrentQueue = this;
+    core_->RunItem(label_, work);
+    work = nullptr;  // the item's captures are released while it still counts as current
+    tCurrentQueue = previous;
+    core_->ItemsGone();
+  }
+
+  // After a turn: true when items wait and may run (the caller then schedules a pump); else the
+  // caller's hold on scheduled_ ends here.
+  bool HasMoreToRun() {
+    std::lock_guard lock(mutex_);
+    if (suspensions_ > 0 || items_.empty()) {
+      scheduled_ = false;
+      return false;
     }
-    SchedulePump();
+    return true;
   }
 
   const std::shared_ptr<AsioDispatcher::Core> core_;
