@@ -158,6 +158,12 @@ class UnixClientConnection final : public ClientConnection,
           continue;
         }
         listener_.readGateStalls_.fetch_add(1, std::memory_order_relaxed);
+        if (reader_.Buffered() == 0) {
+          // Nothing of this connection is held yet: reading on holds at most one buffer of it,
+          // and lets a status request in.
+          Read();
+          return;
+        }
         gateTimer_.expires_after(UnixServiceListener::kReadGatePause);
         gateTimer_.async_wait([self = shared_from_this()](const asio::error_code& error) {
           if (!error && !self->ended_) self->HandleFrames();
