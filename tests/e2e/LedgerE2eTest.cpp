@@ -46,8 +46,10 @@ Value SettledStatus(TestClient& client, const TavrindProcess& service, int64_t r
   return status;
 }
 
+// Rows of client messages (categories 1 and 2), not of the summaries the service sends itself.
 std::string StoredMessages(const TavrindProcess& service) {
-  return testing::QueryStoreColumn(service.DatabasePath(), "SELECT count(*) FROM session_messages")
+  return testing::QueryStoreColumn(service.DatabasePath(),
+                                   "SELECT count(*) FROM session_messages WHERE category IN (1, 2)")
       .at(0);
 }
 
@@ -156,7 +158,7 @@ TEST(LedgerE2eTest, WithoutABackEndEveryMessageIsDroppedAsSuch) {
 }
 
 // A store that stalls (another program holds its write lock) while one client fans messages out to
-// hundreds of sessions and others send too: what the store's queue cannot take is dropped as
+// hundreds of sessions and others come and go: what the store's queue cannot take is dropped as
 // queue_full, and nothing else is lost. Then a store at its size bound: what does not fit is
 // dropped as write_failed. Both bounds are settings.
 TEST(LedgerE2eTest, AStalledStoreAndAFullStoreDropOnlyWhatTheirBoundsRefuse) {
@@ -188,7 +190,7 @@ TEST(LedgerE2eTest, AStalledStoreAndAFullStoreDropOnlyWhatTheirBoundsRefuse) {
     fanOut.SendNoReply(protocol::SendMessage{Dictionary{{"fan", i}}, 1, 0, ids});
   }
   std::vector<std::unique_ptr<TestClient>> others;
-  for (int64_t id : {1001, 1002}) {
+  for (int64_t id : {1001, 1002, 1003}) {
     auto& other = others.emplace_back(std::make_unique<TestClient>(service.SocketPath()));
     other->Send(1, protocol::CreateReportingSession{id});
     other->Send(2, protocol::StartReportingSessionForID{id});
@@ -197,6 +199,7 @@ TEST(LedgerE2eTest, AStalledStoreAndAFullStoreDropOnlyWhatTheirBoundsRefuse) {
           protocol::SendMessage{Dictionary{{"i", i}}, 1, 0, std::vector<int64_t>{id}});
     }
   }
+  others.back().reset();  // goes away with its messages still unread by the service
   // The writer waits for the lock (each try up to its busy timeout): the fan-out overflows the
   // queue meanwhile, and the lock is let go before the store would give the batch up. Every
   // client's reading waits meanwhile, but an operator's status request is still answered.
@@ -207,7 +210,7 @@ TEST(LedgerE2eTest, AStalledStoreAndAFullStoreDropOnlyWhatTheirBoundsRefuse) {
   })) << status.dump();
   sqlite3_exec(holder, "ROLLBACK", nullptr, nullptr, nullptr);
   sqlite3_close(holder);
-  status = SettledStatus(watcher, service, 3 * kSessions + 200);
+  status = SettledStatus(watcher, service, 3 * kSessions + 300);
   EXPECT_EQ(status["totals"]["dropped"].size(), 1u) << status.dump();
   const int64_t delivered = status["totals"]["delivered"].get<int64_t>();
   EXPECT_GT(delivered, 0) << "what the queue held is written once the store moves";
@@ -219,7 +222,7 @@ TEST(LedgerE2eTest, AStalledStoreAndAFullStoreDropOnlyWhatTheirBoundsRefuse) {
   for (int i = 0; i < 100; ++i) {
     fanOut.SendNoReply(protocol::SendMessage{big, 2, 0, std::vector<int64_t>{1}});
   }
-  status = SettledStatus(watcher, service, 3 * kSessions + 200 + 100);
+  status = SettledStatus(watcher, service, 3 * kSessions + 300 + 100);
   EXPECT_GT(status["totals"]["dropped"].value("write_failed", 0), 0) << status.dump();
   EXPECT_EQ(StoredMessages(service), std::to_string(status["totals"]["delivered"].get<int64_t>()));
   EXPECT_NE(service.Log().find("database or disk is full"), std::string::npos) << service.Log();
@@ -229,6 +232,12 @@ TEST(LedgerE2eTest, AStalledStoreAndAFullStoreDropOnlyWhatTheirBoundsRefuse) {
 // producer's message size is dropped as too_large at once, one the broker refuses as
 // delivery_failed once its report comes, and the rest are delivered when acknowledged.
 TEST(LedgerE2eTest, KafkaRefusalsAreDroppedByTheirReasonAndAcknowledgedRecordsDelivered) {
+#if defined(__SANITIZE_THREAD__)
+  // librdkafka's threads bypass the pthread calls ThreadSanitizer intercepts, so neither a
+  // ThreadSanitizer tavrind nor this program can run it; the Kafka back-end's own suite carries
+  // a shim for that and runs there.
+  GTEST_SKIP() << "librdkafka cannot run under ThreadSanitizer in the service";
+#endif
   rd_kafka_conf_t* conf = rd_kafka_conf_new();
   rd_kafka_conf_set(conf, "log_level", "3", nullptr, 0);
   rd_kafka_t* host = rd_kafka_new(RD_KAFKA_PRODUCER, conf, nullptr, 0);
