@@ -367,15 +367,9 @@ void RuvoReportingServerInstance::setClientProcessName(std::optional<std::string
   clientProcessName_ = std::move(name);
 }
 
-void RuvoReportingServerInstance::enqueue(std::function<void(RuvoReportingServerInstance&)> work,
-                                          bool answerWaits) {
+void RuvoReportingServerInstance::enqueue(std::function<void(RuvoReportingServerInstance&)> work) {
   if (!workQueue_) return;
-  auto item = [self = shared_from_this(), work = std::move(work)] { work(*self); };
-  if (answerWaits) {
-    workQueue_->RunOrAsync(std::move(item));
-  } else {
-    workQueue_->Async(std::move(item));
-  }
+  workQueue_->RunOrAsync([self = shared_from_this(), work = std::move(work)] { work(*self); });
 }
 
 RuvoReportingSessionPtr RuvoReportingServerInstance::findReportingSessionForID(
@@ -477,14 +471,11 @@ void RuvoReportingServerInstance::sendMessage(
     const std::optional<std::vector<int64_t>>& reporterIDs, ErrorReply reply) {
   TLOG_DEBUG(RuvoReportingServiceDelegate::ServiceLog(), "sending message for reporter {}",
              reporterIDs ? JsonText(Value(*reporterIDs)) : std::string("(null)"));
-  const bool answerWaits = static_cast<bool>(reply);
-  enqueue(
-      [message, category, type, reporterIDs,
-       reply = std::move(reply)](RuvoReportingServerInstance& self) {
-        EmitTracePoint(trace::kClientSend);
-        self.sendMessageOnQueue(message, category, type, reporterIDs, reply);
-      },
-      answerWaits);
+  enqueue([message, category, type, reporterIDs,
+           reply = std::move(reply)](RuvoReportingServerInstance& self) {
+    EmitTracePoint(trace::kClientSend);
+    self.sendMessageOnQueue(message, category, type, reporterIDs, reply);
+  });
 }
 
 void RuvoReportingServerInstance::sendMessageOnQueue(

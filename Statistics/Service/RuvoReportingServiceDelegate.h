@@ -160,10 +160,10 @@ class RuvoReportingServerInstance final
   RuvoReportingServerInstance(int32_t pid,
                               std::weak_ptr<RuvoReportingServiceDelegateProtocol> delegate,
                               PlatformServices& platform);
-  // Runs `work` on the shared work queue with this instance kept alive. When the client waits for
-  // its answer, an idle queue runs it at once on the caller's thread (the connection's), which
-  // spares the request a round trip through another thread; work nobody waits for is queued.
-  void enqueue(std::function<void(RuvoReportingServerInstance&)> work, bool answerWaits = true);
+  // Runs `work` on the shared work queue with this instance kept alive. An idle queue runs it at
+  // once on the caller's thread (the connection's), which spares the request a hand-over to a pool
+  // thread and back; a busy one queues it behind what waits.
+  void enqueue(std::function<void(RuvoReportingServerInstance&)> work);
   void sendMessageOnQueue(const Dictionary& message, uint32_t category, uint16_t type,
                           const std::optional<std::vector<int64_t>>& reporterIDs,
                           const ErrorReply& reply);
