@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "platform/DriverStatsService.h"
+#include "tests/fakes/GuardedState.h"
 
 namespace tavrin::testing {
 
@@ -21,7 +22,7 @@ namespace tavrin::testing {
 //   channels   {"query": {"group": .., "subgroup": ..}, "channels": [{"id": N, ...}, ...]}
 //   samples    {"samples": [{"id": N, "name": "x" | null, "value": V}, ...]}
 // Deltas match samples by "id"; an id missing from the earlier set counts from 0.
-class FakeDriverStatsService final : public DriverStatsService {
+class FakeDriverStatsService final : public DriverStatsService, private GuardedState {
  public:
   using Name = std::optional<std::string>;
 
@@ -82,15 +83,9 @@ class FakeDriverStatsService final : public DriverStatsService {
     int64_t value = 0;
   };
   using Query = std::pair<Name, Name>;
-  template <typename T>
-  T Locked(const T& member) const {
-    std::lock_guard lock(mutex_);
-    return member;
-  }
   // True (and *error filled) when the scripted failure for `query` fires now; consumes one use.
   static bool Fire(std::map<Query, Failure>& failures, const Query& query, OptionalError* error);
 
-  mutable std::mutex mutex_;
   std::vector<Channel> channels_;  // index = id
   std::map<Query, Failure> copyFailures_;
   std::map<Query, Failure> sampleFailures_;

@@ -10,6 +10,7 @@
 #include <vector>
 
 #include "platform/FileSystem.h"
+#include "tests/fakes/GuardedState.h"
 
 namespace tavrin::testing {
 
@@ -17,7 +18,7 @@ namespace tavrin::testing {
 // file system, a write needs its parent directory, and a path
 // cannot be both a file and a directory. Paths are absolute; repeated and trailing "/" are
 // ignored. Thread-safe.
-class FakeFileSystem final : public FileSystem {
+class FakeFileSystem final : public FileSystem, private GuardedState {
  public:
   static constexpr const char* kErrorDomain = "com.quorvex.tavrin.fake.files";
   static constexpr int64_t kNoSuchFile = 2;      // ENOENT
@@ -58,21 +59,10 @@ class FakeFileSystem final : public FileSystem {
 
  private:
   class Writer;
-  template <typename T>
-  T Locked(const T& member) const {
-    std::lock_guard lock(mutex_);
-    return member;
-  }
-  template <typename T>
-  void Set(T& member, T value) {
-    std::lock_guard lock(mutex_);
-    member = std::move(value);
-  }
   void AddDirectoryLocked(const std::string& path, unsigned mode);
   // Checks a write of `path` and records the call.
   OptionalError CheckWriteLocked(const std::string& path);
 
-  mutable std::mutex mutex_;
   std::map<std::string, std::string> files_;                   // guarded by mutex_
   std::map<std::string, unsigned> directories_{{"/", 0755}};   // guarded by mutex_
   OptionalError createError_;                                  // guarded by mutex_

@@ -7,6 +7,7 @@
 #include <vector>
 
 #include "platform/LogSystem.h"
+#include "tests/fakes/GuardedState.h"
 
 namespace tavrin::testing {
 
@@ -19,7 +20,7 @@ struct LoggedLine {
 // Records every line in memory. Installs itself as the process's log facility for its lifetime;
 // scopes it handed out write to the fake installed at the time of writing.
 // Scopes are verbose (debug lines pass) unless SetVerbose says otherwise.
-class FakeLogSystem final : public LogSystem {
+class FakeLogSystem final : public LogSystem, private GuardedState {
  public:
   FakeLogSystem();
   ~FakeLogSystem() override;
@@ -55,18 +56,7 @@ class FakeLogSystem final : public LogSystem {
   class Scope;
   void Append(const std::string& scope, LogLevel level, std::string_view text);
   bool Verbose() const { return Locked(verbose_); }
-  template <typename T>
-  T Locked(const T& member) const {
-    std::lock_guard lock(mutex_);
-    return member;
-  }
-  template <typename T>
-  void Set(T& member, T value) {
-    std::lock_guard lock(mutex_);
-    member = std::move(value);
-  }
 
-  mutable std::mutex mutex_;
   std::vector<LoggedLine> lines_;
   std::map<std::string, Registration> registrations_;
   bool failRegistrations_ = false;

@@ -12,6 +12,7 @@
 #include "base/Dictionary.h"
 #include "base/Error.h"
 #include "platform/TelvoroSession.h"
+#include "tests/fakes/GuardedState.h"
 
 namespace tavrin::testing {
 
@@ -26,7 +27,7 @@ struct FakeTelvoroMessage {
 
 // A TelvoroSession that records what it is given. Its discovery answer follows the mode its
 // service had when the session was created. Thread-safe; callbacks run outside its lock.
-class FakeTelvoroSession final : public TelvoroSession {
+class FakeTelvoroSession final : public TelvoroSession, private GuardedState {
  public:
   FakeTelvoroSession(FakeTelvoroService& service, size_t index, Dictionary sessionInfo,
                      Dictionary userInfo, std::vector<std::string> frameworksToCheck);
@@ -50,11 +51,6 @@ class FakeTelvoroSession final : public TelvoroSession {
 
  private:
   friend class FakeTelvoroService;
-  template <typename T>
-  T Locked(const T& member) const {
-    std::lock_guard lock(mutex_);
-    return member;
-  }
 
   FakeTelvoroService& service_;
   const size_t index_;
@@ -62,7 +58,6 @@ class FakeTelvoroSession final : public TelvoroSession {
   const Dictionary userInfo_;
   const std::vector<std::string> frameworks_;
 
-  mutable std::mutex mutex_;
   std::function<void(const BackendList&)> pendingDiscovery_;  // guarded by mutex_
   std::vector<FakeTelvoroMessage> messages_;                  // guarded by mutex_
   size_t refused_ = 0;                                        // guarded by mutex_
@@ -71,7 +66,7 @@ class FakeTelvoroSession final : public TelvoroSession {
 
 // The reporting back-ends, in memory: tokens, sessions, single messages, with a scriptable
 // discovery answer and injectable send and flush failures. Thread-safe.
-class FakeTelvoroService final : public TelvoroService {
+class FakeTelvoroService final : public TelvoroService, private GuardedState {
  public:
   enum class Discovery {
     kAnswerAtOnce,  // StartConfiguration calls back before it returns, with one back-end
@@ -114,18 +109,7 @@ class FakeTelvoroService final : public TelvoroService {
 
  private:
   friend class FakeTelvoroSession;
-  template <typename T>
-  T Locked(const T& member) const {
-    std::lock_guard lock(mutex_);
-    return member;
-  }
-  template <typename T>
-  void Set(T& member, T value) {
-    std::lock_guard lock(mutex_);
-    member = std::move(value);
-  }
 
-  mutable std::mutex mutex_;
   Discovery discovery_ = Discovery::kAnswerAtOnce;
   OptionalError sendError_;
   OptionalError flushError_;
