@@ -228,54 +228,12 @@ int main(int argc, char** argv) {
 
   out["throughput"] = tavrin::Value::array();
   for (const ThroughputResult& r : throughput) {
-    tavrin::Value cpu = tavrin::MakeDictionary();
-    for (const auto& [name, seconds] : r.cpuSeconds) cpu[name] = seconds;
-    tavrin::Value item = {{"clients", r.clients},
-                          {"window", r.window},
-                          {"messages", r.messages},
-                          {"committed", r.committed},
-                          {"sent_s", r.sentSeconds},
-                          {"accepted_s", r.acceptedSeconds},
-                          {"committed_s", r.committedSeconds},
-                          {"committed_per_s", r.rate},
-                          {"accepted_per_s", r.acceptedRate},
-                          {"stop_s", r.stopSeconds},
-                          {"service_cpu_s", cpu},
-                          {"service_cpu_us_per_message", r.cpuMicrosPerMessage},
-                          {"process_cpu_us_per_committed", r.processCpuMicrosPerCommitted},
-                          {"rss_before_kib", r.rssBeforeKiB},
-                          {"rss_counted_kib", r.rssCountedKiB},
-                          {"rss_stopped_kib", r.rssStoppedKiB},
-                          {"analytics_rows", r.analyticsRows},
-                          {"loss_lines", r.lossLines}};
+    tavrin::Value item = ToJson(r);
     if (pipe) item["ratio_to_socketpair"] = r.rate / pipe->rate;
     out["throughput"].push_back(item);
   }
-  if (latency) {
-    out["latency"] = {{"offered_per_s", latency->offeredRate},
-                      {"seconds", latency->seconds},
-                      {"sent", latency->sent},
-                      {"answered", latency->answered},
-                      {"p50_ms", latency->p50},
-                      {"p90_ms", latency->p90},
-                      {"p99_ms", latency->p99},
-                      {"p999_ms", latency->p999},
-                      {"max_ms", latency->max},
-                      {"send_lag_p50_ms", latency->lagP50},
-                      {"send_lag_p99_ms", latency->lagP99},
-                      {"loss_lines", latency->lossLines}};
-  }
-  if (memory) {
-    out["memory"] = {{"connections", memory->connections},
-                     {"sessions", memory->sessions},
-                     {"idle_kib", memory->idleKiB},
-                     {"connected_kib", memory->connectedKiB},
-                     {"sessions_kib", memory->sessionsKiB},
-                     {"peak_kib", memory->peakKiB},
-                     {"bytes_per_connection", memory->bytesPerConnection},
-                     {"bytes_per_session", memory->bytesPerSession},
-                     {"loss_lines", memory->lossLines}};
-  }
+  if (latency) out["latency"] = ToJson(*latency);
+  if (memory) out["memory"] = ToJson(*memory);
   if (pipe) {
     out["socketpair"] = {{"messages", pipe->messages},
                          {"seconds", pipe->seconds},

@@ -369,6 +369,30 @@ struct ThroughputResult {
   size_t lossLines = 0;
 };
 
+// The run as one JSON object, as both harnesses print it.
+inline Value ToJson(const ThroughputResult& r) {
+  Value cpu = MakeDictionary();
+  for (const auto& [name, seconds] : r.cpuSeconds) cpu[name] = seconds;
+  return {{"clients", r.clients},
+          {"window", r.window},
+          {"messages", r.messages},
+          {"committed", r.committed},
+          {"sent_s", r.sentSeconds},
+          {"accepted_s", r.acceptedSeconds},
+          {"committed_s", r.committedSeconds},
+          {"committed_per_s", r.rate},
+          {"accepted_per_s", r.acceptedRate},
+          {"stop_s", r.stopSeconds},
+          {"service_cpu_s", cpu},
+          {"service_cpu_us_per_message", r.cpuMicrosPerMessage},
+          {"process_cpu_us_per_committed", r.processCpuMicrosPerCommitted},
+          {"rss_before_kib", r.rssBeforeKiB},
+          {"rss_counted_kib", r.rssCountedKiB},
+          {"rss_stopped_kib", r.rssStoppedKiB},
+          {"analytics_rows", r.analyticsRows},
+          {"loss_lines", r.lossLines}};
+}
+
 // Sends `messages` fire-and-forget messages from `clients` connections, each to its own running
 // session, and counts their rows in the store. With a window, the senders keep at most `window`
 // messages sent and not yet committed (they watch the store, as no real client can): the rate the
@@ -544,6 +568,29 @@ struct LatencyResult {
   double afterP50 = 0, afterP99 = 0, afterP999 = 0, afterMax = 0;  // milliseconds
   size_t lossLines = 0;
 };
+
+// The steady figures, and those after the burst when there was one.
+inline Value ToJson(const LatencyResult& r) {
+  Value out = {{"offered_per_s", r.offeredRate},
+               {"seconds", r.seconds},
+               {"sent", r.sent},
+               {"answered", r.answered},
+               {"p50_ms", r.p50},
+               {"p90_ms", r.p90},
+               {"p99_ms", r.p99},
+               {"p999_ms", r.p999},
+               {"max_ms", r.max},
+               {"send_lag_p50_ms", r.lagP50},
+               {"send_lag_p99_ms", r.lagP99},
+               {"loss_lines", r.lossLines}};
+  if (r.burstMessages > 0) {
+    out["burst"] = {{"messages", r.burstMessages}, {"send_s", r.burstSendSeconds},
+                    {"after_s", r.afterSeconds},   {"requests", r.afterCount},
+                    {"p50_ms", r.afterP50},        {"p99_ms", r.afterP99},
+                    {"p999_ms", r.afterP999},      {"max_ms", r.afterMax}};
+  }
+  return out;
+}
 
 inline double Percentile(std::vector<double> values, double fraction) {
   if (values.empty()) return 0;
@@ -740,6 +787,18 @@ struct MemoryResult {
   double bytesPerConnection = 0;
   size_t lossLines = 0;
 };
+
+inline Value ToJson(const MemoryResult& r) {
+  return {{"connections", r.connections},
+          {"sessions", r.sessions},
+          {"idle_kib", r.idleKiB},
+          {"connected_kib", r.connectedKiB},
+          {"sessions_kib", r.sessionsKiB},
+          {"peak_kib", r.peakKiB},
+          {"bytes_per_connection", r.bytesPerConnection},
+          {"bytes_per_session", r.bytesPerSession},
+          {"loss_lines", r.lossLines}};
+}
 
 inline std::optional<MemoryResult> RunMemory(int connectionCount, int sessionsPerConnection) {
   TavrindProcess service;

@@ -908,15 +908,7 @@ int main(int argc, char** argv) {
           {name, "msg/s", run->rate, "SQLite alone", alone->messagesPerSecond, true, true, 0.5});
       figures.push_back({"2. CPU per committed message", "us", run->processCpuMicrosPerCommitted,
                          "SQLite alone", alone->cpuUsPerMessage, true, false, 4.0});
-      out["throughput"] = {{"clients", run->clients},
-                           {"window", run->window},
-                           {"messages", run->messages},
-                           {"committed", run->committed},
-                           {"committed_s", run->committedSeconds},
-                           {"committed_per_s", run->rate},
-                           {"process_cpu_us_per_committed", run->processCpuMicrosPerCommitted},
-                           {"analytics_rows", run->analyticsRows},
-                           {"loss_lines", run->lossLines}};
+      out["throughput"] = ToJson(*run);
       out["sqlite_alone"] = {{"messages", alone->messages},
                              {"analytics_events", alone->events},
                              {"transactions", alone->transactions},
@@ -953,26 +945,8 @@ int main(int argc, char** argv) {
                                " s from a " + Number(static_cast<double>(burst)) + "-message burst",
                            "ms", after[i], "steady", steady[i], false, false, afterGoals[i]});
       }
-      const auto asJson = [](const LatencyResult& r) {
-        return tavrin::Value{{"offered_per_s", r.offeredRate},
-                             {"seconds", r.seconds},
-                             {"sent", r.sent},
-                             {"p50_ms", r.p50},
-                             {"p90_ms", r.p90},
-                             {"p99_ms", r.p99},
-                             {"p999_ms", r.p999},
-                             {"max_ms", r.max},
-                             {"send_lag_p50_ms", r.lagP50},
-                             {"send_lag_p99_ms", r.lagP99}};
-      };
-      out["latency"]["tavrind"] = asJson(*service);
-      out["latency"]["tavrind"]["burst"] = {
-          {"messages", service->burstMessages}, {"send_s", service->burstSendSeconds},
-          {"after_s", service->afterSeconds},   {"requests", service->afterCount},
-          {"p50_ms", service->afterP50},        {"p99_ms", service->afterP99},
-          {"p999_ms", service->afterP999},      {"max_ms", service->afterMax}};
-      out["latency"]["tavrind"]["loss_lines"] = service->lossLines;
-      out["latency"]["echo"] = asJson(*echo);
+      out["latency"]["tavrind"] = ToJson(*service);
+      out["latency"]["echo"] = ToJson(*echo);
     } else {
       failed("3. latency");
     }
@@ -985,14 +959,7 @@ int main(int argc, char** argv) {
                              " sessions over " + std::to_string(connections) + " clients",
                          "MiB", static_cast<double>(memory->sessionsKiB) / 1024, "idle tavrind",
                          static_cast<double>(memory->idleKiB) / 1024, false, false, 64});
-      out["memory"] = {{"connections", memory->connections},
-                       {"sessions", memory->sessions},
-                       {"idle_kib", memory->idleKiB},
-                       {"connected_kib", memory->connectedKiB},
-                       {"sessions_kib", memory->sessionsKiB},
-                       {"peak_kib", memory->peakKiB},
-                       {"bytes_per_session", memory->bytesPerSession},
-                       {"bytes_per_connection", memory->bytesPerConnection}};
+      out["memory"] = ToJson(*memory);
     } else {
       failed("4. memory");
     }
