@@ -261,6 +261,13 @@ inline std::optional<SteadyClock::time_point> WaitForCount(Value value, int64_t 
 
 // Creates and starts session `reporterID` on `client` and waits until the service has run both.
 // The start goes with a nil call: its reply is held until the session stops.
+// Starts a fresh service; says why on stderr when it does not come up.
+inline bool StartService(TavrindProcess& service) {
+  if (service.Start()) return true;
+  std::fprintf(stderr, "tavrind did not start: %s\n", service.Log().c_str());
+  return false;
+}
+
 inline bool OpenSession(TestClient& client, int64_t reporterID) {
   if (!client.Send(1, protocol::CreateReportingSession{reporterID}) ||
       !ExpectReply(client, 1, "create")) {
@@ -410,10 +417,7 @@ inline std::optional<ThroughputResult> RunThroughput(
     const std::function<void(const std::string& databasePath, int64_t analyticsBefore)>& stopped =
         {}) {
   TavrindProcess service;
-  if (!service.Start()) {
-    std::fprintf(stderr, "tavrind did not start: %s\n", service.Log().c_str());
-    return std::nullopt;
-  }
+  if (!StartService(service)) return std::nullopt;
   const int64_t lastReporter = kFirstReporter + clients - 1;
   std::vector<std::unique_ptr<TestClient>> connections;
   for (int c = 0; c < clients; ++c) {
@@ -702,10 +706,7 @@ inline std::optional<LatencyResult> RunLatency(const BenchMessage& message, doub
                                                double seconds, int64_t burstMessages = 0,
                                                double afterSeconds = 0) {
   TavrindProcess service;
-  if (!service.Start()) {
-    std::fprintf(stderr, "tavrind did not start: %s\n", service.Log().c_str());
-    return std::nullopt;
-  }
+  if (!StartService(service)) return std::nullopt;
   TestClient client(service.SocketPath());
   if (!client.connected() || !OpenSession(client, kFirstReporter)) return std::nullopt;
   const bool burst = burstMessages > 0;
@@ -802,10 +803,7 @@ inline Value ToJson(const MemoryResult& r) {
 
 inline std::optional<MemoryResult> RunMemory(int connectionCount, int sessionsPerConnection) {
   TavrindProcess service;
-  if (!service.Start()) {
-    std::fprintf(stderr, "tavrind did not start: %s\n", service.Log().c_str());
-    return std::nullopt;
-  }
+  if (!StartService(service)) return std::nullopt;
   MemoryResult result;
   result.connections = connectionCount;
   result.sessions = int64_t{connectionCount} * sessionsPerConnection;
@@ -882,10 +880,7 @@ inline std::optional<LongSessionResult> RunLongSession(const BenchMessage& messa
   constexpr int64_t kEarlyMark = 10000;
   constexpr int kChunk = 500;
   TavrindProcess service;
-  if (!service.Start()) {
-    std::fprintf(stderr, "tavrind did not start: %s\n", service.Log().c_str());
-    return std::nullopt;
-  }
+  if (!StartService(service)) return std::nullopt;
   TestClient client(service.SocketPath());
   TestClient other(service.SocketPath());
   if (!client.connected() || !other.connected() || !OpenSession(client, kFirstReporter)) {

@@ -481,10 +481,7 @@ bool CallOverSocket(TestClient& client, protocol::Request& request, uint64_t cal
 
 std::optional<RoundTripResult> RoundTripsOfService(const BenchMessage& message, double seconds) {
   TavrindProcess service;
-  if (!service.Start()) {
-    std::fprintf(stderr, "tavrind did not start: %s\n", service.Log().c_str());
-    return std::nullopt;
-  }
+  if (!StartService(service)) return std::nullopt;
   TestClient client(service.SocketPath());
   if (!client.connected() || !OpenSession(client, kFirstReporter)) return std::nullopt;
   protocol::Request request{std::nullopt, MessageFor(message, kFirstReporter)};

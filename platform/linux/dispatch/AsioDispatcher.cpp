@@ -143,11 +143,7 @@ class AsioSerialQueue final : public SerialQueue,
   ~AsioSerialQueue() override { core_->ItemsGone(items_.size()); }
 
   void Async(Work work) override {
-    if (!work) return;
-    if (!core_->Accepting()) {
-      core_->CountDropped();
-      return;
-    }
+    if (!Admit(work)) return;
     bool schedule = false;
     {
       std::lock_guard lock(mutex_);
@@ -170,11 +166,7 @@ class AsioSerialQueue final : public SerialQueue,
   }
 
   void RunOrAsync(Work work) override {
-    if (!work) return;
-    if (!core_->Accepting()) {
-      core_->CountDropped();
-      return;
-    }
+    if (!Admit(work)) return;
     bool runHere = false;
     bool schedule = false;
     {
@@ -217,6 +209,14 @@ class AsioSerialQueue final : public SerialQueue,
   bool IsCurrent() const override { return tCurrentQueue == this; }
 
  private:
+  // False for no work, and for work offered after Shutdown (counted as dropped).
+  bool Admit(const Work& work) {
+    if (!work) return false;
+    if (core_->Accepting()) return true;
+    core_->CountDropped();
+    return false;
+  }
+
   void SchedulePump() {
     if (!core_->Post([self = shared_from_this()] { self->Pump(); })) {
       // The pool is gone; whatever is queued stays here and is freed with the queue.
