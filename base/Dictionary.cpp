@@ -92,6 +92,7 @@ void AppendJson(std::string& out, const Value& value) {
         out += "null";
         return;
       }
+      // The library's own shortest round-trip form ("2.0", "1e+20"), which its dump writes.
       char digits[64];
       const char* end = nlohmann::detail::to_chars(digits, digits + sizeof digits, number);
       out.append(digits, static_cast<size_t>(end - digits));

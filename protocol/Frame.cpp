@@ -36,33 +36,36 @@ void FrameReader::Append(std::span<const uint8_t> bytes) {
 FrameReader::Status FrameReader::Next() {
   body_ = {};
   if (failed_) return Status::kBadLength;
-  const size_t available = buffer_.size() - start_;
-  if (available < kFrameHeaderSize) return Status::kNeedMore;
-  const uint8_t* header = buffer_.data() + start_;
-  const uint32_t length = (uint32_t{header[0]} << 24) | (uint32_t{header[1]} << 16) |
-                          (uint32_t{header[2]} << 8) | uint32_t{header[3]};
-  if (length == 0 || length > frameLimit_) {
+  const std::optional<uint32_t> length = NextLength();
+  if (!length) return Status::kNeedMore;
+  if (*length == 0 || *length > frameLimit_) {
     failed_ = true;
-    badLength_ = length;
+    badLength_ = *length;
     buffer_.clear();
     buffer_.shrink_to_fit();
     start_ = 0;
     return Status::kBadLength;
   }
-  if (available - kFrameHeaderSize < length) return Status::kNeedMore;
-  body_ = std::span<const uint8_t>(buffer_.data() + start_ + kFrameHeaderSize, length);
-  start_ += kFrameHeaderSize + length;
+  if (buffer_.size() - start_ - kFrameHeaderSize < *length) return Status::kNeedMore;
+  body_ = std::span<const uint8_t>(buffer_.data() + start_ + kFrameHeaderSize, *length);
+  start_ += kFrameHeaderSize + *length;
   return Status::kFrame;
 }
 
 std::span<const uint8_t> FrameReader::Peek() const {
-  const size_t available = buffer_.size() - start_;
-  if (failed_ || available < kFrameHeaderSize) return {};
+  const std::optional<uint32_t> length = failed_ ? std::nullopt : NextLength();
+  if (!length || *length == 0 || *length > frameLimit_ ||
+      buffer_.size() - start_ - kFrameHeaderSize < *length) {
+    return {};
+  }
+  return std::span<const uint8_t>(buffer_.data() + start_ + kFrameHeaderSize, *length);
+}
+
+std::optional<uint32_t> FrameReader::NextLength() const {
+  if (buffer_.size() - start_ < kFrameHeaderSize) return std::nullopt;
   const uint8_t* header = buffer_.data() + start_;
-  const uint32_t length = (uint32_t{header[0]} << 24) | (uint32_t{header[1]} << 16) |
-                          (uint32_t{header[2]} << 8) | uint32_t{header[3]};
-  if (length == 0 || length > frameLimit_ || available - kFrameHeaderSize < length) return {};
-  return std::span<const uint8_t>(header + kFrameHeaderSize, length);
+  return (uint32_t{header[0]} << 24) | (uint32_t{header[1]} << 16) | (uint32_t{header[2]} << 8) |
+         uint32_t{header[3]};
 }
 
 bool FrameReader::InsideFrame() const { return !failed_ && buffer_.size() > start_; }

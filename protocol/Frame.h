@@ -2,6 +2,7 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <optional>
 #include <span>
 #include <string>
 #include <vector>
@@ -66,6 +67,9 @@ class FrameReader {
   size_t Buffered() const { return buffer_.size() - start_; }
 
  private:
+  // The length in the next header, once all of its bytes are buffered.
+  std::optional<uint32_t> NextLength() const;
+
   uint32_t frameLimit_;
   std::vector<uint8_t> buffer_;
   size_t start_ = 0;  // first byte not yet handed out
