@@ -9,16 +9,24 @@
 
 namespace tavrin {
 
-void RuvoReportingStratikBridge::handleEvent(const Dictionary& event, uint32_t category,
+void RuvoReportingStratikBridge::handleEvent(const PayloadPtr& event, uint32_t category,
                                              uint16_t type, const RuvoReportingSession& session) {
-  Dictionary payload = event.is_object() ? event : MakeDictionary();
   const Dictionary userInfo = session.userInfo();
-  payload["HostApplicationDisplayID"] = ApplicationNameFromUserInfo(&userInfo);
+  Value applicationName = ApplicationNameFromUserInfo(&userInfo);
   std::string name =
       fmt::format("com.quorvex.tavrin.{}.{}", CategoryName(category), TypeName(type));
-  // Nothing changes the payload after this point, so the builder may run on any thread, later.
-  auto prepared = std::make_shared<const Dictionary>(std::move(payload));
-  session.platform().analytics->SendEventLazy(name, [prepared] { return *prepared; });
+  // The event and the name never change, so the builder may run on any thread, later.
+  session.platform().analytics->SendEventLazy(
+      name, [event, applicationName = std::move(applicationName)] {
+        Dictionary payload = event->is_object() ? *event : MakeDictionary();
+        payload["HostApplicationDisplayID"] = applicationName;
+        return payload;
+      });
+}
+
+void RuvoReportingStratikBridge::handleEvent(const Dictionary& event, uint32_t category,
+                                             uint16_t type, const RuvoReportingSession& session) {
+  handleEvent(std::make_shared<const Dictionary>(event), category, type, session);
 }
 
 }  // namespace tavrin

@@ -15,8 +15,11 @@ class RuvoReportingStratikBridge {
   RuvoReportingStratikBridge() = delete;
 
   // Sends `event` (null counts as empty) with "HostApplicationDisplayID" set to the application
-  // name of the session's user info, through the session's platform analytics sink. The payload is
-  // prepared here; the sink's lazy builder only hands it over.
+  // name of the session's user info, through the session's platform analytics sink. The name is
+  // read here; the event's copy is made by the sink's lazy builder, so only when the sink's
+  // policy wants the event.
+  static void handleEvent(const PayloadPtr& event, uint32_t category, uint16_t type,
+                          const RuvoReportingSession& session);
   static void handleEvent(const Dictionary& event, uint32_t category, uint16_t type,
                           const RuvoReportingSession& session);
 };

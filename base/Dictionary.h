@@ -2,6 +2,7 @@
 
 #include <nlohmann/json.hpp>
 
+#include <memory>
 #include <string>
 
 #include <fmt/format.h>
@@ -13,6 +14,9 @@ namespace tavrin {
 // A value is one of: null, boolean, signed or unsigned integer, double, string, array, dictionary.
 using Value = nlohmann::ordered_json;
 using Dictionary = nlohmann::ordered_json;  // holds an object whenever it is called a dictionary
+// A client message once decoded never changes, so every session, record and sink it goes to
+// shares this one copy.
+using PayloadPtr = std::shared_ptr<const Dictionary>;
 
 // An empty dictionary (a JSON object, not null).
 Dictionary MakeDictionary();

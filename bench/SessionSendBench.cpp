@@ -90,7 +90,7 @@ class CountingBackend final : public TelvoroService {
     void StartConfiguration(std::function<void(const BackendList&)> done) override {
       done(std::vector<std::string>{"bench"});
     }
-    bool SendSessionMessage(uint16_t, uint16_t, const Dictionary&, Error*,
+    bool SendSessionMessage(uint16_t, uint16_t, const PayloadPtr&, Error*,
                             const DeliveryReceiptPtr&) override {
       received_.fetch_add(1, std::memory_order_release);
       return true;

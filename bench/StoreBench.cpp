@@ -63,7 +63,7 @@ void BM_StoreBatchedWal(benchmark::State& state) {
   const Dictionary payload = Payload();
   if (JsonText(payload).size() != 200) state.SkipWithError("payload is not 200 bytes");
   const auto record = std::make_shared<const ReportRecord>(
-      SessionMessageRecord{1, 42, 2, 7, payload, 1794806865.5});
+      SessionMessageRecord{1, 42, 2, 7, std::make_shared<const Dictionary>(payload), 1794806865.5});
   for (auto _ : state) {
     for (int i = 0; i < kRecordsPerIteration; ++i) store.Append(record);
     std::promise<void> committed;

@@ -47,7 +47,8 @@ class TelvoroSession {
   // Hands one message over; never blocks on I/O. False (and *error when given) when the message
   // could not be accepted. `receipt`, when given, is told exactly once what became of it (at
   // once when it is refused, later when it is committed or lost).
-  virtual bool SendSessionMessage(uint16_t category, uint16_t type, const Dictionary& payload,
+  // The payload is shared, never copied, by what keeps it.
+  virtual bool SendSessionMessage(uint16_t category, uint16_t type, const PayloadPtr& payload,
                                   Error* error, const DeliveryReceiptPtr& receipt = nullptr) = 0;
   // Calls `done` once everything handed over before is committed or acknowledged, with an error
   // when that failed.

@@ -42,7 +42,7 @@ void Dispatch(Request request, RuvoReportingServiceProtocol& service, ReplySende
                 return error ? EncodeOperationErrorReply(c, error->domain, error->code)
                              : EncodeNilReply(c);
               });
-          service.sendMessage(args.message, args.category, args.type, args.reporterIDs,
+          service.sendMessage(std::move(args.message), args.category, args.type, args.reporterIDs,
                               std::move(reply));
         } else if constexpr (std::is_same_v<T, StopReportingSessionForID>) {
           service.stopReportingSessionForID(args.reporterID, boolReply());

@@ -29,8 +29,8 @@ class RuvoReportingServiceProtocol {
   virtual void setConfiguration(const Dictionary& configuration, int64_t reporterID,
                                 BoolReply reply) = 0;                                // 4
   virtual void startReportingSessionForID(int64_t reporterID, BoolReply reply) = 0;  // 5
-  // `reporterIDs` absent means every running session.
-  virtual void sendMessage(const Dictionary& message, uint32_t category, uint16_t type,
+  // `reporterIDs` absent means every running session. The message is taken, not copied.
+  virtual void sendMessage(Dictionary message, uint32_t category, uint16_t type,
                            const std::optional<std::vector<int64_t>>& reporterIDs,
                            ErrorReply reply) = 0;                                   // 6
   virtual void stopReportingSessionForID(int64_t reporterID, BoolReply reply) = 0;  // 7

@@ -467,19 +467,19 @@ void RuvoReportingServerInstance::startReportingSessionForID(int64_t reporterID,
 }
 
 void RuvoReportingServerInstance::sendMessage(
-    const Dictionary& message, uint32_t category, uint16_t type,
+    Dictionary message, uint32_t category, uint16_t type,
     const std::optional<std::vector<int64_t>>& reporterIDs, ErrorReply reply) {
   TLOG_DEBUG(RuvoReportingServiceDelegate::ServiceLog(), "sending message for reporter {}",
              reporterIDs ? JsonText(Value(*reporterIDs)) : std::string("(null)"));
-  enqueue([message, category, type, reporterIDs,
-           reply = std::move(reply)](RuvoReportingServerInstance& self) {
+  enqueue([message = std::make_shared<const Dictionary>(std::move(message)), category, type,
+           reporterIDs, reply = std::move(reply)](RuvoReportingServerInstance& self) {
     EmitTracePoint(trace::kClientSend);
     self.sendMessageOnQueue(message, category, type, reporterIDs, reply);
   });
 }
 
 void RuvoReportingServerInstance::sendMessageOnQueue(
-    const Dictionary& message, uint32_t category, uint16_t type,
+    const PayloadPtr& message, uint32_t category, uint16_t type,
     const std::optional<std::vector<int64_t>>& reporterIDs, const ErrorReply& reply) {
   const LogHandle& log = RuvoReportingServiceDelegate::ServiceLog();
   auto delegate = delegate_.lock();
@@ -506,7 +506,7 @@ void RuvoReportingServerInstance::sendMessageOnQueue(
         continue;
       }
       RuvoReportingStratikBridge::handleEvent(message, category, type, *session);
-      RuvoReportingKelvaneUtility::handleEvent(message, category, type, *session);
+      RuvoReportingKelvaneUtility::handleEvent(*message, category, type, *session);
       received();
       session->sendMessage(message, category, type, false, nullptr, account_);
     }
@@ -530,13 +530,13 @@ void RuvoReportingServerInstance::sendMessageOnQueue(
       received();
       session->sendMessage(message, category, type, false, nullptr, account_);
       RuvoReportingStratikBridge::handleEvent(message, category, type, *session);
-      RuvoReportingKelvaneUtility::handleEvent(message, category, type, *session);
+      RuvoReportingKelvaneUtility::handleEvent(*message, category, type, *session);
     }
   } else {
     TLOG_DEFAULT(log, "no active reporting sessions found, sending as standalone");
     const std::optional<Dictionary> defaults = delegate->getDefaults();
     received();
-    RuvoReportingSession::sendSingleMessage(platform_, message, category, type,
+    RuvoReportingSession::sendSingleMessage(platform_, *message, category, type,
                                             service_type::kStandalone,
                                             defaults ? *defaults : Dictionary(), nullptr, account_);
   }

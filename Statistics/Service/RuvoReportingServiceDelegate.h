@@ -135,7 +135,7 @@ class RuvoReportingServerInstance final
   void setConfiguration(const Dictionary& configuration, int64_t reporterID,
                         BoolReply reply) override;
   void startReportingSessionForID(int64_t reporterID, BoolReply reply) override;
-  void sendMessage(const Dictionary& message, uint32_t category, uint16_t type,
+  void sendMessage(Dictionary message, uint32_t category, uint16_t type,
                    const std::optional<std::vector<int64_t>>& reporterIDs,
                    ErrorReply reply) override;
   void stopReportingSessionForID(int64_t reporterID, BoolReply reply) override;
@@ -164,7 +164,7 @@ class RuvoReportingServerInstance final
   // once on the caller's thread (the connection's), which spares the request a hand-over to a pool
   // thread and back; a busy one queues it behind what waits.
   void enqueue(std::function<void(RuvoReportingServerInstance&)> work);
-  void sendMessageOnQueue(const Dictionary& message, uint32_t category, uint16_t type,
+  void sendMessageOnQueue(const PayloadPtr& message, uint32_t category, uint16_t type,
                           const std::optional<std::vector<int64_t>>& reporterIDs,
                           const ErrorReply& reply);
   void stopOnQueue(int64_t reporterID);

@@ -38,16 +38,18 @@ std::string NameText(const std::optional<std::string>& name) {
   return name ? *name : std::string(kAbsentText);
 }
 
-// The payload with every " " in its keys replaced by "_". When two keys become equal, the later
-// one's value wins. `changed` tells whether any key had a blank.
-Dictionary CleanedPayload(const Dictionary& payload, bool* changed) {
+// The payload with every " " in its keys replaced by "_" (the payload itself when no key has
+// one). When two keys become equal, the later one's value wins. `changed` tells whether any key
+// had a blank.
+PayloadPtr CleanedPayload(const PayloadPtr& shared, bool* changed) {
   *changed = false;
-  if (payload.is_null()) return MakeDictionary();
+  const Dictionary& payload = *shared;
+  if (payload.is_null()) return std::make_shared<const Dictionary>(MakeDictionary());
   if (!payload.is_object()) {
     TLOG_ERROR(RuvoReportingSession::SessionLog(), "payload is not a dictionary, sending {{}}: {}",
                JsonText(payload));
     *changed = true;
-    return MakeDictionary();
+    return std::make_shared<const Dictionary>(MakeDictionary());
   }
   bool blanks = false;
   for (const auto& item : payload.items()) {
@@ -56,7 +58,7 @@ Dictionary CleanedPayload(const Dictionary& payload, bool* changed) {
       break;
     }
   }
-  if (!blanks) return payload;
+  if (!blanks) return shared;
   *changed = true;
   Dictionary cleaned = MakeDictionary();
   cleaned.get_ref<Dictionary::object_t&>().reserve(payload.size());
@@ -67,7 +69,7 @@ Dictionary CleanedPayload(const Dictionary& payload, bool* changed) {
     }
     cleaned[key] = item.value();
   }
-  return cleaned;
+  return std::make_shared<const Dictionary>(std::move(cleaned));
 }
 
 // Seconds as the dispatcher's delays take them.
@@ -380,7 +382,8 @@ void RuvoReportingSession::stop() {
         TLOG_DEFAULT(SessionLog(), "sending summary event for reporter {}", self->reporterID_);
         EmitTracePoint(trace::kMessageSent);
         bool changed = false;
-        auto cleaned = std::make_shared<const Dictionary>(CleanedPayload(*summary, &changed));
+        PayloadPtr cleaned =
+            CleanedPayload(std::make_shared<const Dictionary>(std::move(*summary)), &changed);
         lastEntry = MakeDictionary();
         lastEntry[summaryId] = *cleaned;
         self->deliver(cleaned, cleaned, kSummaryEventCategory, kSummaryEventType,
@@ -420,14 +423,20 @@ void RuvoReportingSession::sendMessage(const Dictionary& payload, uint32_t categ
 
 void RuvoReportingSession::sendMessage(const Dictionary& payload, uint32_t category, uint16_t type,
                                        bool sync, Reply reply, const DeliveryReceiptPtr& receipt) {
+  sendMessage(std::make_shared<const Dictionary>(payload), category, type, sync, std::move(reply),
+              receipt);
+}
+
+void RuvoReportingSession::sendMessage(const PayloadPtr& payload, uint32_t category, uint16_t type,
+                                       bool /*sync*/, Reply reply,
+                                       const DeliveryReceiptPtr& receipt) {
   TLOG_DEBUG(SessionLog(), "sending message for session owned by {}", reporterID_);
   bool changed = false;
-  auto cleaned = std::make_shared<const Dictionary>(CleanedPayload(payload, &changed));
+  PayloadPtr cleaned = CleanedPayload(payload, &changed);
   // The message as received is only shown by a debug line at delivery; it is kept apart only
   // when cleaning changed it and debug lines are on.
-  PayloadPtr received = changed && LogTarget(SessionLog()).ShouldLog(LogLevel::kDebug)
-                            ? std::make_shared<const Dictionary>(payload)
-                            : cleaned;
+  PayloadPtr received =
+      changed && LogTarget(SessionLog()).ShouldLog(LogLevel::kDebug) ? payload : cleaned;
   std::string messageId = messageIdForCategory(category, type);
   std::shared_ptr<SummaryTexts> texts;
   std::shared_ptr<SessionSpool> spool;
@@ -499,7 +508,7 @@ void RuvoReportingSession::deliver(const PayloadPtr& cleaned, const PayloadPtr& 
   // could act on, and the reply has long been given.
   Error error;
   if (session->SendSessionMessage(static_cast<uint16_t>(category & kPlatformCategoryMask), type,
-                                  *cleaned, &error, receipt)) {
+                                  cleaned, &error, receipt)) {
     TLOG_DEBUG(SessionLog(), "TelvoroAgent {} : message {} : category {} : type {}",
                session->Description(), *received, static_cast<int32_t>(category), type);
   }
@@ -797,9 +806,10 @@ void RuvoReportingSession::sendSingleMessage(PlatformServices& platform, const D
              static_cast<int>(serviceType));
 
   bool changed = false;
-  Dictionary cleaned = CleanedPayload(payload, &changed);
-  std::optional<Dictionary> received;
-  if (changed && LogTarget(SessionLog()).ShouldLog(LogLevel::kDebug)) received = payload;
+  auto shared = std::make_shared<const Dictionary>(payload);
+  PayloadPtr cleaned = CleanedPayload(shared, &changed);
+  PayloadPtr received =
+      changed && LogTarget(SessionLog()).ShouldLog(LogLevel::kDebug) ? shared : cleaned;
   Work send = [&platform, cleaned = std::move(cleaned), received = std::move(received), category,
                type, serviceType, reply = std::move(reply), receipt] {
     EmitTracePoint(trace::kMessageSent);
@@ -818,8 +828,8 @@ void RuvoReportingSession::sendSingleMessage(PlatformServices& platform, const D
     OptionalError result;
     if (platform.telvoro->SendOneMessage(sessionInfo, telvoroUserInfo,
                                          static_cast<uint16_t>(category & kPlatformCategoryMask),
-                                         type, cleaned, &error, receipt)) {
-      TLOG_DEBUG(SessionLog(), "message {} : category {} : type {}", received ? *received : cleaned,
+                                         type, *cleaned, &error, receipt)) {
+      TLOG_DEBUG(SessionLog(), "message {} : category {} : type {}", *received,
                  static_cast<int32_t>(category), type);
     } else {
       TLOG_ERROR(SessionLog(), "sendOneMessageWithSessionInfo {}", error.LocalizedDescription());

@@ -23,10 +23,6 @@
 
 namespace tavrin {
 
-// A payload as the session keeps it: cleaned once, then shared by the aggregation lists and the
-// delivery queued for it (nothing modifies it after it is made).
-using PayloadPtr = std::shared_ptr<const Dictionary>;
-
 // The summary event's texts, built as messages arrive so that a session's memory grows with its
 // distinct keys, not with its messages: per key, the text forms of its values joined with ",",
 // keys in the order first seen, the summary key first. A key's text that grows past kSpillBytes
@@ -118,6 +114,10 @@ class RuvoReportingSession : public std::enable_shared_from_this<RuvoReportingSe
   void sendMessage(const Dictionary& payload, uint32_t category, uint16_t type, Reply reply);
   // `receipt`, when given, is the sender's account: it is told what became of the message.
   void sendMessage(const Dictionary& payload, uint32_t category, uint16_t type, bool sync,
+                   Reply reply, const DeliveryReceiptPtr& receipt = nullptr);
+  // The same for a payload that others share: a payload that needs no cleaning is kept, not
+  // copied.
+  void sendMessage(const PayloadPtr& payload, uint32_t category, uint16_t type, bool sync,
                    Reply reply, const DeliveryReceiptPtr& receipt = nullptr);
   // Counts one message of this kind and returns its id "<category>_<type>_<n>". Call exactly once
   // per message.

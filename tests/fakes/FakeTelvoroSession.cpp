@@ -29,7 +29,7 @@ void FakeTelvoroSession::StartConfiguration(std::function<void(const BackendList
 
 // A refused message is dropped as by a full queue; an accepted one counts as committed at once.
 bool FakeTelvoroSession::SendSessionMessage(uint16_t category, uint16_t type,
-                                            const Dictionary& payload, Error* error,
+                                            const PayloadPtr& payload, Error* error,
                                             const DeliveryReceiptPtr& receipt) {
   OptionalError failure = service_.Locked(service_.sendError_);
   {
@@ -38,7 +38,7 @@ bool FakeTelvoroSession::SendSessionMessage(uint16_t category, uint16_t type,
       ++refused_;
       if (error != nullptr) *error = *failure;
     } else {
-      messages_.push_back(FakeTelvoroMessage{category, type, payload});
+      messages_.push_back(FakeTelvoroMessage{category, type, *payload});
     }
   }
   Settle(receipt, !failure, DropReason::kQueueFull);

@@ -33,7 +33,7 @@ class FakeTelvoroSession final : public TelvoroSession, private GuardedState {
                      Dictionary userInfo, std::vector<std::string> frameworksToCheck);
 
   void StartConfiguration(std::function<void(const BackendList&)> done) override;
-  bool SendSessionMessage(uint16_t category, uint16_t type, const Dictionary& payload, Error* error,
+  bool SendSessionMessage(uint16_t category, uint16_t type, const PayloadPtr& payload, Error* error,
                           const DeliveryReceiptPtr& receipt) override;
   void FlushMessages(std::function<void(const OptionalError&)> done) override;
   std::string Description() const override;

@@ -24,7 +24,7 @@ class MockService : public Protocol {
   MOCK_METHOD(void, getServiceNameForReporterID, (int64_t, ServiceTypeReply), (override));
   MOCK_METHOD(void, setConfiguration, (const Dictionary&, int64_t, BoolReply), (override));
   MOCK_METHOD(void, startReportingSessionForID, (int64_t, BoolReply), (override));
-  MOCK_METHOD(void, sendMessage, (const Dictionary&, uint32_t, uint16_t, const IDs&, ErrorReply),
+  MOCK_METHOD(void, sendMessage, (Dictionary, uint32_t, uint16_t, const IDs&, ErrorReply),
               (override));
   MOCK_METHOD(void, stopReportingSessionForID, (int64_t, BoolReply), (override));
   MOCK_METHOD(void, destroyReportingSession, (int64_t, BoolReply), (override));

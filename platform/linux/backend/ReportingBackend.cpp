@@ -20,7 +20,7 @@ struct JsonOf {
   Value operator()(const SessionMessageRecord& r) const {
     return Value{{"session_row", r.sessionRow}, {"reporter_id", OptionalNumber(r.reporterId)},
                  {"category", r.category},      {"type", r.type},
-                 {"payload", r.payload},        {"received_at", r.receivedAt}};
+                 {"payload", *r.payload},       {"received_at", r.receivedAt}};
   }
   Value operator()(const SingleMessageRecord& r) const {
     return Value{{"session_info", r.sessionInfo}, {"user_info", r.userInfo},

@@ -41,7 +41,7 @@ struct SessionMessageRecord {
   std::optional<int64_t> reporterId;
   uint16_t category = 0;
   uint16_t type = 0;
-  Dictionary payload;
+  PayloadPtr payload;  // never null
   double receivedAt = 0;
   // The client message this record carries is accounted for through it; none for the service's
   // own records.

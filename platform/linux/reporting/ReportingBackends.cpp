@@ -151,7 +151,7 @@ class BackendReportingService::Session final : public TelvoroSession {
         [this_service = &service_, done = std::move(done)] { done(this_service->UpBackends()); });
   }
 
-  bool SendSessionMessage(uint16_t category, uint16_t type, const Dictionary& payload, Error* error,
+  bool SendSessionMessage(uint16_t category, uint16_t type, const PayloadPtr& payload, Error* error,
                           const DeliveryReceiptPtr& receipt) override {
     return service_.DeliverOrFail(std::make_shared<const ReportRecord>(SessionMessageRecord{
                                       record_.row, record_.reporterId, category, type, payload,

@@ -474,7 +474,7 @@ void SqliteStore::WriteBatch(std::deque<Queued>& batch) {
 
 int SqliteStore::WriteRecord(const ReportRecord& record) {
   if (const auto* r = std::get_if<SessionMessageRecord>(&record)) {
-    const std::string payload = JsonText(r->payload);
+    const std::string payload = JsonText(*r->payload);
     sqlite3_bind_int64(insertSessionMessage_, 1, r->sessionRow);
     BindOptionalInt(insertSessionMessage_, 2, r->reporterId);
     sqlite3_bind_int(insertSessionMessage_, 3, r->category);

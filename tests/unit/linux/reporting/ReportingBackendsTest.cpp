@@ -73,6 +73,9 @@ template <typename R>
 ReportRecordPtr Record(R record) {
   return std::make_shared<const ReportRecord>(std::move(record));
 }
+PayloadPtr Shared(Dictionary payload) {
+  return std::make_shared<const Dictionary>(std::move(payload));
+}
 ReportRecordPtr Event(const std::string& name, Dictionary payload = Dictionary::object()) {
   return Record(AnalyticsEventRecord{name, std::move(payload), 1.5});
 }
@@ -240,8 +243,8 @@ TEST_F(ReportingBackendsTest, StoreEachRecordLandsInTheColumnsOfItsTable) {
   for (const auto& record :
        {Record(SessionRecord{7, 42, big, json, 1000.25, std::nullopt, true}),
         Record(SessionRecord{7, 42, big, json, 1000.25, 1010.5, true}),
-        Record(SessionMessageRecord{7, 42, 0xFFFF, 3, json, 1001.5}),
-        Record(SessionMessageRecord{8, std::nullopt, 1, 1, json, 1005}),
+        Record(SessionMessageRecord{7, 42, 0xFFFF, 3, Shared(json), 1001.5}),
+        Record(SessionMessageRecord{8, std::nullopt, 1, 1, Shared(json), 1005}),
         Record(SingleMessageRecord{big, json, 2, 1, json, 1002.75}), Event("Session.Start", json),
         Record(PowerEventRecord{28, "Mediane_Haptics", json, 1004.5})}) {
     ASSERT_TRUE(store.Append(record));
@@ -413,7 +416,7 @@ TEST_F(ReportingBackendsTest, KafkaRecordsArriveAsJsonOnTheirTopicsAndTheFlushAn
   const std::pair<ReportRecord, std::string> records[] = {
       {SessionRecord{3, -7, info, {{"ClientName", "c"}}, 100.5, std::nullopt},
        R"(sessions -7 {"row":3,"reporter_id":-7,"session_info":{"SessionID":-7,"HierarchyToken":18446744073709551615},"user_info":{"ClientName":"c"},"created_at":100.5,"flushed_at":null,"recovered":false})"},
-      {SessionMessageRecord{3, -7, 258, 9, payload, 101.25},
+      {SessionMessageRecord{3, -7, 258, 9, Shared(payload), 101.25},
        R"(session_messages -7 {"session_row":3,"reporter_id":-7,"category":258,"type":9,"payload":{"list":[1,"two"]},"received_at":101.25})"},
       {SingleMessageRecord{{{"SessionID", -1}}, {{"ServiceName", "alarms"}}, 1, 2, payload, 102},
        R"(single_messages - {"session_info":{"SessionID":-1},"user_info":{"ServiceName":"alarms"},"category":1,"type":2,"payload":{"list":[1,"two"]},"received_at":102.0})"},
@@ -528,7 +531,7 @@ TEST_F(ReportingBackendsTest, SessionRowMessagesAndFlushTimeLandInTheStore) {
   EXPECT_EQ(session->Description(), "<TelvoroSession row 2 reporter 77>");
   const std::string created = Now();
   clock_.Advance(std::chrono::milliseconds(250));
-  ASSERT_TRUE(session->SendSessionMessage(0xFFFF, 7, {{"summary", {1, 2}}}, &error_));
+  ASSERT_TRUE(session->SendSessionMessage(0xFFFF, 7, Shared({{"summary", {1, 2}}}), &error_));
   const std::string sent = Now();
   clock_.Advance(std::chrono::seconds(3));
   Lines inside;
@@ -556,7 +559,7 @@ TEST_F(ReportingBackendsTest, DiscoveryLeavesOutADownBackendAndSendsFailOnlyWhen
   auto service = Service({"sqlite"}, /*brokenStoreFirst=*/true);
   auto session = service->CreateTelvoroSession(info_, {}, {});
   EXPECT_EQ(Discover(*session), BackendList(std::vector<std::string>{"sqlite:" + db_}));
-  EXPECT_TRUE(session->SendSessionMessage(1, 1, {{"k", 1}}, &error_));
+  EXPECT_TRUE(session->SendSessionMessage(1, 1, Shared({{"k", 1}}), &error_));
   EXPECT_NE(Flush(*session).find("not up"), std::string::npos) << "the flush reports the down one";
   EXPECT_EQ(Reader(db_).Number("SELECT COUNT(*) FROM session_messages"), 1);
 
@@ -564,7 +567,7 @@ TEST_F(ReportingBackendsTest, DiscoveryLeavesOutADownBackendAndSendsFailOnlyWhen
   service = Service({"none"}, /*brokenStoreFirst=*/true);
   session = service->CreateTelvoroSession(info_, {}, {});
   EXPECT_EQ(Discover(*session), std::nullopt);
-  EXPECT_FALSE(session->SendSessionMessage(1, 1, {{"k", 1}}, &error_));
+  EXPECT_FALSE(session->SendSessionMessage(1, 1, Shared({{"k", 1}}), &error_));
   EXPECT_NE(error_.description.find("none of the 1 reporting back-end(s)"), std::string::npos);
   EXPECT_FALSE(service->SendOneMessage({}, {}, 1, 1, {}, &error_));
   EXPECT_EQ(service->Status()[0].stats.dropped, 3u) << "session row, message, single message";
@@ -573,7 +576,7 @@ TEST_F(ReportingBackendsTest, DiscoveryLeavesOutADownBackendAndSendsFailOnlyWhen
   service = Service({"none"});
   session = service->CreateTelvoroSession(info_, {}, {});
   EXPECT_EQ(Discover(*session), std::nullopt);
-  EXPECT_FALSE(session->SendSessionMessage(1, 1, {}, &error_));
+  EXPECT_FALSE(session->SendSessionMessage(1, 1, Shared(Dictionary()), &error_));
   EXPECT_EQ(error_.description, "no reporting back-end is configured");
   EXPECT_EQ(Flush(*session), "");
 }
@@ -613,7 +616,8 @@ TEST_F(ReportingBackendsTest, FlushAnswersAfterTheStoreCommittedAndKafkaAcknowle
   auto service = Service({"sqlite", kafka + ",topic-prefix=both."});
   auto session = service->CreateTelvoroSession(info_, {}, {});
   EXPECT_EQ(Discover(*session), BackendList(std::vector<std::string>{"sqlite:" + db_, kafka}));
-  for (int i = 0; i < 50; ++i) ASSERT_TRUE(session->SendSessionMessage(1, 2, {{"i", i}}, &error_));
+  for (int i = 0; i < 50; ++i)
+    ASSERT_TRUE(session->SendSessionMessage(1, 2, Shared({{"i", i}}), &error_));
   std::vector<BackendStatus> inside;
   EXPECT_EQ(Flush(*session, [&] { inside = service->Status(); }), "");
   // 50 messages, the session row, and the row again with its flush time.

@@ -26,7 +26,7 @@ class RecordingObject final : public RuvoReportingServiceProtocol {
   void getServiceNameForReporterID(int64_t, ServiceTypeReply reply) override { reply(0xFFFF); }
   void setConfiguration(const Dictionary&, int64_t, BoolReply reply) override { reply(true); }
   void startReportingSessionForID(int64_t, BoolReply reply) override { reply(true); }
-  void sendMessage(const Dictionary&, uint32_t category, uint16_t,
+  void sendMessage(Dictionary, uint32_t category, uint16_t,
                    const std::optional<std::vector<int64_t>>&, ErrorReply reply) override {
     std::unique_lock lock(mutex_);
     categories_.push_back(category);
