@@ -11,6 +11,7 @@
 #include <cstring>
 #include <ctime>
 #include <filesystem>
+#include <span>
 #include <thread>
 #include <vector>
 
@@ -63,6 +64,23 @@ constexpr const char* kInsertSingleMessage =
     "VALUES(?1, ?2, ?3, ?4, ?5, ?6)";
 constexpr const char* kInsertAnalyticsEvent =
     "INSERT INTO analytics_events(name, payload, received_at) VALUES(?1, ?2, ?3)";
+
+// The two tables that take a row per client message are written kRowsPerInsert rows a
+// statement: a statement's own cost (the step, reset and clearing of its bindings) is then paid
+// once for that many rows.
+constexpr size_t kRowsPerInsert = 32;
+constexpr int kSessionMessageColumns = 6;
+constexpr int kAnalyticsEventColumns = 3;
+
+// "INSERT INTO <table>(<columns>) VALUES(?,...),(?,...),..." with `rows` rows of `columns`.
+std::string MultiRowInsert(const char* into, int columns, size_t rows) {
+  std::string row = "(?";
+  for (int i = 1; i < columns; ++i) row += ",?";
+  row += ')';
+  std::string sql = fmt::format("INSERT INTO {} VALUES", into);
+  for (size_t i = 0; i < rows; ++i) sql += (i == 0 ? "" : ",") + row;
+  return sql;
+}
 constexpr const char* kInsertPowerEvent =
     "INSERT INTO power_events(agent, name, payload, received_at) VALUES(?1, ?2, ?3, ?4)";
 
@@ -130,6 +148,26 @@ void BindOptionalInt(sqlite3_stmt* statement, int index, const std::optional<int
 void BindText(sqlite3_stmt* statement, int index, const std::string& text) {
   // The text outlives the step that reads it.
   sqlite3_bind_text(statement, index, text.data(), static_cast<int>(text.size()), SQLITE_STATIC);
+}
+
+// Binds one row's columns from `first` on; `payload` keeps the payload's text until the step.
+void BindRow(sqlite3_stmt* statement, int first, const SessionMessageRecord& r,
+             std::string& payload) {
+  payload = JsonText(*r.payload);
+  sqlite3_bind_int64(statement, first, r.sessionRow);
+  BindOptionalInt(statement, first + 1, r.reporterId);
+  sqlite3_bind_int(statement, first + 2, r.category);
+  sqlite3_bind_int(statement, first + 3, r.type);
+  BindText(statement, first + 4, payload);
+  sqlite3_bind_double(statement, first + 5, r.receivedAt);
+}
+
+void BindRow(sqlite3_stmt* statement, int first, const AnalyticsEventRecord& r,
+             std::string& payload) {
+  payload = JsonText(r.payload);
+  BindText(statement, first, r.name);
+  BindText(statement, first + 1, payload);
+  sqlite3_bind_double(statement, first + 2, r.receivedAt);
 }
 
 int Step(sqlite3_stmt* statement) {
@@ -263,17 +301,32 @@ int SqliteStore::OpenDatabase(std::string* reason) {
       {kInsertAnalyticsEvent, &insertAnalyticsEvent_},
       {kInsertPowerEvent, &insertPowerEvent_},
   };
-  for (const auto& [sql, target] : statements) {
-    rc = sqlite3_prepare_v3(db_, sql, -1, SQLITE_PREPARE_PERSISTENT, target, nullptr);
-    if (rc != SQLITE_OK) return failed(rc);
+  const std::string insertSessionMessages = MultiRowInsert(
+      "session_messages(session_row, reporter_id, category, type, payload, "
+      "received_at)",
+      kSessionMessageColumns, kRowsPerInsert);
+  const std::string insertAnalyticsEvents = MultiRowInsert(
+      "analytics_events(name, payload, received_at)", kAnalyticsEventColumns, kRowsPerInsert);
+  const std::pair<const char*, sqlite3_stmt**> manyRows[] = {
+      {insertSessionMessages.c_str(), &insertSessionMessages_},
+      {insertAnalyticsEvents.c_str(), &insertAnalyticsEvents_},
+  };
+  using Statements = std::span<const std::pair<const char*, sqlite3_stmt**>>;
+  for (const Statements list : {Statements(statements), Statements(manyRows)}) {
+    for (const auto& [sql, target] : list) {
+      rc = sqlite3_prepare_v3(db_, sql, -1, SQLITE_PREPARE_PERSISTENT, target, nullptr);
+      if (rc != SQLITE_OK) return failed(rc);
+    }
   }
+  rowTexts_.resize(kRowsPerInsert);
   sqlite3_db_config(db_, SQLITE_DBCONFIG_NO_CKPT_ON_CLOSE, 0, nullptr);
   return SQLITE_OK;
 }
 
 void SqliteStore::CloseDatabase() {
-  for (sqlite3_stmt** statement : {&insertSession_, &insertSessionMessage_, &insertSingleMessage_,
-                                   &insertAnalyticsEvent_, &insertPowerEvent_}) {
+  for (sqlite3_stmt** statement :
+       {&insertSession_, &insertSessionMessage_, &insertSingleMessage_, &insertAnalyticsEvent_,
+        &insertPowerEvent_, &insertSessionMessages_, &insertAnalyticsEvents_}) {
     sqlite3_finalize(*statement);
     *statement = nullptr;
   }
@@ -407,12 +460,46 @@ void SqliteStore::WriterLoop() {
   }
 }
 
+template <typename Record>
+int SqliteStore::InsertRows(const std::vector<const Record*>& rows, sqlite3_stmt* many,
+                            sqlite3_stmt* one, int columns) {
+  size_t i = 0;
+  for (; i + kRowsPerInsert <= rows.size(); i += kRowsPerInsert) {
+    for (size_t k = 0; k < kRowsPerInsert; ++k) {
+      BindRow(many, static_cast<int>(k) * columns + 1, *rows[i + k], rowTexts_[k]);
+    }
+    if (const int rc = Step(many); rc != SQLITE_OK) return rc;
+  }
+  for (; i < rows.size(); ++i) {
+    BindRow(one, 1, *rows[i], rowTexts_[0]);
+    if (const int rc = Step(one); rc != SQLITE_OK) return rc;
+  }
+  return SQLITE_OK;
+}
+
 int SqliteStore::TryWriteBatch(const std::deque<Queued>& batch) {
   int rc = db_ ? sqlite3_exec(db_, "BEGIN IMMEDIATE", nullptr, nullptr, nullptr) : SQLITE_MISUSE;
   if (rc == SQLITE_OK) {
+    // Per table the batch's order holds, so rows are numbered in the order they were accepted;
+    // which table is written first does not show once the transaction commits.
+    std::vector<const SessionMessageRecord*> messages;
+    std::vector<const AnalyticsEventRecord*> events;
     for (const Queued& queued : batch) {
-      rc = WriteRecord(*queued.record);
-      if (rc != SQLITE_OK) break;
+      if (const auto* r = std::get_if<SessionMessageRecord>(queued.record.get())) {
+        messages.push_back(r);
+      } else if (const auto* e = std::get_if<AnalyticsEventRecord>(queued.record.get())) {
+        events.push_back(e);
+      } else if (rc = WriteRecord(*queued.record); rc != SQLITE_OK) {
+        break;
+      }
+    }
+    if (rc == SQLITE_OK) {
+      rc = InsertRows(messages, insertSessionMessages_, insertSessionMessage_,
+                      kSessionMessageColumns);
+    }
+    if (rc == SQLITE_OK) {
+      rc =
+          InsertRows(events, insertAnalyticsEvents_, insertAnalyticsEvent_, kAnalyticsEventColumns);
     }
     if (rc == SQLITE_OK) rc = sqlite3_exec(db_, "COMMIT", nullptr, nullptr, nullptr);
   }
@@ -473,16 +560,6 @@ void SqliteStore::WriteBatch(std::deque<Queued>& batch) {
 }
 
 int SqliteStore::WriteRecord(const ReportRecord& record) {
-  if (const auto* r = std::get_if<SessionMessageRecord>(&record)) {
-    const std::string payload = JsonText(*r->payload);
-    sqlite3_bind_int64(insertSessionMessage_, 1, r->sessionRow);
-    BindOptionalInt(insertSessionMessage_, 2, r->reporterId);
-    sqlite3_bind_int(insertSessionMessage_, 3, r->category);
-    sqlite3_bind_int(insertSessionMessage_, 4, r->type);
-    BindText(insertSessionMessage_, 5, payload);
-    sqlite3_bind_double(insertSessionMessage_, 6, r->receivedAt);
-    return Step(insertSessionMessage_);
-  }
   if (const auto* r = std::get_if<SessionRecord>(&record)) {
     const std::string sessionInfo = JsonText(r->sessionInfo);
     const std::string userInfo = JsonText(r->userInfo);
@@ -510,13 +587,6 @@ int SqliteStore::WriteRecord(const ReportRecord& record) {
     BindText(insertSingleMessage_, 5, payload);
     sqlite3_bind_double(insertSingleMessage_, 6, r->receivedAt);
     return Step(insertSingleMessage_);
-  }
-  if (const auto* r = std::get_if<AnalyticsEventRecord>(&record)) {
-    const std::string payload = JsonText(r->payload);
-    BindText(insertAnalyticsEvent_, 1, r->name);
-    BindText(insertAnalyticsEvent_, 2, payload);
-    sqlite3_bind_double(insertAnalyticsEvent_, 3, r->receivedAt);
-    return Step(insertAnalyticsEvent_);
   }
   const auto& r = std::get<PowerEventRecord>(record);
   const std::string payload = JsonText(r.payload);

@@ -56,6 +56,7 @@
 #include <mutex>
 #include <string>
 #include <thread>
+#include <vector>
 
 #include "platform/Clock.h"
 #include "platform/LogSystem.h"
@@ -142,7 +143,12 @@ class SqliteStore final : public ReportingBackend {
   void WriteBatch(std::deque<Queued>& batch);
   // One transaction of the whole batch, rolled back on failure; the SQLite result code.
   int TryWriteBatch(const std::deque<Queued>& batch);
+  // Session messages and analytics events are written by InsertRows, every other record here.
   int WriteRecord(const ReportRecord& record);
+  // `rows` in statements of `many` (kRowsPerInsert rows each), the rest one by one with `one`.
+  template <typename Record>
+  int InsertRows(const std::vector<const Record*>& rows, sqlite3_stmt* many, sqlite3_stmt* one,
+                 int columns);
   void AnswerFlushes();
   void SetWriteFailing(const std::string& reason);
 
@@ -158,6 +164,9 @@ class SqliteStore final : public ReportingBackend {
   sqlite3_stmt* insertSingleMessage_ = nullptr;
   sqlite3_stmt* insertAnalyticsEvent_ = nullptr;
   sqlite3_stmt* insertPowerEvent_ = nullptr;
+  sqlite3_stmt* insertSessionMessages_ = nullptr;  // kRowsPerInsert rows
+  sqlite3_stmt* insertAnalyticsEvents_ = nullptr;  // kRowsPerInsert rows
+  std::vector<std::string> rowTexts_;              // the payload texts of one statement's rows
 
   std::atomic<State> state_{State::kUp};
   std::atomic<uint64_t> accepted_{0};

@@ -284,22 +284,31 @@ TEST_F(ReportingBackendsTest,
   std::vector<std::thread> producers;
   for (int t = 0; t < 4; ++t) {
     producers.emplace_back([&, t] {
-      for (int i = 0; i < 5000; ++i) EXPECT_TRUE(store.Append(Event("p", {{"t", t}, {"i", i}})));
+      for (int i = 0; i < 5000; ++i) {
+        EXPECT_TRUE(store.Append(Event("p", {{"t", t}, {"i", i}})));
+        if (i % 3 == 0) {
+          EXPECT_TRUE(
+              store.Append(Record(SessionMessageRecord{t, t, 1, 2, Shared({{"i", i}}), 1})));
+        }
+      }
     });
   }
   for (auto& producer : producers) producer.join();
   std::promise<Lines> seen;
   store.Flush([&](const OptionalError& error) {
-    // The count, and the steps of each producer's numbers in row order that are not +1.
+    // Per table, the count and the steps of each producer's numbers in row order that are not
+    // the producer's step: rows are written many to a statement and must keep their order.
     seen.set_value(Reader(db_).Query(
         "SELECT '" + std::string(error ? "error" : testing::ThreadName()) +
         "', COUNT(DISTINCT payload), SUM(step != 1) FROM (SELECT payload, payload->>'i' - "
         "LAG(payload->>'i') OVER (PARTITION BY payload->>'t' ORDER BY row) AS step FROM "
-        "analytics_events)"));
+        "analytics_events) UNION ALL SELECT 'messages', COUNT(*), SUM(step != 3) FROM (SELECT "
+        "payload->>'i' - LAG(payload->>'i') OVER (PARTITION BY reporter_id ORDER BY row) AS "
+        "step FROM session_messages)"));
   });
   auto answer = seen.get_future();
   ASSERT_EQ(answer.wait_for(testing::kWaitLimit), std::future_status::ready);
-  EXPECT_EQ(answer.get(), Lines{"tavrin-store|20000|0"});
+  EXPECT_EQ(answer.get(), (Lines{"tavrin-store|20000|0", "messages|6668|0"}));
 }
 
 // Another process holding the write lock past the busy timeout (tavrinctl, sqlite3) delays the
