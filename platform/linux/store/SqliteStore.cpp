@@ -379,7 +379,7 @@ bool SqliteStore::Append(ReportRecordPtr record) {
       queue_.push_back(Queued{++acceptedSeq_, std::move(record)});
       queued_.store(queue_.size(), std::memory_order_relaxed);
       accepted_.fetch_add(1, std::memory_order_relaxed);
-      wakeup_.notify_one();
+      if (queue_.size() >= wakeAtQueued_) wakeup_.notify_one();
       return true;
     }
   }
@@ -437,6 +437,7 @@ void SqliteStore::WriterLoop() {
     {
       std::unique_lock lock(mutex_);
       const auto hasWork = [this] { return !queue_.empty() || !waiters_.empty() || stopping_; };
+      wakeAtQueued_ = 1;
       wakeup_.wait(lock, hasWork);
       if (!queue_.empty()) {
         const auto deadline = std::chrono::steady_clock::now() + kMaxBatchDelay;
@@ -448,6 +449,8 @@ void SqliteStore::WriterLoop() {
           queued_.store(queue_.size(), std::memory_order_relaxed);
           // Whoever waits for a flush or the shutdown waits for this batch: commit it now.
           if (batch.size() >= kMaxBatchRecords || stopping_ || !waiters_.empty()) break;
+          // Until the deadline, only a full batch, a flush or the shutdown is worth a wake-up.
+          wakeAtQueued_ = kMaxBatchRecords - batch.size();
           if (!wakeup_.wait_until(lock, deadline, hasWork)) break;
         }
       } else {

@@ -180,6 +180,10 @@ class SqliteStore final : public ReportingBackend {
   uint64_t acceptedSeq_ = 0;   // seq of the last accepted record
   uint64_t processedSeq_ = 0;  // seq of the last record committed or lost by the writer
   uint64_t lostReported_ = 0;  // drops counted when the last flush was answered
+  // The queue length at which Append wakes the writer: 1 while it waits for work, what fills the
+  // batch while it gathers one. Waking it for every record cost the appending thread a futex call
+  // and the writer a context switch per record.
+  size_t wakeAtQueued_ = 1;
   bool stopping_ = false;
   std::string downReason_;
 
