@@ -79,6 +79,15 @@ bool WaitUntil(Predicate done) {
   return false;
 }
 
+// "CALL STATUS" of a reply, and "DOMAIN CODE" after them for an error; "none" when none came.
+inline std::string Describe(const std::optional<protocol::Reply>& reply) {
+  if (!reply) return "none";
+  std::string text = std::to_string(reply->call) + " " + std::to_string(int(reply->status));
+  if (reply->status == protocol::Status::kOk) return text;
+  return text + " " + reply->value.value("domain", "") + " " +
+         std::to_string(reply->value.value("code", 0));
+}
+
 // A blocking client over one connection: sends raw frames or requests, reads replies with a
 // time-out.
 class TestClient {
