@@ -13,6 +13,7 @@
 #include <thread>
 
 #include "tavrin/Client.h"
+#include "tests/fakes/GuardedState.h"
 #include "tests/support/StoreFiles.h"
 #include "tests/support/TavrindProcess.h"
 
@@ -30,24 +31,19 @@ constexpr auto kWait = std::chrono::milliseconds(10000);
 
 // Collects the answers an asynchronous handler is given, from the reader thread.
 template <typename T>
-struct Answers {
-  std::mutex mutex;
-  std::vector<Result<T>> results;
-
+class Answers : GuardedState {
+ public:
   client::ReplyHandler<T> Handler() {
     return [this](Result<T> result) {
-      std::lock_guard lock(mutex);
-      results.push_back(std::move(result));
+      std::lock_guard lock(mutex_);
+      results_.push_back(std::move(result));
     };
   }
-  size_t Count() {
-    std::lock_guard lock(mutex);
-    return results.size();
-  }
-  Result<T> At(size_t i) {
-    std::lock_guard lock(mutex);
-    return results.at(i);
-  }
+  size_t Count() const { return Locked(results_).size(); }
+  Result<T> At(size_t i) const { return Locked(results_).at(i); }
+
+ private:
+  std::vector<Result<T>> results_;  // guarded by mutex_
 };
 
 // The error code of a call that failed; none for one that succeeded.
