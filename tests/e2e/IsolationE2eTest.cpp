@@ -267,8 +267,7 @@ TEST(IsolationLimitsE2eTest, ConnectionCrowdsAreCutAtThePerUidLimitAndTheDescrip
     TavrindProcess service;
     rlimit saved{};
     ::getrlimit(RLIMIT_NOFILE, &saved);
-    rlimit lowered = saved;
-    lowered.rlim_cur = static_cast<rlim_t>(c.descriptorLimit);
+    const rlimit lowered{static_cast<rlim_t>(c.descriptorLimit), saved.rlim_max};
     ::setrlimit(RLIMIT_NOFILE, &lowered);  // inherited by the service
     const bool started =
         StartWith(service, "[limits]\nconnections_per_uid = " + std::to_string(c.perUid) + "\n");
