@@ -1,6 +1,7 @@
 // libtavrin against the real service: every operation, the answers that come twice, late or
 // never, the service going away, and the errors a user sees.
 
+#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <unistd.h>
 
@@ -12,6 +13,7 @@
 #include <thread>
 
 #include "tavrin/Client.h"
+#include "tests/fakes/GuardedState.h"
 #include "tests/support/StoreFiles.h"
 #include "tests/support/TavrindProcess.h"
 
@@ -23,38 +25,37 @@ using client::Done;
 using client::Errc;
 using client::Result;
 using client::Session;
-using testing::QueryStore;
 using testing::TavrindProcess;
 
 constexpr auto kWait = std::chrono::milliseconds(10000);
 
 // Collects the answers an asynchronous handler is given, from the reader thread.
 template <typename T>
-struct Answers {
-  std::mutex mutex;
-  std::vector<Result<T>> results;
-
+class Answers : GuardedState {
+ public:
   client::ReplyHandler<T> Handler() {
     return [this](Result<T> result) {
-      std::lock_guard lock(mutex);
-      results.push_back(std::move(result));
+      std::lock_guard lock(mutex_);
+      results_.push_back(std::move(result));
     };
   }
-  size_t Count() {
-    std::lock_guard lock(mutex);
-    return results.size();
-  }
-  Result<T> At(size_t i) {
-    std::lock_guard lock(mutex);
-    return results.at(i);
-  }
+  size_t Count() const { return Locked(results_).size(); }
+  Result<T> At(size_t i) const { return Locked(results_).at(i); }
+
+ private:
+  std::vector<Result<T>> results_;  // guarded by mutex_
 };
 
-size_t MessageRows(const TavrindProcess& service, int64_t reporter, uint32_t category) {
-  return QueryStore(service.DatabasePath(),
-                    "SELECT row FROM session_messages WHERE reporter_id = " +
-                        std::to_string(reporter) + " AND category = " + std::to_string(category))
-      .size();
+// The error code of a call that failed; none for one that succeeded.
+template <typename T>
+std::optional<Errc> Failure(const Result<T>& result) {
+  return result ? std::nullopt : std::optional(result.error().code);
+}
+
+int64_t MessageRows(const TavrindProcess& service, int64_t reporter, uint32_t category) {
+  return testing::StoreCount(service.DatabasePath(),
+                             "session_messages WHERE reporter_id = " + std::to_string(reporter) +
+                                 " AND category = " + std::to_string(category));
 }
 
 // One service and one connected client for each case.
@@ -90,10 +91,7 @@ TEST_F(ClientLibraryE2eTest, EveryOperationAgainstTheService) {
   Answers<Done> sent;
   client->sendMessage({{"xruns", 4}}, 5, 1, std::nullopt, sent.Handler());
 
-  auto reporters = client->getAllReporters(kWait);
-  ASSERT_TRUE(reporters);
-  EXPECT_NE(std::find(reporters.value().begin(), reporters.value().end(), id),
-            reporters.value().end());
+  EXPECT_THAT(client->getAllReporters(kWait).value(), ::testing::Contains(id));
   EXPECT_EQ(sent.Count(), 1u);  // answered before the later call
   EXPECT_TRUE(sent.At(0));
 
@@ -139,9 +137,8 @@ TEST_F(ClientLibraryE2eTest, AnswersThatComeTwiceLateOrNever) {
   // A blocking start waits for the held answer; its time-out forgets the call, and the late
   // answer (at the stop) finds no one and harms nothing.
   ASSERT_TRUE(client->createReportingSession(13, kWait));
-  auto timedOut = client->startReportingSessionForID(13, std::chrono::milliseconds(100));
-  ASSERT_FALSE(timedOut);
-  EXPECT_EQ(timedOut.error().code, Errc::kTimedOut);
+  EXPECT_EQ(Failure(client->startReportingSessionForID(13, std::chrono::milliseconds(100))),
+            Errc::kTimedOut);
   EXPECT_EQ(client->pendingCalls(), 0u);
   ASSERT_TRUE(client->stopReportingSessionForID(13, kWait));
   EXPECT_TRUE(client->getAllReporters(kWait));
@@ -155,9 +152,7 @@ TEST_F(ClientLibraryE2eTest, AnswersThatComeTwiceLateOrNever) {
   ASSERT_EQ(openAtClose.Count(), 1u);
   EXPECT_EQ(openAtClose.At(0).error().code, Errc::kConnectionLost);
   EXPECT_EQ(client->pendingCalls(), 0u);
-  auto afterClose = client->getAllReporters(kWait);
-  ASSERT_FALSE(afterClose);
-  EXPECT_EQ(afterClose.error().code, Errc::kConnectionLost);
+  EXPECT_EQ(Failure(client->getAllReporters(kWait)), Errc::kConnectionLost);
 }
 
 TEST_F(ClientLibraryE2eTest, TheServiceGoingAwayEndsEveryWaitingCallAtOnce) {
@@ -172,14 +167,11 @@ TEST_F(ClientLibraryE2eTest, TheServiceGoingAwayEndsEveryWaitingCallAtOnce) {
   waiting.join();
   EXPECT_LT(std::chrono::steady_clock::now() - killedAt, kWait);
   ASSERT_TRUE(blocked.has_value());
-  ASSERT_FALSE(*blocked);
-  EXPECT_EQ(blocked->error().code, Errc::kConnectionLost);
+  ASSERT_EQ(Failure(*blocked), Errc::kConnectionLost);
   EXPECT_NE(blocked->error().message.find(service.SocketPath()), std::string::npos);
   EXPECT_FALSE(client->connected());
 
-  auto fireAndForget = client->sendMessage({{"a", 1}}, 1, 1);
-  ASSERT_FALSE(fireAndForget);
-  EXPECT_EQ(fireAndForget.error().code, Errc::kConnectionLost);
+  EXPECT_EQ(Failure(client->sendMessage({{"a", 1}}, 1, 1)), Errc::kConnectionLost);
 }
 
 TEST(ClientLibraryWithoutServiceTest, TheSocketPathAndWhyNoServiceAnswersThere) {
@@ -195,39 +187,31 @@ TEST(ClientLibraryWithoutServiceTest, TheSocketPathAndWhyNoServiceAnswersThere) 
 
   const std::string directory = testing::MakeTempDirectory("tavrin-client-");
   auto missing = Client::Connect({directory + "/run/reporting.sock"});
-  ASSERT_FALSE(missing);
-  EXPECT_EQ(missing.error().code, Errc::kNotRunning);
+  ASSERT_EQ(Failure(missing), Errc::kNotRunning);
   EXPECT_NE(missing.error().message.find(directory + "/run/reporting.sock"), std::string::npos);
   EXPECT_NE(missing.error().message.find("TAVRIN_SOCKET"), std::string::npos);
   // A socket file left behind by a service that is gone: nothing listens.
   const int stale = testing::BindUnixSocket(directory + "/stale.sock", false);
   ASSERT_GE(stale, 0);
   ::close(stale);
-  auto refused = Client::Connect({directory + "/stale.sock"});
-  ASSERT_FALSE(refused);
-  EXPECT_EQ(refused.error().code, Errc::kNotRunning);
-  auto tooLong = Client::Connect({"/" + std::string(200, 'x')});
-  ASSERT_FALSE(tooLong);
-  EXPECT_EQ(tooLong.error().code, Errc::kInvalidArgument);
+  EXPECT_EQ(Failure(Client::Connect({directory + "/stale.sock"})), Errc::kNotRunning);
+  EXPECT_EQ(Failure(Client::Connect({"/" + std::string(200, 'x')})), Errc::kInvalidArgument);
   std::filesystem::remove_all(directory);
 }
 
 TEST_F(ClientLibraryE2eTest, BadRequestsAndRefusalsAreErrorsAndTheConnectionStaysUsable) {
-  auto notADictionary = client->sendMessage(client::Dictionary::array({1, 2}), 1, 1);
-  ASSERT_FALSE(notADictionary);
-  EXPECT_EQ(notADictionary.error().code, Errc::kInvalidArgument);
+  EXPECT_EQ(Failure(client->sendMessage(client::Dictionary::array({1, 2}), 1, 1)),
+            Errc::kInvalidArgument);
 
   client::Dictionary huge{{"blob", std::string(protocol::kDefaultFrameLimit, 'x')}};
   auto tooBig = client->sendMessage(huge, 1, 1, std::nullopt, kWait);
-  ASSERT_FALSE(tooBig);
-  EXPECT_EQ(tooBig.error().code, Errc::kInvalidArgument);
+  ASSERT_EQ(Failure(tooBig), Errc::kInvalidArgument);
   EXPECT_NE(tooBig.error().message.find("frame limit"), std::string::npos);
 
   // A value MessagePack can carry but the protocol refuses: the service answers status 2.
   auto binary = client->sendMessage({{"raw", client::Dictionary::binary({1, 2, 3})}}, 1, 1,
                                     std::nullopt, kWait);
-  ASSERT_FALSE(binary);
-  EXPECT_EQ(binary.error().code, Errc::kRejected);
+  ASSERT_EQ(Failure(binary), Errc::kRejected);
   EXPECT_EQ(binary.error().domain, protocol::kProtocolErrorDomain);
   EXPECT_EQ(binary.error().serviceCode, 6);
 

@@ -114,10 +114,10 @@ TEST(ClientsE2eTest, FiftyConcurrentClientsLoseNoMessageAndGetStartBeforeStop) {
 // What the running service adds to a client's session: the driver counters it reads under its
 // root at start and stop.
 TEST(ClientsE2eTest, AStoppedSessionCarriesTheDriverCountersReadUnderTheRoot) {
-  const std::string root = testing::MakeTempDirectory("tavrin-e2e-");
-  testing::WriteFileAtomically(root + "/driverstats/Speaker/xruns", "5\n");
-  testing::WriteFileAtomically(root + "/driverstats/Haptics/Stats/actuations", "100\n");
-  TavrindProcess service({}, root);
+  TavrindProcess service;
+  const std::string counters = service.root() + "/driverstats";
+  testing::WriteFileAtomically(counters + "/Speaker/xruns", "5\n");
+  testing::WriteFileAtomically(counters + "/Haptics/Stats/actuations", "100\n");
   ASSERT_TRUE(service.Start()) << service.Log();
   TestClient client(service.SocketPath());
   client.Send(1, protocol::CreateReportingSession{21});
@@ -126,8 +126,7 @@ TEST(ClientsE2eTest, AStoppedSessionCarriesTheDriverCountersReadUnderTheRoot) {
   // Requests run in order: once this one is answered, the start has taken its snapshot.
   client.Send(40, protocol::GetAllReporters{});
   for (uint64_t call : {1, 2, 40}) EXPECT_EQ(MustRead(client, service).call, call);
-  testing::WriteFileAtomically(root + "/driverstats/Speaker/xruns",
-                               "9\n");  // +4; actuations unchanged
+  testing::WriteFileAtomically(counters + "/Speaker/xruns", "9\n");  // +4; actuations unchanged
   client.Send(5, protocol::SendMessage{Dictionary{{"a", 1}}, 1, 0, std::vector<int64_t>{21}});
   client.Send(6, protocol::StopReportingSessionForID{21});
   for (uint64_t call : {5, 4, 6}) EXPECT_EQ(MustRead(client, service).call, call);

@@ -79,10 +79,9 @@ protocol::Arguments Message(Dictionary payload) {
 }
 
 // Sends one request and waits for its reply: the reply's status, or none when no reply came.
-std::optional<protocol::Status> Ask(TestClient& client, uint64_t call, protocol::Arguments request,
+std::optional<protocol::Status> Ask(TestClient& client, protocol::Arguments request,
                                     std::chrono::milliseconds timeout = testing::kE2eTimeout) {
-  client.Send(call, std::move(request));
-  const auto reply = client.Read(timeout);
+  const auto reply = client.Call(std::move(request), timeout);
   return reply ? std::optional(reply->status) : std::nullopt;
 }
 
@@ -125,17 +124,13 @@ TEST_F(IsolationE2eTest, AnotherUserWhoMayConnectCannotStopTheServiceUnlessListe
     if (!client.connected()) return 2;
     client.Send(1, protocol::KillService{});
     client.Send(2, protocol::GetAllReporters{});
-    auto refusal = client.Read();
-    if (!refusal || refusal->call != 1 || refusal->status != protocol::Status::kOperationError) {
-      return 3;
-    }
-    if (refusal->value.value("domain", "") != protocol::kAccessErrorDomain ||
-        refusal->value.value("code", 0) != protocol::kKillNotAllowedCode ||
-        refusal->value.value("reason", "").empty()) {
-      return 4;
-    }
-    auto next = client.Read();
-    return next && next->call == 2 && next->status == protocol::Status::kOk ? 0 : 5;
+    const auto refusal = client.Read(), next = client.Read();
+    const bool refused = refusal && refusal->call == 1 &&
+                         refusal->status == protocol::Status::kOperationError &&
+                         refusal->value.value("domain", "") == protocol::kAccessErrorDomain &&
+                         refusal->value.value("code", 0) == protocol::kKillNotAllowedCode &&
+                         !refusal->value.value("reason", "").empty();
+    return !refused ? 3 : next && next->call == 2 && next->status == protocol::Status::kOk ? 0 : 5;
   };
   EXPECT_EQ(RunAsOtherUser(killThenAsk), 0) << service.Log();
   EXPECT_TRUE(service.WaitForLog("refused killService")) << service.Log();
@@ -177,12 +172,10 @@ TEST(IsolationLimitsE2eTest, WideFramesAndLongReporterListsAreRefusedWithoutStal
   wide.insert(wide.end(), {0x01, 0x00, 0xc0});
   std::vector<int64_t> everyone(10'000, 7);  // under the entry limit, over the list limit
 
-  uint64_t call = 0;
   auto worstRoundTrip = std::chrono::nanoseconds(0);
   auto roundTrip = [&] {
     const auto started = std::chrono::steady_clock::now();
-    const bool answered =
-        Ask(bystander, ++call, protocol::GetAllReporters{}) == protocol::Status::kOk;
+    const bool answered = Ask(bystander, protocol::GetAllReporters{}) == protocol::Status::kOk;
     worstRoundTrip = std::max(worstRoundTrip, std::chrono::steady_clock::now() - started);
     return answered;
   };
@@ -192,14 +185,10 @@ TEST(IsolationLimitsE2eTest, WideFramesAndLongReporterListsAreRefusedWithoutStal
   ASSERT_TRUE(attacker.Send(
       2, protocol::SendMessage{Dictionary{{"x", std::string(1024, 'x')}}, 1, 0, everyone}));
   for (int i = 0; i < 20; ++i) EXPECT_TRUE(roundTrip());
-  for (auto [expectedCall, code] : {std::pair{1u, protocol::LimitCode::kEntriesPerFrame},
-                                    std::pair{2u, protocol::LimitCode::kReporterListTooLong}}) {
-    auto refusal = attacker.Read();
-    ASSERT_TRUE(refusal) << service.Log();
-    EXPECT_EQ(refusal->call, expectedCall);
-    EXPECT_EQ(refusal->status, protocol::Status::kOperationError);
-    EXPECT_EQ(refusal->value.value("domain", ""), protocol::kLimitsErrorDomain);
-    EXPECT_EQ(refusal->value.value("code", 0), static_cast<int64_t>(code));
+  for (auto [call, code] : {std::pair{1, protocol::LimitCode::kEntriesPerFrame},
+                            std::pair{2, protocol::LimitCode::kReporterListTooLong}}) {
+    EXPECT_EQ(testing::Describe(attacker.Read()),
+              fmt::format("{} 1 {} {}", call, protocol::kLimitsErrorDomain, int(code)));
   }
   EXPECT_LT(std::chrono::steady_clock::now() - started, 1 * kSlowBuild);
   EXPECT_LT(worstRoundTrip, std::chrono::milliseconds(50) * kSlowBuild.count());
@@ -213,11 +202,8 @@ TEST(IsolationLimitsE2eTest, WideFramesAndLongReporterListsAreRefusedWithoutStal
     attacker.Send(next, protocol::SendMessage{large, 1, 0, std::nullopt});
     attacker.Send(next + 1, protocol::GetAllReporters{});
   }
-  for (uint64_t expected = 3; expected < 9; ++expected) {
-    auto reply = attacker.Read();
-    ASSERT_TRUE(reply) << service.Log();
-    EXPECT_EQ(reply->call, expected);
-    EXPECT_EQ(reply->status, protocol::Status::kOk);
+  for (int call = 3; call < 9; ++call) {
+    EXPECT_EQ(testing::Describe(attacker.Read()), std::to_string(call) + " 0") << service.Log();
   }
   EXPECT_EQ(service.Stop(), 0);
   EXPECT_EQ(service.LogCount("reporter IDs per message 1, entries per frame 1,"), 1u)
@@ -234,33 +220,29 @@ TEST(IsolationLimitsE2eTest, FrameAndSessionsPerConnectionLimitsComeFromTheSetti
       << service.Log();
   for (auto [text, answered] : {std::pair{69'000, true}, {71'000, false}}) {
     TestClient sender(service.SocketPath());
-    EXPECT_EQ(Ask(sender, 1, Message({{"t", std::string(text, 'x')}}), 2s).has_value(), answered);
+    EXPECT_EQ(Ask(sender, Message({{"t", std::string(text, 'x')}}), 2s).has_value(), answered);
   }
   EXPECT_TRUE(service.WaitForLog("outside 1..70000")) << service.Log();
   TestClient client(service.SocketPath());
   TestClient other(service.SocketPath());
-  uint64_t call = 0;
+  // The reply without its call number.
   auto create = [&](TestClient& on, int64_t id) {
-    on.Send(++call, protocol::CreateReportingSession{id});
-    auto reply = on.Read();
-    if (!reply) return std::string("no reply");
-    if (reply->status == protocol::Status::kOk) return std::string("created");
-    return reply->value.value("domain", "") + " " + std::to_string(reply->value.value("code", 0));
+    const std::string reply = testing::Describe(on.Call(protocol::CreateReportingSession{id}));
+    return reply.substr(reply.find(' ') + 1);
   };
-  const std::string refused = std::string(protocol::kLimitsErrorDomain) + " 1";
+  const std::string created = "0", refused = fmt::format("1 {} 1", protocol::kLimitsErrorDomain);
   // 3 is below the floor of 16.
-  for (int64_t id = 1; id <= 16; ++id) EXPECT_EQ(create(client, id), "created") << id;
-  EXPECT_EQ(create(client, 5), "created");
+  for (int64_t id = 1; id <= 16; ++id) EXPECT_EQ(create(client, id), created) << id;
+  EXPECT_EQ(create(client, 5), created);
   EXPECT_EQ(create(client, 17), refused);
-  EXPECT_EQ(create(other, 17), "created");
-  client.Send(++call, protocol::DestroyReportingSession{0});  // ID 0 is never a session of its own
-  client.Send(++call, protocol::DestroyReportingSession{3});
-  ASSERT_TRUE(client.Read() && client.Read());
-  EXPECT_EQ(create(client, 18), "created");
+  EXPECT_EQ(create(other, 17), created);
+  // ID 0 is never a session of its own.
+  ASSERT_TRUE(client.Call(protocol::DestroyReportingSession{0}) &&
+              client.Call(protocol::DestroyReportingSession{3}));
+  EXPECT_EQ(create(client, 18), created);
   EXPECT_EQ(create(client, 19), refused);
 
-  client.Send(++call, protocol::GetAllReporters{});
-  auto reporters = client.Read();
+  auto reporters = client.Call(protocol::GetAllReporters{});
   ASSERT_TRUE(reporters);
   const auto ids = protocol::ReportersReplyValue(reporters->value);
   ASSERT_TRUE(ids);
@@ -285,8 +267,7 @@ TEST(IsolationLimitsE2eTest, ConnectionCrowdsAreCutAtThePerUidLimitAndTheDescrip
     TavrindProcess service;
     rlimit saved{};
     ::getrlimit(RLIMIT_NOFILE, &saved);
-    rlimit lowered = saved;
-    lowered.rlim_cur = static_cast<rlim_t>(c.descriptorLimit);
+    const rlimit lowered{static_cast<rlim_t>(c.descriptorLimit), saved.rlim_max};
     ::setrlimit(RLIMIT_NOFILE, &lowered);  // inherited by the service
     const bool started =
         StartWith(service, "[limits]\nconnections_per_uid = " + std::to_string(c.perUid) + "\n");
@@ -306,7 +287,7 @@ TEST(IsolationLimitsE2eTest, ConnectionCrowdsAreCutAtThePerUidLimitAndTheDescrip
     // Once the crowd leaves, connections are accepted again and messages reach the store.
     ASSERT_TRUE(testing::WaitUntil([&] {
       TestClient client(service.SocketPath());
-      return Ask(client, 1, Message({{"after", 1}}), 500ms) == protocol::Status::kOk;
+      return Ask(client, Message({{"after", 1}}), 500ms) == protocol::Status::kOk;
     })) << service.Log();
     EXPECT_EQ(service.Stop(), 0);
   }
@@ -327,7 +308,7 @@ TEST(IsolationLimitsE2eTest, AClientThatNeverReadsIsCutOffAtItsOwnBacklogBound) 
   EXPECT_TRUE(service.WaitForLog("bytes of replies not read")) << service.Log();
   EXPECT_TRUE(silent.WaitForClose(10s));
   TestClient other(service.SocketPath());
-  EXPECT_TRUE(Ask(other, 1, protocol::GetAllReporters{}));
+  EXPECT_TRUE(Ask(other, protocol::GetAllReporters{}));
   EXPECT_EQ(service.Stop(), 0);
   EXPECT_EQ(service.LogCount("reply backlog 1"), 1u) << service.Log();
 }
@@ -348,7 +329,7 @@ TEST(IsolationLimitsE2eTest, ManyClientsThatNeverReadCannotExhaustTheService) {
   for (int64_t id = 1; id <= 2000; ++id) {
     owner.SendNoReply(protocol::CreateReportingSession{(int64_t{1} << 40) + id});
   }
-  ASSERT_TRUE(Ask(owner, 1, protocol::GetAllReporters{})) << service.Log();
+  ASSERT_TRUE(Ask(owner, protocol::GetAllReporters{})) << service.Log();
 
   std::vector<std::unique_ptr<TestClient>> silent;
   for (int i = 0; i < 200; ++i) {
@@ -359,7 +340,7 @@ TEST(IsolationLimitsE2eTest, ManyClientsThatNeverReadCannotExhaustTheService) {
   }
   TestClient newcomer(service.SocketPath());
   const auto started = std::chrono::steady_clock::now();
-  EXPECT_EQ(Ask(newcomer, 1, protocol::GetAllReporters{}, 60s), protocol::Status::kOk)
+  EXPECT_EQ(Ask(newcomer, protocol::GetAllReporters{}, 60s), protocol::Status::kOk)
       << service.Log();
   EXPECT_LT(std::chrono::steady_clock::now() - started, 15 * kSlowBuild);
   EXPECT_LT(PeakRssBytes(service.pid()), size_t{512} << 20);
@@ -374,8 +355,7 @@ TEST(IsolationSettingsE2eTest, BrokenSettingsOrASwitchOfTheWrongTypeDisableRepor
   TavrindProcess service;
   ASSERT_TRUE(StartWith(service, "disable_reporting = fals\n")) << service.Log();
   TestClient client(service.SocketPath());
-  uint64_t call = 0;
-  auto send = [&] { return Ask(client, ++call, Message({{"x", 1}})); };
+  auto send = [&] { return Ask(client, Message({{"x", 1}})); };
   EXPECT_EQ(send(), protocol::Status::kOperationError)
       << "a broken file at start enabled reporting";
   EXPECT_TRUE(service.WaitForLog("reporting disabled until the file parses")) << service.Log();

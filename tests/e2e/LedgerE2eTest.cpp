@@ -6,8 +6,6 @@
 #include <librdkafka/rdkafka_mock.h>
 
 #include <cstdlib>
-#include <fstream>
-#include <sstream>
 #include <string>
 #include <vector>
 
@@ -21,11 +19,15 @@ using testing::TavrindProcess;
 using testing::TestClient;
 
 Value Status(TestClient& client) {
-  static uint64_t call = 1'000'000;
-  client.Send(++call, protocol::GetStatus{});
-  auto reply = client.Read();
-  if (!reply || reply->status != protocol::Status::kOk) return Value();
-  return reply->value;
+  auto reply = client.Call(protocol::GetStatus{});
+  return reply && reply->status == protocol::Status::kOk ? reply->value : Value();
+}
+
+// `count` messages of category 1 to `reporters`, no reply asked for.
+void SendMessages(TestClient& client, int count, std::optional<std::vector<int64_t>> reporters) {
+  for (int i = 0; i < count; ++i) {
+    client.SendNoReply(protocol::SendMessage{Dictionary{{"i", i}}, 1, 0, reporters});
+  }
 }
 
 // Waits until the service is idle with `received` messages counted, then checks that every one of
@@ -47,11 +49,7 @@ Value SettledStatus(TestClient& client, const TavrindProcess& service, int64_t r
 }
 
 // Rows of client messages (categories 1 and 2), not of the summaries the service sends itself.
-std::string StoredMessages(const TavrindProcess& service) {
-  return testing::QueryStoreColumn(service.DatabasePath(),
-                                   "SELECT count(*) FROM session_messages WHERE category IN (1, 2)")
-      .at(0);
-}
+constexpr char kClientMessages[] = "session_messages WHERE category IN (1, 2)";
 
 // Each drop reason the core decides, a client that goes away with messages counted, and the
 // delivered count that the store confirms row for row.
@@ -61,22 +59,13 @@ TEST(LedgerE2eTest, EveryMessageIsReceivedThenDeliveredOrDroppedByReason) {
   TavrindProcess service({"--metrics-file", metrics}, root);
   ASSERT_TRUE(service.Start()) << service.Log();
   TestClient client(service.SocketPath());
-  uint64_t call = 0;
-  auto ask = [&](protocol::Arguments arguments) {
-    client.Send(++call, std::move(arguments));
-    return client.Read();
-  };
-  ASSERT_TRUE(ask(protocol::CreateReportingSession{1}));
-  ASSERT_TRUE(ask(protocol::CreateReportingSession{2}));
-  ASSERT_TRUE(ask(protocol::SetServiceType{11, 2}));             // "test": never sends
-  client.Send(++call, protocol::StartReportingSessionForID{1});  // answered at its stop
-  client.Send(++call, protocol::StartReportingSessionForID{2});
-  for (int i = 0; i < 50; ++i) {
-    client.SendNoReply(protocol::SendMessage{Dictionary{{"i", i}}, 1, 0, std::vector<int64_t>{1}});
-  }
-  for (int i = 0; i < 10; ++i) {
-    client.SendNoReply(protocol::SendMessage{Dictionary{{"i", i}}, 1, 0, std::vector<int64_t>{2}});
-  }
+  ASSERT_TRUE(client.Call(protocol::CreateReportingSession{1}));
+  ASSERT_TRUE(client.Call(protocol::CreateReportingSession{2}));
+  ASSERT_TRUE(client.Call(protocol::SetServiceType{11, 2}));  // "test": never sends
+  client.Send(1, protocol::StartReportingSessionForID{1});    // answered at its stop
+  client.Send(2, protocol::StartReportingSessionForID{2});
+  SendMessages(client, 50, {{1}});
+  SendMessages(client, 10, {{2}});
   // Two IDs without a session, one with: three paths.
   client.SendNoReply(
       protocol::SendMessage{Dictionary{{"x", 1}}, 1, 0, std::vector<int64_t>{98, 1, 99}});
@@ -84,24 +73,15 @@ TEST(LedgerE2eTest, EveryMessageIsReceivedThenDeliveredOrDroppedByReason) {
     TestClient gone(service.SocketPath());
     gone.Send(1, protocol::CreateReportingSession{7});
     gone.Send(2, protocol::StartReportingSessionForID{7});
-    for (int i = 0; i < 20; ++i) {
-      gone.SendNoReply(protocol::SendMessage{Dictionary{{"g", i}}, 1, 0, std::vector<int64_t>{7}});
-    }
+    SendMessages(gone, 20, {{7}});
     ASSERT_TRUE(gone.Read());
   }
   testing::WriteFileAtomically(service.DefaultsPath(), "disable_reporting = true\n");
   ASSERT_TRUE(service.WaitForLog("re-reading tavrin defaults")) << service.Log();
-  auto refused = ask(protocol::SendMessage{Dictionary{{"off", 1}}, 1, 0, std::vector<int64_t>{1}});
-  ASSERT_TRUE(refused);
-  EXPECT_EQ(refused->status, protocol::Status::kOperationError);
+  auto refused = client.Call(protocol::SendMessage{Dictionary{{"off", 1}}, 1, 0, {{1}}});
+  EXPECT_EQ(refused.value_or(protocol::Reply{}).status, protocol::Status::kOperationError);
 
-  Value status;
-  ASSERT_TRUE(testing::WaitUntil([&] {
-    status = Status(client);
-    return status.is_object() && status["totals"]["in_flight"] == 0 &&
-           status["totals"]["received"] == 84;
-  })) << status.dump()
-      << service.Log();
+  const Value status = SettledStatus(client, service, 84);
   const Value totals = status["totals"];
   EXPECT_EQ(totals["dropped"],
             (Value{{"reporting_disabled", 1}, {"no_session", 2}, {"test_session", 10}}))
@@ -118,16 +98,11 @@ TEST(LedgerE2eTest, EveryMessageIsReceivedThenDeliveredOrDroppedByReason) {
     EXPECT_TRUE(status.contains(key)) << key;
   }
   EXPECT_GT(status["rss_bytes"].get<uint64_t>(), 1u << 20);
-  EXPECT_EQ(testing::QueryStoreColumn(service.DatabasePath(),
-                                      "SELECT count(*) FROM session_messages WHERE category = 1"),
-            std::vector<std::string>{"71"});
+  EXPECT_EQ(testing::StoreCount(service.DatabasePath(), "session_messages WHERE category = 1"), 71);
   EXPECT_EQ(service.Stop(), 0);
 
   // The metrics file's last rewrite, at exit, holds the same counts in OpenMetrics text.
-  std::ifstream in(metrics);
-  std::stringstream text;
-  text << in.rdbuf();
-  const std::string lines = text.str();
+  const std::string lines = testing::ReadFile(metrics);
   for (const char* sample :
        {"tavrin_messages_received_total 84\n", "tavrin_messages_delivered_total 71\n",
         "tavrin_messages_dropped_total{reason=\"test_session\"} 10\n",
@@ -154,9 +129,7 @@ TEST(LedgerE2eTest, WithoutABackEndEveryMessageIsDroppedAsSuch) {
     TavrindProcess service(arguments);
     ASSERT_TRUE(service.Start()) << service.Log();
     TestClient client(service.SocketPath());
-    for (int i = 0; i < 5; ++i) {
-      client.SendNoReply(protocol::SendMessage{Dictionary{{"i", i}}, 1, 0, std::nullopt});
-    }
+    SendMessages(client, 5, std::nullopt);
     const Value status = SettledStatus(client, service, 5);
     EXPECT_EQ(status["totals"]["dropped"], (Value{{reason, 5}})) << service.Log();
     EXPECT_EQ(status["totals"]["delivered"], 0);
@@ -169,11 +142,9 @@ TEST(LedgerE2eTest, WithoutABackEndEveryMessageIsDroppedAsSuch) {
 // queue_full, and every message is delivered or dropped by its reason. Then a store at its size
 // bound: what does not fit is dropped as write_failed. Both bounds are settings.
 TEST(LedgerE2eTest, AStalledStoreAndAFullStoreDropOnlyWhatTheirBoundsRefuse) {
-  const std::string root = testing::MakeTempDirectory("tavrin-e2e-");
-  std::filesystem::create_directories(root + "/etc");
-  testing::WriteFileAtomically(root + "/etc/com.quorvex.tavrin.toml",
+  TavrindProcess service;
+  testing::WriteFileAtomically(service.DefaultsPath(),
                                "[limits]\nstore_queue_records = 1024\nstore_bytes = 4194304\n");
-  TavrindProcess service({}, root);
   ASSERT_TRUE(service.Start()) << service.Log();
   TestClient fanOut(service.SocketPath());
   constexpr int kSessions = 600;
@@ -186,25 +157,19 @@ TEST(LedgerE2eTest, AStalledStoreAndAFullStoreDropOnlyWhatTheirBoundsRefuse) {
   for (int64_t id : ids) fanOut.Send(uint64_t(id), protocol::StartReportingSessionForID{id});
   TestClient watcher(service.SocketPath());
   ASSERT_TRUE(testing::WaitUntil([&] {  // the sessions are started: their rows are written
-    return testing::QueryStoreColumn(service.DatabasePath(), "SELECT count(*) FROM sessions") ==
-           std::vector<std::string>{std::to_string(kSessions)};
+    return testing::StoreCount(service.DatabasePath(), "sessions") == kSessions;
   }));
 
   sqlite3* holder = nullptr;
   ASSERT_EQ(sqlite3_open(service.DatabasePath().c_str(), &holder), SQLITE_OK);
   ASSERT_EQ(sqlite3_exec(holder, "BEGIN IMMEDIATE", nullptr, nullptr, nullptr), SQLITE_OK);
-  for (int i = 0; i < 3; ++i) {
-    fanOut.SendNoReply(protocol::SendMessage{Dictionary{{"fan", i}}, 1, 0, ids});
-  }
+  SendMessages(fanOut, 3, ids);
   std::vector<std::unique_ptr<TestClient>> others;
   for (int64_t id : {1001, 1002, 1003}) {
     auto& other = others.emplace_back(std::make_unique<TestClient>(service.SocketPath()));
     other->Send(1, protocol::CreateReportingSession{id});
     other->Send(2, protocol::StartReportingSessionForID{id});
-    for (int i = 0; i < 100; ++i) {
-      other->SendNoReply(
-          protocol::SendMessage{Dictionary{{"i", i}}, 1, 0, std::vector<int64_t>{id}});
-    }
+    SendMessages(*other, 100, {{id}});
   }
   others.back().reset();  // goes away with its messages still unread by the service
   // The writer waits for the lock (each try up to its busy timeout): the fan-out overflows the
@@ -227,7 +192,7 @@ TEST(LedgerE2eTest, AStalledStoreAndAFullStoreDropOnlyWhatTheirBoundsRefuse) {
   }
   const int64_t delivered = status["totals"]["delivered"].get<int64_t>();
   EXPECT_GT(delivered, 0) << "what the queue held is written once the store moves";
-  EXPECT_EQ(StoredMessages(service), std::to_string(delivered));
+  EXPECT_EQ(testing::StoreCount(service.DatabasePath(), kClientMessages), delivered);
 
   // Messages of 64 KiB into a store bounded at 4 MiB.
   const Dictionary big{{"blob", std::string(64 * 1024, 'x')}};
@@ -236,7 +201,8 @@ TEST(LedgerE2eTest, AStalledStoreAndAFullStoreDropOnlyWhatTheirBoundsRefuse) {
   }
   status = SettledStatus(watcher, service, 3 * kSessions + 300 + 100);
   EXPECT_GT(status["totals"]["dropped"].value("write_failed", 0), 0) << status.dump();
-  EXPECT_EQ(StoredMessages(service), std::to_string(status["totals"]["delivered"].get<int64_t>()));
+  EXPECT_EQ(testing::StoreCount(service.DatabasePath(), kClientMessages),
+            status["totals"]["delivered"].get<int64_t>());
   EXPECT_NE(service.Log().find("database or disk is full"), std::string::npos) << service.Log();
 }
 

@@ -92,14 +92,12 @@ TEST(RealtimeSendE2eTest, MessagesArriveAndSendingNeverAllocatesNorLocks) {
   ASSERT_EQ(tavrin_start_session(client, 42), TAVRIN_OK);
   int64_t reporter = 42;
   EXPECT_EQ(tavrin_send_rt(client, &reporter, 1, 0x80000001, 1, kFields, 4), TAVRIN_OK);
+  const std::string sent = "SELECT payload FROM session_messages WHERE reporter_id = 42";
+  std::vector<std::string> payloads;
   ASSERT_TRUE(testing::WaitUntil([&] {
-    return !testing::QueryStore(service.DatabasePath(),
-                                "SELECT payload FROM session_messages WHERE reporter_id = 42")
-                .empty();
+    return !(payloads = testing::QueryStoreColumn(service.DatabasePath(), sent)).empty();
   })) << service.Log();
-  const auto payload = testing::QueryStoreColumn(
-      service.DatabasePath(), "SELECT payload FROM session_messages WHERE reporter_id = 42")[0];
-  EXPECT_EQ(nlohmann::ordered_json::parse(payload),
+  EXPECT_EQ(nlohmann::ordered_json::parse(payloads[0]),
             nlohmann::ordered_json::parse(R"({"xruns": 3, "load": 0.25, "glitch": true,
               "route": "speaker and a name longer than the sixty-three bytes kept"})"));
 
@@ -127,10 +125,8 @@ TEST(RealtimeSendE2eTest, MessagesArriveAndSendingNeverAllocatesNorLocks) {
   ASSERT_TRUE(service.Start()) << service.Log();
   ASSERT_TRUE(testing::WaitUntil([&] {
     tavrin_send_rt(client, &reporter, 1, 0x80000001, 2, kFields, 1);
-    return !testing::QueryStore(service.DatabasePath(),
-                                "SELECT row FROM session_messages WHERE reporter_id = 42 AND "
-                                "type = 2")
-                .empty();
+    return testing::StoreCount(service.DatabasePath(),
+                               "session_messages WHERE reporter_id = 42 AND type = 2") > 0;
   })) << service.Log();
   tavrin_close(client);
 }

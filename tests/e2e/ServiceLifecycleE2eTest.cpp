@@ -38,8 +38,7 @@ TEST(ServiceLifecycleE2eTest, SigtermSendsTheAlarmsMessagesStillHeldBack) {
   }
   for (int i = 0; i < 2 + kMessages; ++i) ASSERT_TRUE(client.Read()) << service.Log();
   EXPECT_EQ(service.Stop(), 0) << service.Log();
-  EXPECT_EQ(testing::QueryStore(service.DatabasePath(), "SELECT count(*) FROM single_messages"),
-            (std::vector<std::vector<std::string>>{{std::to_string(kMessages)}}))
+  EXPECT_EQ(testing::StoreCount(service.DatabasePath(), "single_messages"), kMessages)
       << service.Log();
   EXPECT_EQ(service.LogCount("held-back single message(s) now"), 1u) << service.Log();
   EXPECT_EQ(service.LogCount("still queued"), 0u) << "an orderly stop drained everything";
@@ -49,32 +48,27 @@ TEST(ServiceLifecycleE2eTest, SigtermSendsTheAlarmsMessagesStillHeldBack) {
 // recovered in the store, covering every message the store had committed, writes its summary
 // file and removes the spool it came from.
 TEST(ServiceLifecycleE2eTest, AfterSigkillTheNextStartSendsTheOpenSessionsSummary) {
-  const std::string root = testing::MakeTempDirectory("tavrin-e2e-");
-  testing::WriteFileAtomically(root + "/etc/device.toml", "InternalBuild = true\n");
-  TavrindProcess service({}, root);
+  TavrindProcess service;
+  testing::WriteFileAtomically(service.root() + "/etc/device.toml", "InternalBuild = true\n");
   ASSERT_TRUE(service.Start()) << service.Log();
   constexpr int kMessages = 300;
   // The client stays connected: a client that goes away has its sessions stopped.
   TestClient client(service.SocketPath());
-  {
-    client.Send(1, protocol::CreateReportingSession{21});
-    client.Send(2, protocol::SetServiceType{3, 21});
-    client.Send(3, protocol::StartReportingSessionForID{21});
-    for (int i = 0; i < kMessages; ++i) {
-      client.Send(10 + i,
-                  protocol::SendMessage{Dictionary{{"n", i}, {"text", std::string(600, 'x')}}, 1, 0,
-                                        std::vector<int64_t>{21}});
-    }
-    // The start's answer is held until the session stops, which it never does here.
-    for (int i = 0; i < 2 + kMessages; ++i) ASSERT_TRUE(client.Read()) << service.Log();
+  client.Send(1, protocol::CreateReportingSession{21});
+  client.Send(2, protocol::SetServiceType{3, 21});
+  client.Send(3, protocol::StartReportingSessionForID{21});
+  for (int i = 0; i < kMessages; ++i) {
+    client.Send(10 + i, protocol::SendMessage{Dictionary{{"n", i}, {"text", std::string(600, 'x')}},
+                                              1, 0, std::vector<int64_t>{21}});
   }
-  const std::string count =
-      "SELECT count(*) FROM session_messages WHERE reporter_id = 21 AND category = 1";
-  ASSERT_TRUE(testing::WaitUntil([&] {
-    return testing::QueryStoreColumn(service.DatabasePath(), count) ==
-           std::vector<std::string>{std::to_string(kMessages)};
-  })) << testing::QueryStoreColumn(service.DatabasePath(), count)[0]
-      << service.Log();
+  // The start's answer is held until the session stops, which it never does here.
+  for (int i = 0; i < 2 + kMessages; ++i) ASSERT_TRUE(client.Read()) << service.Log();
+  const auto stored = [&] {
+    return testing::StoreCount(service.DatabasePath(),
+                               "session_messages WHERE reporter_id = 21 AND category = 1");
+  };
+  ASSERT_TRUE(testing::WaitUntil([&] { return stored() == kMessages; }))
+      << stored() << service.Log();
   ::kill(service.pid(), SIGKILL);
   ASSERT_EQ(service.WaitForExit(), 128 + SIGKILL);
 
@@ -94,13 +88,11 @@ TEST(ServiceLifecycleE2eTest, AfterSigkillTheNextStartSendsTheOpenSessionsSummar
   for (int i = 0; i < kMessages; ++i) numbers += (i ? "," : "") + std::to_string(i);
   EXPECT_EQ(event["n"], numbers);
   EXPECT_EQ(event["Ruvo_Session_Summary_Event"], "3");
-  EXPECT_EQ(testing::QueryStoreColumn(service.DatabasePath(),
-                                      "SELECT count(*) FROM sessions WHERE recovered = 1"),
-            std::vector<std::string>{"1"});
+  EXPECT_EQ(testing::StoreCount(service.DatabasePath(), "sessions WHERE recovered = 1"), 1);
   // One summary file: its name and entries are the summary suite's business.
-  const std::filesystem::path files = root + "/log/DiagnosticLogs/Audio/Reporting";
+  const std::filesystem::path files = service.root() + "/log/DiagnosticLogs/Audio/Reporting";
   EXPECT_EQ(std::distance(std::filesystem::directory_iterator(files), {}), 1);
-  EXPECT_TRUE(std::filesystem::is_empty(root + "/lib/spool"));
+  EXPECT_TRUE(std::filesystem::is_empty(service.root() + "/lib/spool"));
 }
 
 // Under a service manager (a datagram socket standing in for systemd's): READY with a status

@@ -12,7 +12,6 @@
 #include <csignal>
 #include <cstdlib>
 #include <filesystem>
-#include <fstream>
 #include <sstream>
 #include <string>
 #include <vector>
@@ -37,11 +36,6 @@ struct Outcome {
   std::string err;
 };
 
-std::string ReadAll(const std::string& path) {
-  std::ifstream in(path, std::ios::binary);
-  return {std::istreambuf_iterator<char>(in), {}};
-}
-
 std::string Quote(const std::string& text) {
   std::string quoted = "'";
   for (char c : text) quoted += c == '\'' ? std::string("'\\''") : std::string(1, c);
@@ -57,8 +51,8 @@ Outcome Sh(const std::string& command) {
       ("env -u TAVRIN_SOCKET -u TAVRIN_ROOT -u TAVRIN_DEFAULTS timeout -s KILL 20 /bin/sh -c " +
        Quote(command) + " </dev/null >" + directory + "/out 2>" + directory + "/err")
           .c_str());
-  Outcome run{WIFEXITED(status) ? WEXITSTATUS(status) : -1, ReadAll(directory + "/out"),
-              ReadAll(directory + "/err")};
+  Outcome run{WIFEXITED(status) ? WEXITSTATUS(status) : -1, testing::ReadFile(directory + "/out"),
+              testing::ReadFile(directory + "/err")};
   EXPECT_NE(run.status, 128 + SIGKILL) << "did not finish in time: " << command;
   // A sanitizer's report may come with the very exit status a test expects.
   for (const char* report : {"Sanitizer", "runtime error:"}) {
@@ -93,11 +87,10 @@ size_t RowCount(const TavrindProcess& service, const std::string& where) {
 
 TEST(TavrinctlE2eTest, RecordFromAHereDocumentLeavesRowsAndASummaryThatEventsAndSummariesShow) {
   // An internal build's device, so the stopped session leaves a summary file.
-  const std::string root = testing::MakeTempDirectory("tavrin-e2e-");
-  testing::WriteFileAtomically(root + "/etc/device.toml", "InternalBuild = true\n");
-  TavrindProcess service({}, root);
+  TavrindProcess service;
+  testing::WriteFileAtomically(service.root() + "/etc/device.toml", "InternalBuild = true\n");
   ASSERT_TRUE(service.Start()) << service.Log();
-  const std::string ctl = Ctl(root);
+  const std::string ctl = Ctl(service.root());
 
   // Blank lines are skipped, not errors.
   const Outcome record = Sh(ctl +

@@ -52,11 +52,6 @@ class Spawned {
   pid_t pid_ = -1;
 };
 
-std::string Read(const std::string& path) {
-  std::ifstream in(path);
-  return {std::istreambuf_iterator<char>(in), {}};
-}
-
 // A counter file's value, -1 while it does not exist yet.
 int64_t Counter(const std::string& path) {
   int64_t value = -1;
@@ -79,7 +74,7 @@ TEST(PwExporterServiceE2eTest, ASessionCarriesTheCyclesThePipeWireGraphRanWhileI
   Spawned daemon({"/usr/bin/pipewire", "-c", PIPEWIRE_NULL_GRAPH_CONF}, log);
   ASSERT_TRUE(daemon.started());
   ASSERT_TRUE(WaitUntil([&] { return ::access((runtime + "/pipewire-0").c_str(), F_OK) == 0; }))
-      << Read(log);
+      << testing::ReadFile(log);
 
   // The service starts before the exporter has made its group, as after a boot.
   ASSERT_TRUE(service.Start()) << service.Log();
@@ -89,7 +84,7 @@ TEST(PwExporterServiceE2eTest, ASessionCarriesTheCyclesThePipeWireGraphRanWhileI
   ASSERT_TRUE(exporter.started());
   // The last node in name order owns the family's keys: Speaker_cycles is test_sink's count.
   const std::string cycles = service.root() + "/driverstats/Speaker/test_sink/cycles";
-  ASSERT_TRUE(WaitUntil([&] { return Counter(cycles) > 0; })) << Read(log);
+  ASSERT_TRUE(WaitUntil([&] { return Counter(cycles) > 0; })) << testing::ReadFile(log);
 
   TestClient client(service.SocketPath());
   const int64_t beforeStart = Counter(cycles);
@@ -99,7 +94,8 @@ TEST(PwExporterServiceE2eTest, ASessionCarriesTheCyclesThePipeWireGraphRanWhileI
   client.Send(3, protocol::GetAllReporters{});
   for (uint64_t call : {1, 3}) ASSERT_EQ(client.Read().value_or(protocol::Reply{}).call, call);
   const int64_t afterStart = Counter(cycles);
-  ASSERT_TRUE(WaitUntil([&] { return Counter(cycles) > afterStart + 2; })) << Read(log);
+  ASSERT_TRUE(WaitUntil([&] { return Counter(cycles) > afterStart + 2; }))
+      << testing::ReadFile(log);
   const int64_t beforeStop = Counter(cycles);
   client.Send(4, protocol::StopReportingSessionForID{77});
   for (uint64_t call : {2, 4}) ASSERT_EQ(client.Read().value_or(protocol::Reply{}).call, call);

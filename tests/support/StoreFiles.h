@@ -4,6 +4,7 @@
 
 #include <sqlite3.h>
 
+#include <cstdint>
 #include <filesystem>
 #include <fstream>
 #include <string>
@@ -41,6 +42,12 @@ inline std::vector<std::string> QueryStoreColumn(const std::string& database,
   std::vector<std::string> values;
   for (auto& row : QueryStore(database, sql)) values.push_back(row.empty() ? "" : row[0]);
   return values;
+}
+
+// The row count of `from` (a table, with a WHERE clause when it has one); -1 when the query fails.
+inline int64_t StoreCount(const std::string& database, const std::string& from) {
+  const auto counts = QueryStoreColumn(database, "SELECT count(*) FROM " + from);
+  return counts.empty() ? -1 : std::stoll(counts[0]);
 }
 
 // Replaces `path` with `text` through a temporary file and a rename, as an editor saves.

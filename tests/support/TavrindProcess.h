@@ -10,8 +10,6 @@
 
 #include <cstdlib>
 #include <filesystem>
-#include <fstream>
-#include <iterator>
 #include <optional>
 #include <string>
 #include <vector>
@@ -83,10 +81,7 @@ class TavrindProcess {
     return WaitUntil([&] { return Exited(); }) ? exitStatus_ : std::nullopt;
   }
 
-  std::string Log() const {
-    std::ifstream in(logPath_);
-    return {std::istreambuf_iterator<char>(in), {}};
-  }
+  std::string Log() const { return ReadFile(logPath_); }
   size_t LogCount(const std::string& needle) const { return Occurrences(Log(), needle); }
   // Waits until the log holds `needle` at least `count` times.
   bool WaitForLog(const std::string& needle, size_t count = 1) const {

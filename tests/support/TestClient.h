@@ -11,6 +11,8 @@
 #include <chrono>
 #include <cstdlib>
 #include <filesystem>
+#include <fstream>
+#include <iterator>
 #include <optional>
 #include <string>
 #include <thread>
@@ -36,6 +38,12 @@ inline sockaddr_un UnixAddress(const std::string& path) {
   address.sun_family = AF_UNIX;
   std::snprintf(address.sun_path, sizeof(address.sun_path), "%s", path.c_str());
   return address;
+}
+
+// The whole file at `path` ("" when it cannot be read).
+inline std::string ReadFile(const std::string& path) {
+  std::ifstream in(path, std::ios::binary);
+  return {std::istreambuf_iterator<char>(in), {}};
 }
 
 // How many times `needle` occurs in `text`.
@@ -69,6 +77,15 @@ bool WaitUntil(Predicate done) {
     std::this_thread::sleep_for(std::chrono::milliseconds(20));
   }
   return false;
+}
+
+// "CALL STATUS" of a reply, and "DOMAIN CODE" after them for an error; "none" when none came.
+inline std::string Describe(const std::optional<protocol::Reply>& reply) {
+  if (!reply) return "none";
+  std::string text = std::to_string(reply->call) + " " + std::to_string(int(reply->status));
+  if (reply->status == protocol::Status::kOk) return text;
+  return text + " " + reply->value.value("domain", "") + " " +
+         std::to_string(reply->value.value("code", 0));
 }
 
 // A blocking client over one connection: sends raw frames or requests, reads replies with a
@@ -105,6 +122,13 @@ class TestClient {
   }
   bool SendNoReply(protocol::Arguments arguments) {
     return SendBody(protocol::EncodeRequest(protocol::Request{std::nullopt, std::move(arguments)}));
+  }
+  // Sends `arguments` under this client's next call number (from 1,000,000 up, clear of the
+  // numbers tests choose) and reads the next reply.
+  std::optional<protocol::Reply> Call(protocol::Arguments arguments,
+                                      std::chrono::milliseconds timeout = kE2eTimeout) {
+    Send(++calls_, std::move(arguments));
+    return Read(timeout);
   }
 
   // The next reply, or nothing when none came in time or the connection ended.
@@ -149,6 +173,7 @@ class TestClient {
  private:
   int fd_ = -1;
   bool connected_ = false;
+  uint64_t calls_ = 1'000'000;
   protocol::FrameReader reader_;
 };
 

@@ -17,6 +17,8 @@
 
 #include <gtest/gtest.h>
 
+#include "tests/fakes/GuardedState.h"
+
 namespace tavrin::testing {
 
 // Generous: the machine is shared with compilers; a healthy wait takes milliseconds.
@@ -61,23 +63,19 @@ inline void WriteBytes(const std::filesystem::path& path, const std::string& byt
 }
 
 // Notes written from any thread, read by the test.
-class Notes {
+class Notes : GuardedState {
  public:
   void Add(const std::string& note) {
     std::lock_guard lock(mutex_);
     notes_.push_back(note);
   }
-  std::vector<std::string> Get() const {
-    std::lock_guard lock(mutex_);
-    return notes_;
-  }
+  std::vector<std::string> Get() const { return Locked(notes_); }
   size_t Size() const { return Get().size(); }
   bool WaitSize(size_t n) const {
     return WaitFor([&] { return Size() >= n; });
   }
 
  private:
-  mutable std::mutex mutex_;
   std::vector<std::string> notes_;  // guarded by mutex_
 };
 

@@ -50,7 +50,8 @@ class Reader {
     sqlite3_finalize(statement);
     return lines;
   }
-  int64_t Number(const std::string& sql) { return std::stoll(Query(sql).at(0)); }
+  std::string Row(const std::string& sql) { return Query(sql).at(0); }
+  int64_t Number(const std::string& sql) { return std::stoll(Row(sql)); }
   int Exec(const std::string& sql) {
     return sqlite3_exec(db_, sql.c_str(), nullptr, nullptr, nullptr);
   }
@@ -59,14 +60,23 @@ class Reader {
   sqlite3* db_ = nullptr;
 };
 
-// Asks `backend` for a flush and waits: "" when it answers success, otherwise what went wrong.
-inline std::string FlushAnswer(ReportingBackend& backend) {
-  auto promise = std::make_shared<std::promise<OptionalError>>();
+// Asks a back-end or a session for a flush and waits: "" when it answers success, otherwise what
+// went wrong; then the text of `inside`, run within the answer.
+template <typename Target>
+std::string FlushAnswer(
+    Target& target, std::function<std::string()> inside = [] { return ""; }) {
+  auto promise = std::make_shared<std::promise<std::string>>();
   auto future = promise->get_future();
-  backend.Flush([promise](const OptionalError& error) { promise->set_value(error); });
+  auto answer = [promise, inside](const OptionalError& error) {
+    promise->set_value((error ? "error: " + error->description : "") + inside());
+  };
+  if constexpr (std::is_base_of_v<TelvoroSession, Target>) {
+    target.FlushMessages(answer);
+  } else {
+    target.Flush(answer);
+  }
   if (future.wait_for(testing::kWaitLimit) != std::future_status::ready) return "no answer";
-  const OptionalError error = future.get();
-  return error ? "error: " + error->description : "";
+  return future.get();
 }
 
 template <typename R>
@@ -208,18 +218,6 @@ class ReportingBackendsTest : public ::testing::Test {
     EXPECT_EQ(future.wait_for(testing::kWaitLimit), std::future_status::ready);
     return future.get();
   }
-  // The flush answer ("" for success, else the error), after `inside` ran within the callback.
-  static std::string Flush(
-      TelvoroSession& session, std::function<void()> inside = [] {}) {
-    std::promise<std::string> answered;
-    session.FlushMessages([&](const OptionalError& error) {
-      inside();
-      answered.set_value(error ? error->description : "");
-    });
-    auto future = answered.get_future();
-    EXPECT_EQ(future.wait_for(testing::kWaitLimit), std::future_status::ready);
-    return future.get();
-  }
   std::string Now() const { return fmt::format("{:.2f}", SecondsSinceEpoch(clock_.WallNow())); }
 
   static inline rd_kafka_t* host_ = nullptr;
@@ -294,21 +292,22 @@ TEST_F(ReportingBackendsTest,
     });
   }
   for (auto& producer : producers) producer.join();
-  std::promise<Lines> seen;
-  store.Flush([&](const OptionalError& error) {
-    // Per table, the count and the steps of each producer's numbers in row order that are not
-    // the producer's step: rows are written many to a statement and must keep their order.
-    seen.set_value(Reader(db_).Query(
-        "SELECT '" + std::string(error ? "error" : testing::ThreadName()) +
-        "', COUNT(DISTINCT payload), SUM(step != 1) FROM (SELECT payload, payload->>'i' - "
-        "LAG(payload->>'i') OVER (PARTITION BY payload->>'t' ORDER BY row) AS step FROM "
-        "analytics_events) UNION ALL SELECT 'messages', COUNT(*), SUM(step != 3) FROM (SELECT "
-        "payload->>'i' - LAG(payload->>'i') OVER (PARTITION BY reporter_id ORDER BY row) AS "
-        "step FROM session_messages)"));
-  });
-  auto answer = seen.get_future();
-  ASSERT_EQ(answer.wait_for(testing::kWaitLimit), std::future_status::ready);
-  EXPECT_EQ(answer.get(), (Lines{"tavrin-store|20000|0", "messages|6668|0"}));
+  // Per table, the count and the steps of each producer's numbers in row order that are not the
+  // producer's step: rows are written many to a statement and must keep their order.
+  const std::string steps =
+      "SELECT COUNT(DISTINCT payload), SUM(step != 1) FROM (SELECT payload, payload->>'i' - "
+      "LAG(payload->>'i') OVER (PARTITION BY payload->>'t' ORDER BY row) AS step FROM "
+      "analytics_events)";
+  const std::string messageSteps =
+      "SELECT COUNT(*), SUM(step != 3) FROM (SELECT payload->>'i' - LAG(payload->>'i') OVER "
+      "(PARTITION BY reporter_id ORDER BY row) AS step FROM session_messages)";
+  EXPECT_EQ(FlushAnswer(store,
+                        [&] {
+                          Reader reader(db_);
+                          return testing::ThreadName() + "|" + reader.Row(steps) + "|" +
+                                 reader.Row(messageSteps);
+                        }),
+            "tavrin-store|20000|0|6668|0");
 }
 
 // Another process holding the write lock past the busy timeout (tavrinctl, sqlite3) delays the
@@ -438,14 +437,11 @@ TEST_F(ReportingBackendsTest, KafkaRecordsArriveAsJsonOnTheirTopicsAndTheFlushAn
     ASSERT_TRUE(backend.Append(std::make_shared<const ReportRecord>(record)));
   }
   for (int i = 0; i < 300; ++i) ASSERT_TRUE(backend.Append(Event(i)));
-  std::promise<std::string> answered;
-  backend.Flush([&](const OptionalError& error) {
-    answered.set_value(testing::ThreadName() + (error ? " error " : " ") +
-                       std::to_string(backend.Stats().committed));
-  });
-  auto answer = answered.get_future();
-  ASSERT_EQ(answer.wait_for(testing::kWaitLimit), std::future_status::ready);
-  EXPECT_EQ(answer.get(), "tavrin-kafka 305");
+  EXPECT_EQ(
+      FlushAnswer(
+          backend,
+          [&] { return testing::ThreadName() + " " + std::to_string(backend.Stats().committed); }),
+      "tavrin-kafka 305");
   for (const auto& [record, expected] : records) {
     const std::string table(RecordTable(record));
     const size_t count = table == "analytics_events" ? 301 : 1;
@@ -462,14 +458,11 @@ TEST_F(ReportingBackendsTest,
   ASSERT_EQ(FlushAnswer(backend), "");  // connected
   SetBroker(false);
   for (int i = 0; i < 10; ++i) ASSERT_TRUE(backend.Append(Event(i)));
-  auto answered = std::make_shared<std::promise<OptionalError>>();
-  backend.Flush([answered](const OptionalError& error) { answered->set_value(error); });
-  auto answer = answered->get_future();
+  auto answer = std::async(std::launch::async, [&] { return FlushAnswer(backend); });
   EXPECT_EQ(answer.wait_for(500ms), std::future_status::timeout) << "answered before the acks";
   EXPECT_TRUE(backend.IsUp()) << "unreachable brokers make records wait, not the back-end down";
   SetBroker(true);
-  ASSERT_EQ(answer.wait_for(testing::kWaitLimit), std::future_status::ready);
-  EXPECT_FALSE(answer.get());
+  EXPECT_EQ(answer.get(), "");
   EXPECT_EQ(backend.Stats().committed, 10u);
 }
 
@@ -543,16 +536,11 @@ TEST_F(ReportingBackendsTest, SessionRowMessagesAndFlushTimeLandInTheStore) {
   ASSERT_TRUE(session->SendSessionMessage(0xFFFF, 7, Shared({{"summary", {1, 2}}}), &error_));
   const std::string sent = Now();
   clock_.Advance(std::chrono::seconds(3));
-  Lines inside;
-  EXPECT_EQ(
-      Flush(*session,
-            [&] {
-              inside = Reader(db_).Query(
-                  "SELECT printf('%.2f', received_at), session_row, reporter_id, category, type, "
-                  "payload FROM session_messages");
-            }),
-      "");
-  EXPECT_EQ(inside, Lines{sent + R"(|2|77|65535|7|{"summary":[1,2]})"});
+  const std::string message =
+      "SELECT printf('%.2f', received_at), session_row, reporter_id, category, type, payload FROM "
+      "session_messages";
+  EXPECT_EQ(FlushAnswer(*session, [&] { return Reader(db_).Row(message); }),
+            sent + R"(|2|77|65535|7|{"summary":[1,2]})");
   EXPECT_EQ(
       Reader(db_).Query("SELECT row, reporter_id, session_info, user_info, printf('%.2f', "
                         "created_at), printf('%.2f', flushed_at) FROM sessions WHERE row = 2"),
@@ -569,7 +557,8 @@ TEST_F(ReportingBackendsTest, DiscoveryLeavesOutADownBackendAndSendsFailOnlyWhen
   auto session = service->CreateTelvoroSession(info_, {}, {});
   EXPECT_EQ(Discover(*session), BackendList(std::vector<std::string>{"sqlite:" + db_}));
   EXPECT_TRUE(session->SendSessionMessage(1, 1, Shared({{"k", 1}}), &error_));
-  EXPECT_NE(Flush(*session).find("not up"), std::string::npos) << "the flush reports the down one";
+  EXPECT_NE(FlushAnswer(*session).find("not up"), std::string::npos)
+      << "the flush reports the down one";
   EXPECT_EQ(Reader(db_).Number("SELECT COUNT(*) FROM session_messages"), 1);
 
   session.reset();
@@ -587,7 +576,7 @@ TEST_F(ReportingBackendsTest, DiscoveryLeavesOutADownBackendAndSendsFailOnlyWhen
   EXPECT_EQ(Discover(*session), std::nullopt);
   EXPECT_FALSE(session->SendSessionMessage(1, 1, Shared(Dictionary()), &error_));
   EXPECT_EQ(error_.description, "no reporting back-end is configured");
-  EXPECT_EQ(Flush(*session), "");
+  EXPECT_EQ(FlushAnswer(*session), "");
 }
 
 // An event the analytics policy turns away is not even built.
@@ -625,11 +614,12 @@ TEST_F(ReportingBackendsTest, FlushAnswersAfterTheStoreCommittedAndKafkaAcknowle
   auto service = Service({"sqlite", kafka + ",topic-prefix=both."});
   auto session = service->CreateTelvoroSession(info_, {}, {});
   EXPECT_EQ(Discover(*session), BackendList(std::vector<std::string>{"sqlite:" + db_, kafka}));
-  for (int i = 0; i < 50; ++i)
+  for (int i = 0; i < 50; ++i) {
     ASSERT_TRUE(session->SendSessionMessage(1, 2, Shared({{"i", i}}), &error_));
-  std::vector<BackendStatus> inside;
-  EXPECT_EQ(Flush(*session, [&] { inside = service->Status(); }), "");
+  }
   // 50 messages, the session row, and the row again with its flush time.
+  std::vector<BackendStatus> inside;
+  EXPECT_EQ(FlushAnswer(*session, [&] { return inside = service->Status(), ""; }), "");
   ASSERT_EQ(inside.size(), 2u);
   EXPECT_EQ(inside[0].stats.committed, 52u) << inside[0].name;
   EXPECT_EQ(inside[1].stats.committed, 52u) << inside[1].name;

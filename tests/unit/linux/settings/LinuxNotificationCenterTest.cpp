@@ -37,13 +37,12 @@ class LinuxNotificationCenterTest : public ::testing::Test {
   // A handler that counts its calls, and those that ran off its queue.
   int Register(const std::string& name) {
     int token = 0;
-    EXPECT_EQ(center_->RegisterNotificationHandler(name, &token, *queue_,
-                                                   [this](int token) {
-                                                     std::lock_guard lock(mutex_);
-                                                     ++calls_[token];
-                                                     offQueue_ += !queue_->IsCurrent();
-                                                   }),
-              kNotifyStatusOk);
+    auto count = [this](int token) {
+      std::lock_guard lock(mutex_);
+      ++calls_[token];
+      offQueue_ += !queue_->IsCurrent();
+    };
+    EXPECT_EQ(center_->RegisterNotificationHandler(name, &token, *queue_, count), kNotifyStatusOk);
     return token;
   }
   int Calls(int token) {

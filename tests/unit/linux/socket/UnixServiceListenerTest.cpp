@@ -13,13 +13,14 @@
 #include <gtest/gtest.h>
 
 #include "tests/fakes/FakeLogSystem.h"
+#include "tests/fakes/GuardedState.h"
 #include "tests/support/TestClient.h"
 
 namespace tavrin {
 namespace {
 
 // Records the categories of the messages it is sent; answers everything else with defaults.
-class RecordingObject final : public RuvoReportingServiceProtocol {
+class RecordingObject final : public RuvoReportingServiceProtocol, GuardedState {
  public:
   void createReportingSession(int64_t, BoolReply reply) override { reply(true); }
   void setServiceType(uint16_t, int64_t, BoolReply reply) override { reply(true); }
@@ -39,14 +40,10 @@ class RecordingObject final : public RuvoReportingServiceProtocol {
   void getAllReporters(ReportersReply reply) override { reply({}); }
   void killService(BoolReply) override {}
 
-  std::vector<uint32_t> Categories() const {
-    std::lock_guard lock(mutex_);
-    return categories_;
-  }
+  std::vector<uint32_t> Categories() const { return Locked(categories_); }
 
  private:
-  mutable std::mutex mutex_;
-  std::vector<uint32_t> categories_;
+  std::vector<uint32_t> categories_;  // guarded by mutex_
 };
 
 // A listener on a real socket whose connections export one RecordingObject, its I/O loop on a
