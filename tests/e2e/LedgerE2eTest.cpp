@@ -194,6 +194,9 @@ TEST(LedgerE2eTest, AStalledStoreAndAFullStoreDropOnlyWhatTheirBoundsRefuse) {
   EXPECT_GT(delivered, 0) << "what the queue held is written once the store moves";
   EXPECT_EQ(testing::StoreCount(service.DatabasePath(), kClientMessages), delivered);
 
+  // A store still failing from the stall logs the next failures only within its drop lines'
+  // rate limit, so the full store's own line is looked for only after a clean stall.
+  const bool stallFailedWrites = status["totals"]["dropped"].contains("write_failed");
   // Messages of 64 KiB into a store bounded at 4 MiB.
   const Dictionary big{{"blob", std::string(64 * 1024, 'x')}};
   for (int i = 0; i < 100; ++i) {
@@ -203,7 +206,9 @@ TEST(LedgerE2eTest, AStalledStoreAndAFullStoreDropOnlyWhatTheirBoundsRefuse) {
   EXPECT_GT(status["totals"]["dropped"].value("write_failed", 0), 0) << status.dump();
   EXPECT_EQ(testing::StoreCount(service.DatabasePath(), kClientMessages),
             status["totals"]["delivered"].get<int64_t>());
-  EXPECT_NE(service.Log().find("database or disk is full"), std::string::npos) << service.Log();
+  if (!stallFailedWrites) {
+    EXPECT_NE(service.Log().find("database or disk is full"), std::string::npos) << service.Log();
+  }
 }
 
 // Kafka (librdkafka's mock cluster, in this process) as the only back-end: a record over the
