@@ -325,17 +325,28 @@ class UnixClientConnection final : public ClientConnection,
     }
   }
 
+  // Writes the queued reply frames, up to kMaxFramesPerWrite, in one gathered write. One frame a
+  // write let a client's replies pile up while the I/O thread served a flooding connection: it
+  // got one reply out per turn of the loop, however many were waiting.
   void WriteNext() {
     if (writes_.empty() || ended_) {
       writing_ = false;
       return;
     }
     writing_ = true;
-    asio::async_write(socket_, asio::buffer(writes_.front()),
-                      [self = shared_from_this()](const asio::error_code& error, size_t) {
+    const size_t count = std::min(writes_.size(), UnixServiceListener::kMaxFramesPerWrite);
+    std::vector<asio::const_buffer> buffers;
+    buffers.reserve(count);
+    for (size_t i = 0; i < count; ++i) buffers.push_back(asio::buffer(writes_[i]));
+    asio::async_write(socket_, buffers,
+                      [self = shared_from_this(), count](const asio::error_code& error, size_t) {
                         if (self->ended_) return;
-                        self->AddPending(-static_cast<int64_t>(self->writes_.front().size()));
-                        self->writes_.pop_front();
+                        int64_t written = 0;
+                        for (size_t i = 0; i < count; ++i) {
+                          written += static_cast<int64_t>(self->writes_.front().size());
+                          self->writes_.pop_front();
+                        }
+                        self->AddPending(-written);
                         if (error) {
                           // A client that left without reading its replies: the read side
                           // reports the end.

@@ -124,6 +124,9 @@ class UnixServiceListener final : public ServiceListener {
   // thread: a request of a few hundred bytes costs less to decode than to hand over, while one
   // near the frame limit could hold every other connection's replies for milliseconds.
   static constexpr size_t kInlineDecodeBytes = 16 * 1024;
+  // Reply frames one write hands to the kernel at most: asio's gathered write takes 64 buffers
+  // a system call, and a connection's replies need no more to keep up with its requests.
+  static constexpr size_t kMaxFramesPerWrite = 64;
   // Runs the I/O loop on the calling thread until Stop().
   void Resume() override;
   // Thread-safe; makes Resume() return. Connections are closed.
