@@ -11,12 +11,14 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
 #include <chrono>
 #include <csignal>
 #include <fstream>
 #include <functional>
 #include <memory>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "tests/support/StoreFiles.h"
@@ -208,6 +210,53 @@ TEST(IsolationLimitsE2eTest, WideFramesAndLongReporterListsAreRefusedWithoutStal
   EXPECT_EQ(service.Stop(), 0);
   EXPECT_EQ(service.LogCount("reporter IDs per message 1, entries per frame 1,"), 1u)
       << service.Log();
+}
+
+// A connection's replies keep flowing while another connection floods the service: a bystander
+// that pipelines a thousand requests has them all answered long before the flood is read. (One
+// reply frame a write gave it one reply per turn of the I/O loop, each turn behind another 16 KiB
+// of the flood: about 110,000 flood messages for its thousand replies.)
+TEST(IsolationLimitsE2eTest, ABystandersPipelinedRepliesAreNotHeldBehindAFlood) {
+  TavrindProcess service;
+  ASSERT_TRUE(service.Start()) << service.Log();
+  TestClient flooder(service.SocketPath());
+  TestClient bystander(service.SocketPath());
+  constexpr int kFloodMessages = 60'000;
+  constexpr uint64_t kRequests = 1'000;
+  std::vector<uint8_t> flood;
+  for (int i = 0; i < kFloodMessages; ++i) {
+    const auto frame = protocol::EncodeFrame(protocol::EncodeRequest(
+        protocol::Request{std::nullopt, Message(Dictionary{{"i", i}, {"pad", "xxxxxxxxxxxx"}})}));
+    flood.insert(flood.end(), frame.begin(), frame.end());
+  }
+  std::vector<uint8_t> requests;
+  for (uint64_t call = 1; call <= kRequests; ++call) {
+    const auto frame = protocol::EncodeFrame(
+        protocol::EncodeRequest(protocol::Request{call, protocol::GetAllReporters{}}));
+    requests.insert(requests.end(), frame.begin(), frame.end());
+  }
+  std::atomic<size_t> floodSent{0};
+  std::thread flooding([&] {
+    constexpr size_t kChunk = 4096;
+    for (size_t at = 0; at < flood.size(); at += kChunk) {
+      const size_t end = std::min(flood.size(), at + kChunk);
+      if (!flooder.SendBytes(std::vector<uint8_t>(flood.begin() + at, flood.begin() + end))) break;
+      floodSent = end;
+    }
+  });
+  while (floodSent < flood.size() / 10) std::this_thread::yield();
+  ASSERT_TRUE(bystander.SendBytes(requests));
+  uint64_t answered = 0;
+  while (answered < kRequests) {
+    const auto reply = bystander.Read();
+    if (!reply || reply->status != protocol::Status::kOk) break;
+    ++answered;
+  }
+  const size_t floodSentWhenAnswered = floodSent;
+  flooding.join();
+  EXPECT_EQ(answered, kRequests) << service.Log();
+  EXPECT_LT(floodSentWhenAnswered, flood.size()) << "the bystander waited for the whole flood";
+  EXPECT_EQ(service.Stop(), 0);
 }
 
 // Both limits below are settings. A frame over the frame limit ends its connection, one under it
