@@ -2,16 +2,17 @@
 #include <gtest/gtest.h>
 #include <spa/param/profiler.h>
 #include <spa/pod/builder.h>
-#include <spa/utils/type.h>
 #include <spawn.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <array>
 #include <chrono>
 #include <cstring>
 #include <fstream>
 #include <random>
+#include <set>
 #include <thread>
 
 #include "CounterWriter.h"
@@ -34,7 +35,7 @@ std::string ReadFile(const std::string& path) {
 
 // --- Names and the writer ---
 
-TEST(CounterWriterTest, WritesReplaceAtomicallyAndTheServiceReadsThem) {
+TEST(CounterWriterTest, WritesReplaceAtomicallyRefuseUnsafeNamesAndReportFilesystemFailures) {
   TempCountersTree tree;
   CounterWriter writer(tree.root());
   std::string error;
@@ -42,28 +43,19 @@ TEST(CounterWriterTest, WritesReplaceAtomicallyAndTheServiceReadsThem) {
   ASSERT_TRUE(writer.Write("PipeWire", "Dummy-Driver", "xruns", -9, &error)) << error;
   ASSERT_TRUE(writer.Write("PipeWire", "Dummy-Driver", "cycles", INT64_MAX, &error)) << error;
   // Exactly the two counters are there: no temporary file is left behind.
-  size_t files = 0;
-  for (const auto& entry :
-       std::filesystem::directory_iterator(tree.path("PipeWire/Dummy-Driver"))) {
-    EXPECT_NE(entry.path().filename().string().front(), '.') << entry.path();
-    ++files;
-  }
-  EXPECT_EQ(files, 2u);
-
+  std::set<std::string> names;
+  for (const auto& entry : std::filesystem::directory_iterator(tree.path("PipeWire/Dummy-Driver")))
+    names.insert(entry.path().filename());
+  EXPECT_EQ(names, (std::set<std::string>{"cycles", "xruns"}));
   // The last value, at its edges, as tavrind reads it.
   EXPECT_EQ(ParseCounterText(ReadFile(tree.path("PipeWire/Dummy-Driver/xruns"))), -9);
   EXPECT_EQ(ParseCounterText(ReadFile(tree.path("PipeWire/Dummy-Driver/cycles"))), INT64_MAX);
-}
 
-TEST(CounterWriterTest, RefusesUnsafeNamesAndReportsFilesystemFailures) {
-  TempCountersTree tree;
-  CounterWriter writer(tree.root());
-  std::string error;
-  EXPECT_FALSE(writer.Write("PipeWire", "..", "x", 1, &error));
-  EXPECT_NE(error.find("unsafe counter name"), std::string::npos);
-  EXPECT_FALSE(writer.Write("PipeWire", "a/b", "x", 1, &error));
-  EXPECT_FALSE(writer.Write("PipeWire", "node", "", 1, &error));
-
+  for (const auto& [node, counter] : {std::pair{"..", "x"}, {"a/b", "x"}, {"node", ""}}) {
+    error.clear();
+    EXPECT_FALSE(writer.Write("PipeWire", node, counter, 1, &error)) << node << "/" << counter;
+    EXPECT_NE(error.find("unsafe counter name"), std::string::npos) << error;
+  }
   tree.write("blocked", 1);  // a file where the group directory should be
   CounterWriter blocked(tree.path("blocked"));
   error.clear();
@@ -101,19 +93,19 @@ TEST(ProfilerCountersTest, SumsMaximaIncompleteCyclesAndXruns) {
   second.followers = {Node("test sink", 2300, 2400, 3000)};
   counters.Add(second);
 
-  EXPECT_EQ(AsMap(counters.TakeChanged()),
-            (std::map<std::string, int64_t>{
-                {"Dummy-Driver/busy_ns_max", 400},   {"Dummy-Driver/busy_ns_total", 650},
-                {"Dummy-Driver/cycles", 2},          {"Dummy-Driver/incomplete_cycles", 0},
-                {"Dummy-Driver/wakeup_ns_max", 100}, {"Dummy-Driver/wakeup_ns_total", 150},
-                {"Dummy-Driver/xruns", 3},           {"late/busy_ns_max", 0},
-                {"late/busy_ns_total", 0},           {"late/cycles", 1},
-                {"late/incomplete_cycles", 1},       {"late/wakeup_ns_max", 0},
-                {"late/wakeup_ns_total", 0},         {"test_sink/busy_ns_max", 600},
-                {"test_sink/busy_ns_total", 800},    {"test_sink/cycles", 2},
-                {"test_sink/incomplete_cycles", 0},  {"test_sink/wakeup_ns_max", 300},
-                {"test_sink/wakeup_ns_total", 400},
-            }));
+  // Every counter of every node, and the cycle's xruns on its driver.
+  const char* const names[] = {"cycles",      "incomplete_cycles", "busy_ns_total",
+                               "busy_ns_max", "wakeup_ns_total",   "wakeup_ns_max"};
+  const std::pair<std::string, std::array<int64_t, 6>> nodes[] = {
+      {"Dummy-Driver", {2, 0, 650, 400, 150, 100}},
+      {"late", {1, 1, 0, 0, 0, 0}},
+      {"test_sink", {2, 0, 800, 600, 400, 300}},
+  };
+  std::map<std::string, int64_t> expected{{"Dummy-Driver/xruns", 3}};
+  for (const auto& [node, values] : nodes) {
+    for (size_t i = 0; i < values.size(); ++i) expected[node + "/" + names[i]] = values[i];
+  }
+  EXPECT_EQ(AsMap(counters.TakeChanged()), expected);
   EXPECT_TRUE(counters.TakeChanged().empty());  // nothing new, nothing to write
 
   ProfileCycle third;
@@ -141,26 +133,10 @@ void AddBlock(spa_pod_builder* b, uint32_t key, int32_t id, const char* name, in
   spa_pod_builder_prop(b, key, 0);
   spa_pod_frame frame;
   spa_pod_builder_push_struct(b, &frame);
-  spa_pod_builder_int(b, id);
-  spa_pod_builder_string(b, name);
-  spa_pod_builder_long(b, signal - 100);
-  spa_pod_builder_long(b, signal);
-  spa_pod_builder_long(b, awake);
-  spa_pod_builder_long(b, finish);
-  spa_pod_builder_int(b, 3);
+  spa_pod_builder_add(b, SPA_POD_Int(id), SPA_POD_String(name), SPA_POD_Long(signal - 100),
+                      SPA_POD_Long(signal), SPA_POD_Long(awake), SPA_POD_Long(finish),
+                      SPA_POD_Int(3), nullptr);
   if (withLatency) spa_pod_builder_fraction(b, 1024, 48000);
-  spa_pod_builder_pop(b, &frame);
-}
-
-void AddInfo(spa_pod_builder* b, int32_t xruns) {
-  spa_pod_builder_prop(b, SPA_PROFILER_info, 0);
-  spa_pod_frame frame;
-  spa_pod_builder_push_struct(b, &frame);
-  spa_pod_builder_long(b, 7);
-  spa_pod_builder_float(b, 0.1f);
-  spa_pod_builder_float(b, 0.2f);
-  spa_pod_builder_float(b, 0.3f);
-  spa_pod_builder_int(b, xruns);
   spa_pod_builder_pop(b, &frame);
 }
 
@@ -169,29 +145,24 @@ void AddInfo(spa_pod_builder* b, int32_t xruns) {
 // its status, an object of another type and a good cycle without the info block.
 const spa_pod* BuildProfile(PodBuffer& pod) {
   spa_pod_builder* b = &pod.builder;
-  spa_pod_frame object, frame;
+  spa_pod_frame object;
   spa_pod_builder_push_struct(b, &pod.outer);
   spa_pod_builder_push_object(b, &object, SPA_TYPE_OBJECT_Profiler, 0);
-  AddInfo(b, 4);
+  spa_pod_builder_prop(b, SPA_PROFILER_info, 0);  // 4 xruns
+  spa_pod_builder_add_struct(b, SPA_POD_Long(int64_t{7}), SPA_POD_Float(0.1f), SPA_POD_Float(0.2f),
+                             SPA_POD_Float(0.3f), SPA_POD_Int(4));
   spa_pod_builder_prop(b, SPA_PROFILER_clock, 0);  // ignored
   spa_pod_builder_int(b, 0);
   AddBlock(b, SPA_PROFILER_driverBlock, 30, "Dummy-Driver", 1000, 1010, 1200);
   AddBlock(b, SPA_PROFILER_followerBlock, 31, "sink", 1010, 1020, 1100, false);
   AddBlock(b, SPA_PROFILER_followerBlock, 32, "source", 1010, 1030, 1090);
   spa_pod_builder_prop(b, SPA_PROFILER_followerBlock, 0);  // its name is a number
-  spa_pod_builder_push_struct(b, &frame);
-  spa_pod_builder_int(b, 3);
-  spa_pod_builder_int(b, 4);
-  spa_pod_builder_pop(b, &frame);
+  spa_pod_builder_add_struct(b, SPA_POD_Int(3), SPA_POD_Int(4));
   spa_pod_builder_pop(b, &object);
   spa_pod_builder_int(b, 5);
   spa_pod_builder_push_object(b, &object, SPA_TYPE_OBJECT_Profiler, 0);
   spa_pod_builder_prop(b, SPA_PROFILER_driverBlock, 0);
-  spa_pod_builder_push_struct(b, &frame);
-  spa_pod_builder_int(b, 1);
-  spa_pod_builder_string(b, "short");
-  spa_pod_builder_long(b, 1);
-  spa_pod_builder_pop(b, &frame);
+  spa_pod_builder_add_struct(b, SPA_POD_Int(1), SPA_POD_String("short"), SPA_POD_Long(int64_t{1}));
   spa_pod_builder_pop(b, &object);
   spa_pod_builder_push_object(b, &object, SPA_TYPE_OBJECT_Props, 0);
   AddBlock(b, SPA_PROFILER_driverBlock, 5, "props", 10, 20, 30);
@@ -248,9 +219,9 @@ TEST(ProfilerPodTest, TruncatedAndRandomBytesNeverReadOutOfBounds) {
 // --- Against a real PipeWire daemon with a dummy driver ---
 
 constexpr const char* kPipeWire = "/usr/bin/pipewire";
-constexpr const char* kPwLink = "/usr/bin/pw-link";
 
-// A daemon without sound hardware: the dummy driver clocks a test source linked to a null sink.
+// A daemon without sound hardware: the dummy driver clocks a test source linked to a null sink
+// (linked by the configuration: the nodes and their ports exist by then).
 constexpr const char* kDaemonConfig = R"(
 context.properties = { support.dbus = false core.daemon = true core.name = pipewire-0
   mem.allow-mlock = false default.clock.rate = 48000 default.clock.quantum = 1024 }
@@ -272,6 +243,8 @@ context.objects = [
       media.class = Audio/Source audio.position = [ FL FR ] node.group = pipewire.dummy
       adapter.auto-port-config = { mode = dsp monitor = false control = false
                                    position = preserve } } }
+  { factory = link-factory args = { link.output.node = test-source link.output.port = capture_1
+      link.input.node = "test sink" link.input.port = playback_FL object.linger = true } }
 ]
 )";
 
@@ -326,9 +299,7 @@ int64_t Counter(const TempCountersTree& tree, const std::string& rel) {
 }
 
 TEST(PwExporterDaemonTest, ExportsDriverAndFollowerCountersFromALiveDaemon) {
-  if (::access(kPipeWire, X_OK) != 0 || ::access(kPwLink, X_OK) != 0) {
-    GTEST_SKIP() << "pipewire is not installed";
-  }
+  if (::access(kPipeWire, X_OK) != 0) GTEST_SKIP() << "pipewire is not installed";
   TempCountersTree tree;
   const std::string runtime = tree.outside();
   ::chmod(runtime.c_str(), 0700);
@@ -343,11 +314,6 @@ TEST(PwExporterDaemonTest, ExportsDriverAndFollowerCountersFromALiveDaemon) {
   ASSERT_TRUE(daemon.started());
   ASSERT_TRUE(Eventually([&] { return ::access((runtime + "/pipewire-0").c_str(), F_OK) == 0; }))
       << ReadFile(logFile);
-  // Link the source to the sink so the dummy driver has a graph to run.
-  ASSERT_TRUE(Eventually([&] {
-    Child link({kPwLink, "test-source:capture_1", "test sink:playback_FL"}, logFile);
-    return link.Wait() == 0;
-  })) << ReadFile(logFile);
 
   {
     Child exporter({TAVRIN_PW_EXPORTER_PATH, "--root", tree.root(), "--interval-ms", "50"},
@@ -358,9 +324,7 @@ TEST(PwExporterDaemonTest, ExportsDriverAndFollowerCountersFromALiveDaemon) {
              Counter(tree, "Speaker/test_sink/cycles") > 0 &&
              Counter(tree, "Speaker/test-source/cycles") > 0;
     })) << ReadFile(logFile);
-
-    const int64_t before = Counter(tree, "Speaker/Dummy-Driver/cycles");
-    EXPECT_TRUE(Eventually([&] { return Counter(tree, "Speaker/Dummy-Driver/cycles") > before; }));
+    // That they keep rising is PwExporterServiceE2eTest's.
     EXPECT_GE(Counter(tree, "Speaker/Dummy-Driver/xruns"), 0);
     EXPECT_GE(Counter(tree, "Speaker/test_sink/busy_ns_total"), 0);
 
