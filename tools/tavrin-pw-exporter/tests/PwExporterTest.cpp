@@ -8,30 +8,26 @@
 #include <unistd.h>
 
 #include <array>
-#include <chrono>
 #include <cstring>
 #include <fstream>
 #include <random>
 #include <set>
-#include <thread>
 
 #include "CounterWriter.h"
 #include "ProfilerCounters.h"
 #include "ProfilerPod.h"
 #include "platform/linux/driverstats/CountersTreeDriverStats.h"
 #include "tests/support/TempCountersTree.h"
+#include "tests/support/TestClient.h"
 
 extern char** environ;
 
 namespace tavrin::pwexport {
 namespace {
 
+using testing::ReadFile;
 using testing::TempCountersTree;
-
-std::string ReadFile(const std::string& path) {
-  std::ifstream in(path);
-  return std::string(std::istreambuf_iterator<char>(in), {});
-}
+using testing::WaitUntil;
 
 // --- Names and the writer ---
 
@@ -248,17 +244,6 @@ context.objects = [
 ]
 )";
 
-// Polls `done` every 50 ms for up to 30 s (generous: the machine is shared and loaded).
-template <typename Predicate>
-bool Eventually(Predicate done) {
-  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(30);
-  while (std::chrono::steady_clock::now() < deadline) {
-    if (done()) return true;
-    std::this_thread::sleep_for(std::chrono::milliseconds(50));
-  }
-  return done();
-}
-
 // A child process with the test's environment, its output appended to `output`.
 class Child {
  public:
@@ -285,7 +270,7 @@ class Child {
   // The exit status, or -1 if the child did not end in time.
   int Wait() {
     int status = 0;
-    if (!Eventually([&] { return ::waitpid(pid_, &status, WNOHANG) == pid_; })) return -1;
+    if (!WaitUntil([&] { return ::waitpid(pid_, &status, WNOHANG) == pid_; })) return -1;
     pid_ = -1;
     return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
   }
@@ -312,14 +297,14 @@ TEST(PwExporterDaemonTest, ExportsDriverAndFollowerCountersFromALiveDaemon) {
 
   Child daemon({kPipeWire, "-c", runtime + "/daemon.conf"}, logFile);
   ASSERT_TRUE(daemon.started());
-  ASSERT_TRUE(Eventually([&] { return ::access((runtime + "/pipewire-0").c_str(), F_OK) == 0; }))
+  ASSERT_TRUE(WaitUntil([&] { return ::access((runtime + "/pipewire-0").c_str(), F_OK) == 0; }))
       << ReadFile(logFile);
 
   {
     Child exporter({TAVRIN_PW_EXPORTER_PATH, "--root", tree.root(), "--interval-ms", "50"},
                    logFile);
     ASSERT_TRUE(exporter.started());
-    ASSERT_TRUE(Eventually([&] {
+    ASSERT_TRUE(WaitUntil([&] {
       return Counter(tree, "Speaker/Dummy-Driver/cycles") > 0 &&
              Counter(tree, "Speaker/test_sink/cycles") > 0 &&
              Counter(tree, "Speaker/test-source/cycles") > 0;
@@ -333,15 +318,13 @@ TEST(PwExporterDaemonTest, ExportsDriverAndFollowerCountersFromALiveDaemon) {
   }
 
   // The daemon going away ends the exporter with status 1, for its supervisor to restart it.
-  const std::string secondLog = runtime + "/second.log";
-  Child exporter({TAVRIN_PW_EXPORTER_PATH, "--root", tree.root(), "--interval-ms", "50"},
-                 secondLog);
-  ASSERT_TRUE(Eventually([&] {
-    return ReadFile(secondLog).find("profiling, counters under") != std::string::npos;
-  })) << ReadFile(secondLog);
+  Child exporter({TAVRIN_PW_EXPORTER_PATH, "--root", tree.root(), "--interval-ms", "50"}, logFile);
+  ASSERT_TRUE(WaitUntil([&] {
+    return testing::Occurrences(ReadFile(logFile), "profiling, counters under") == 2;
+  })) << ReadFile(logFile);
   daemon.Signal(SIGTERM);
   EXPECT_EQ(daemon.Wait(), 0);
-  EXPECT_EQ(exporter.Wait(), 1) << ReadFile(secondLog);
+  EXPECT_EQ(exporter.Wait(), 1) << ReadFile(logFile);
 }
 
 }  // namespace
