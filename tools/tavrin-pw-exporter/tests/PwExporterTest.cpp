@@ -306,12 +306,10 @@ TEST(PwExporterDaemonTest, ExportsDriverAndFollowerCountersFromALiveDaemon) {
     ASSERT_TRUE(exporter.started());
     ASSERT_TRUE(WaitUntil([&] {
       return Counter(tree, "Speaker/Dummy-Driver/cycles") > 0 &&
-             Counter(tree, "Speaker/test_sink/cycles") > 0 &&
              Counter(tree, "Speaker/test-source/cycles") > 0;
     })) << ReadFile(logFile);
-    // That they keep rising is PwExporterServiceE2eTest's.
+    // The sink's cycles and busy time, and that they keep rising, are PwExporterServiceE2eTest's.
     EXPECT_GE(Counter(tree, "Speaker/Dummy-Driver/xruns"), 0);
-    EXPECT_GE(Counter(tree, "Speaker/test_sink/busy_ns_total"), 0);
 
     exporter.Signal(SIGTERM);
     EXPECT_EQ(exporter.Wait(), 0) << ReadFile(logFile);
