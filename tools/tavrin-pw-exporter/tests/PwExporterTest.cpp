@@ -62,12 +62,7 @@ TEST(CounterWriterTest, WritesReplaceAtomicallyRefuseUnsafeNamesAndReportFilesys
 // --- Counting ---
 
 ProfileNode Node(std::string name, int64_t signal, int64_t awake, int64_t finish) {
-  ProfileNode node;
-  node.name = std::move(name);
-  node.times.signal = signal;
-  node.times.awake = awake;
-  node.times.finish = finish;
-  return node;
+  return {.name = std::move(name), .times = {.signal = signal, .awake = awake, .finish = finish}};
 }
 
 std::map<std::string, int64_t> AsMap(const std::vector<CounterUpdate>& updates) {
@@ -78,16 +73,12 @@ std::map<std::string, int64_t> AsMap(const std::vector<CounterUpdate>& updates) 
 
 TEST(ProfilerCountersTest, SumsMaximaIncompleteCyclesAndXruns) {
   ProfilerCounters counters;
-  ProfileCycle first;
-  first.xrunCount = 2;
-  first.driver = Node("Dummy-Driver", 1000, 1100, 1500);
-  first.followers = {Node("test sink", 1500, 1800, 2000), Node("late", 1500, 0, 0)};
-  counters.Add(first);
-  ProfileCycle second;
-  second.xrunCount = 3;
-  second.driver = Node("Dummy-Driver", 2000, 2050, 2300);
-  second.followers = {Node("test sink", 2300, 2400, 3000)};
-  counters.Add(second);
+  counters.Add({.xrunCount = 2,
+                .driver = Node("Dummy-Driver", 1000, 1100, 1500),
+                .followers = {Node("test sink", 1500, 1800, 2000), Node("late", 1500, 0, 0)}});
+  counters.Add({.xrunCount = 3,
+                .driver = Node("Dummy-Driver", 2000, 2050, 2300),
+                .followers = {Node("test sink", 2300, 2400, 3000)}});
 
   // Every counter of every node, and the cycle's xruns on its driver.
   const char* const names[] = {"cycles",      "incomplete_cycles", "busy_ns_total",
@@ -104,10 +95,8 @@ TEST(ProfilerCountersTest, SumsMaximaIncompleteCyclesAndXruns) {
   EXPECT_EQ(AsMap(counters.TakeChanged()), expected);
   EXPECT_TRUE(counters.TakeChanged().empty());  // nothing new, nothing to write
 
-  ProfileCycle third;
-  third.xrunCount = 3;  // unchanged: not written again
-  third.driver = Node("Dummy-Driver", 3000, 3010, 3020);
-  counters.Add(third);
+  // The xruns unchanged: not written again.
+  counters.Add({.xrunCount = 3, .driver = Node("Dummy-Driver", 3000, 3010, 3020), .followers = {}});
   EXPECT_EQ(AsMap(counters.TakeChanged()), (std::map<std::string, int64_t>{
                                                {"Dummy-Driver/busy_ns_total", 660},
                                                {"Dummy-Driver/cycles", 3},
