@@ -25,13 +25,11 @@ using Bytes = std::vector<uint8_t>;
 // input is not depth-checked beyond the point where it broke.
 constexpr size_t kMaxCompareSize = 1024;
 
-#define FUZZ_CHECK(condition)                                                            \
-  do {                                                                                   \
-    if (!(condition)) {                                                                  \
-      std::fprintf(stderr, "%s:%d: check failed: %s\n", __FILE__, __LINE__, #condition); \
-      std::abort();                                                                      \
-    }                                                                                    \
-  } while (0)
+[[noreturn]] void Fail(const char* condition, int line) {
+  std::fprintf(stderr, "%s:%d: check failed: %s\n", __FILE__, line, condition);
+  std::abort();
+}
+#define FUZZ_CHECK(condition) ((condition) ? void() : Fail(#condition, __LINE__))
 
 void CheckScanAgainstParser(std::span<const uint8_t> input) {
   // The scan alone decides; the parser must then succeed exactly on what it let through.
