@@ -8,7 +8,7 @@ packages=(
   # toolchain
   g++ cmake ninja-build pkg-config git ccache make
   # tests, benchmarks, formatting
-  libgtest-dev libgmock-dev libbenchmark-dev clang-format clang-tidy
+  libgtest-dev libgmock-dev libbenchmark-dev clang-format clang-tidy libmsgpack-cxx-dev
   # the report opened in a real browser (headless), by a Python driver
   chromium python3
   # libraries of the service
