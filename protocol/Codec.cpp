@@ -56,7 +56,8 @@ RequestError OverLimit(std::optional<uint64_t> call, LimitCode limit, std::strin
 // Reads the arguments of one request, remembering the first failure.
 class ArgumentReader {
  public:
-  ArgumentReader(const Value& request, std::optional<uint64_t> call, std::string_view operation,
+  // Map() moves its argument out of `request`: each argument is read once.
+  ArgumentReader(Value& request, std::optional<uint64_t> call, std::string_view operation,
                  const RequestLimits& limits)
       : request_(request), call_(call), operation_(operation), limits_(limits) {}
 
@@ -83,13 +84,13 @@ class ArgumentReader {
 
   Dictionary Map(size_t index, std::string_view name) {
     if (failure_) return Dictionary::object();
-    const Value& value = request_[index + 1];
+    Value& value = request_[index + 1];
     if (!value.is_object()) {
       Fail(RejectCode::kWrongArgumentType, fmt::format("argument {} ({}) of {} is {}, not a map",
                                                        index, name, operation_, KindName(value)));
       return Dictionary::object();
     }
-    return value;
+    return std::move(value);
   }
 
   std::optional<std::vector<int64_t>> ReporterList(size_t index, std::string_view name) {
@@ -142,7 +143,7 @@ class ArgumentReader {
     failure_ = Reject(call_, code, std::move(reason));
   }
 
-  const Value& request_;
+  Value& request_;
   std::optional<uint64_t> call_;
   std::string_view operation_;
   const RequestLimits& limits_;
@@ -279,7 +280,7 @@ std::variant<Request, RequestError> DecodeRequest(std::span<const uint8_t> body,
   }
   if (!decoded.value) return Close("undecodable MessagePack");
 
-  const Value& request = *decoded.value;
+  Value& request = *decoded.value;
   const Value& opValue = request[1];
   const auto op = IntegerAs<uint8_t>(opValue);
   const auto name = op ? OperationName(*op) : std::nullopt;
