@@ -205,34 +205,6 @@ TEST(ProfilerPodTest, TruncatedAndRandomBytesNeverReadOutOfBounds) {
 
 constexpr const char* kPipeWire = "/usr/bin/pipewire";
 
-// A daemon without sound hardware: the dummy driver clocks a test source linked to a null sink
-// (linked by the configuration: the nodes and their ports exist by then).
-constexpr const char* kDaemonConfig = R"(
-context.properties = { support.dbus = false core.daemon = true core.name = pipewire-0
-  mem.allow-mlock = false default.clock.rate = 48000 default.clock.quantum = 1024 }
-context.spa-libs = { audio.convert.* = audioconvert/libspa-audioconvert
-  support.* = support/libspa-support audiotestsrc = audiotestsrc/libspa-audiotestsrc }
-context.modules = [ { name = libpipewire-module-protocol-native }
-  { name = libpipewire-module-profiler } { name = libpipewire-module-metadata }
-  { name = libpipewire-module-spa-node-factory } { name = libpipewire-module-client-node }
-  { name = libpipewire-module-access args = { } } { name = libpipewire-module-adapter }
-  { name = libpipewire-module-link-factory } ]
-context.objects = [
-  { factory = spa-node-factory args = { factory.name = support.node.driver
-      node.name = Dummy-Driver node.group = pipewire.dummy priority.driver = 20000 } }
-  { factory = adapter args = { factory.name = support.null-audio-sink node.name = "test sink"
-      media.class = Audio/Sink audio.position = [ FL FR ] node.group = pipewire.dummy
-      adapter.auto-port-config = { mode = dsp monitor = false control = false
-                                   position = preserve } } }
-  { factory = adapter args = { factory.name = audiotestsrc node.name = test-source
-      media.class = Audio/Source audio.position = [ FL FR ] node.group = pipewire.dummy
-      adapter.auto-port-config = { mode = dsp monitor = false control = false
-                                   position = preserve } } }
-  { factory = link-factory args = { link.output.node = test-source link.output.port = capture_1
-      link.input.node = "test sink" link.input.port = playback_FL object.linger = true } }
-]
-)";
-
 // A child process with the test's environment, its output appended to `output`.
 class Child {
  public:
@@ -277,14 +249,13 @@ TEST(PwExporterDaemonTest, ExportsDriverAndFollowerCountersFromALiveDaemon) {
   TempCountersTree tree;
   const std::string runtime = tree.outside();
   ::chmod(runtime.c_str(), 0700);
-  std::ofstream(runtime + "/daemon.conf") << kDaemonConfig;
   // The daemon and its clients meet in the tree's private runtime directory.
   ::setenv("XDG_RUNTIME_DIR", runtime.c_str(), 1);
   ::setenv("PIPEWIRE_RUNTIME_DIR", runtime.c_str(), 1);
   ::unsetenv("PIPEWIRE_REMOTE");
   const std::string logFile = runtime + "/output.log";
 
-  Child daemon({kPipeWire, "-c", runtime + "/daemon.conf"}, logFile);
+  Child daemon({kPipeWire, "-c", PIPEWIRE_NULL_GRAPH_CONF}, logFile);
   ASSERT_TRUE(daemon.started());
   ASSERT_TRUE(WaitUntil([&] { return ::access((runtime + "/pipewire-0").c_str(), F_OK) == 0; }))
       << ReadFile(logFile);
