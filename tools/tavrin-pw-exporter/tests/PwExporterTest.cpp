@@ -9,7 +9,6 @@
 
 #include <array>
 #include <cstring>
-#include <fstream>
 #include <random>
 #include <set>
 
