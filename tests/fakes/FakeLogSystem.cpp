@@ -1,6 +1,7 @@
 #include "tests/fakes/FakeLogSystem.h"
 
 #include <atomic>
+#include <regex>
 
 namespace tavrin::testing {
 
@@ -73,6 +74,18 @@ size_t FakeLogSystem::Count(std::string_view needle, LogLevel level) const {
   size_t count = 0;
   for (const auto& line : Matching(needle)) count += line.level == level ? 1 : 0;
   return count;
+}
+
+std::vector<std::string> FakeLogSystem::Messages(std::optional<LogLevel> level,
+                                                 std::string_view scope) const {
+  static const std::regex prefix("^[^:]+:[0-9]+:.*?: ");
+  std::vector<std::string> messages;
+  for (const auto& line : Lines()) {
+    if ((level && line.level != *level) || (!scope.empty() && line.scope != scope)) continue;
+    messages.push_back(
+        std::regex_replace(line.text, prefix, "", std::regex_constants::format_first_only));
+  }
+  return messages;
 }
 
 void FakeLogSystem::Clear() {

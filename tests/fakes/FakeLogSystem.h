@@ -2,6 +2,7 @@
 
 #include <map>
 #include <mutex>
+#include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -40,6 +41,10 @@ class FakeLogSystem final : public LogSystem, private GuardedState {
   size_t Count(std::string_view needle) const;
   size_t Count(std::string_view needle, LogLevel level) const;
   bool Contains(std::string_view needle) const { return Count(needle) > 0; }
+  // The texts of lines without their "file:line:function: " prefix, of `level` and `scope` when
+  // given, in order.
+  std::vector<std::string> Messages(std::optional<LogLevel> level = {},
+                                    std::string_view scope = {}) const;
   void Clear();
 
   // What RegisterLogScope was asked, by scope name.

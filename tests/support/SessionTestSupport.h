@@ -1,10 +1,10 @@
 #pragma once
 
+#include <algorithm>
 #include <cstdlib>
 #include <ctime>
 #include <memory>
 #include <optional>
-#include <regex>
 #include <string>
 #include <vector>
 
@@ -24,12 +24,6 @@ namespace tavrin::testing {
 inline FakeLogSystem& ProcessLogSystem() {
   static FakeLogSystem* const system = new FakeLogSystem();
   return *system;
-}
-
-// The text of a logged line without its "file:line:function: " prefix.
-inline std::string LineMessage(const std::string& line) {
-  static const std::regex prefix("^[^:]+:[0-9]+:.*?: ");
-  return std::regex_replace(line, prefix, "", std::regex_constants::format_first_only);
 }
 
 // Base of the session tests: a fresh fake platform per test, the process's log facility cleared,
@@ -52,18 +46,9 @@ class SessionTestBase : public ::testing::Test {
     return session;
   }
 
-  // Messages (prefix removed) of the session scope, in order, of `level`.
-  std::vector<std::string> SessionMessages(LogLevel level) const { return Messages("rvrr", level); }
-  std::vector<std::string> DefaultMessages(LogLevel level) const {
-    return Messages("default", level);
-  }
   // Lines whose message (prefix removed) is `message`, of `level` when given.
   size_t CountMessage(const std::string& message, std::optional<LogLevel> level = {}) const {
-    size_t count = 0;
-    for (const auto& line : log.Lines()) {
-      count += (!level || line.level == *level) && LineMessage(line.text) == message ? 1 : 0;
-    }
-    return count;
+    return static_cast<size_t>(std::ranges::count(log.Messages(level), message));
   }
 
   // Payloads aggregated, none when the aggregation is gone.
@@ -83,15 +68,6 @@ class SessionTestBase : public ::testing::Test {
   FakeLogSystem& log;
   FakePlatform platform;
   RecordingTraceRecorder traces;
-
- private:
-  std::vector<std::string> Messages(const std::string& scope, LogLevel level) const {
-    std::vector<std::string> messages;
-    for (const auto& line : log.Lines()) {
-      if (line.scope == scope && line.level == level) messages.push_back(LineMessage(line.text));
-    }
-    return messages;
-  }
 };
 
 }  // namespace tavrin::testing

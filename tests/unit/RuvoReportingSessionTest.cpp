@@ -77,7 +77,7 @@ TEST_F(SessionTest, CreationSettersAndReleaseAreLoggedAndTraced) {
   session->setConfiguration(Dictionary());               // none: nothing changes
   session->setConfiguration(Dictionary::array({1, 2}));  // not a dictionary: refused, logged
   EXPECT_EQ(session->userInfo(), (Dictionary{{"a", 1}, {"b", 3}, {"c", "x"}}));
-  EXPECT_EQ(SessionMessages(LogLevel::kError).size(), 1u);
+  EXPECT_EQ(log.Messages(LogLevel::kError, "rvrr").size(), 1u);
 
   session.reset();
   EXPECT_EQ(traces.Count(trace::kSessionReleased), 1u);
@@ -350,7 +350,7 @@ TEST_F(SessionTest, TheBackEndGetsKeysWithoutBlanksAndTheLogTheMessageAsSent) {
   session->sendMessage(Value::array({1, 2}), 1, 1, nullptr);  // not a dictionary: reported
   session->sendMessage(Value(), 1, 1, nullptr);
   platform.dispatcher.RunUntilIdle();
-  EXPECT_EQ(SessionMessages(LogLevel::kError).size(), 1u);
+  EXPECT_EQ(log.Messages(LogLevel::kError, "rvrr").size(), 1u);
 
   const auto messages = platform.telvoro.LastSession()->Messages();
   ASSERT_EQ(messages.size(), 3u);
@@ -369,7 +369,7 @@ TEST_F(SessionTest, TheBackEndGetsKeysWithoutBlanksAndTheLogTheMessageAsSent) {
   Send(session, Dictionary{{"a", 1}});
   platform.dispatcher.RunUntilIdle();
   EXPECT_EQ(platform.telvoro.LastSession()->RefusedCount(), 1u);
-  EXPECT_EQ(SessionMessages(LogLevel::kError).size(), 1u);
+  EXPECT_EQ(log.Messages(LogLevel::kError, "rvrr").size(), 1u);
 }
 
 TEST_F(SessionTest, MessageIdsCountPerCategoryAndType) {
@@ -638,7 +638,7 @@ TEST_F(SinksTest, EveryMessageBecomesANamedAnalyticsEventWithTheSessionsApplicat
   EXPECT_EQ(*events[4].payload, (Dictionary{{"HostApplicationDisplayID", "Unknown"}}));
   // No engine time, or no dictionary: no power event.
   EXPECT_TRUE(platform.powerLog.Events().empty());
-  EXPECT_TRUE(DefaultMessages(LogLevel::kError).empty());
+  EXPECT_TRUE(log.Messages(LogLevel::kError, "default").empty());
 }
 
 TEST_F(SinksTest, TheLazyPayloadIsTheOnePreparedAtSendTimeAndASwitchedOffSinkNeverBuildsIt) {
@@ -662,7 +662,7 @@ TEST_F(SinksTest, TheLazyPayloadIsTheOnePreparedAtSendTimeAndASwitchedOffSinkNev
 TEST_F(SinksTest, EngineTimeBecomesAPowerEventAndAMissingTimestampIsLogged) {
   Offer(Dictionary{{"EngineOnTime", 12.5}, {"ruvoreporting_timestamp", 1700000000123}, {"x", 1}}, 3,
         2);
-  EXPECT_TRUE(DefaultMessages(LogLevel::kError).empty());
+  EXPECT_TRUE(log.Messages(LogLevel::kError, "default").empty());
   Offer(Dictionary{{"EngineOnTime", 3}}, 1, 1);
   const auto events = platform.powerLog.Events();
   ASSERT_EQ(events.size(), 2u);
@@ -675,7 +675,7 @@ TEST_F(SinksTest, EngineTimeBecomesAPowerEventAndAMissingTimestampIsLogged) {
                                           .dump());
   EXPECT_EQ(events[1].payload,
             (Dictionary{{"EngineOnDuration", 3}, {"ApplicationName", "com.example.game"}}));
-  EXPECT_EQ(DefaultMessages(LogLevel::kError),
+  EXPECT_EQ(log.Messages(LogLevel::kError, "default"),
             std::vector<std::string>{"failed to get RuvoReporting timestamp for kelvane"});
 }
 
@@ -686,7 +686,7 @@ TEST_F(SinksTest, AnAbsentApplicationNameIsLoggedAndLeftOut) {
   const auto events = platform.powerLog.Events();
   ASSERT_EQ(events.size(), 1u);
   EXPECT_EQ(events[0].payload, (Dictionary{{"EngineOnDuration", "7"}, {"TimestampEnd", 5}}));
-  EXPECT_EQ(DefaultMessages(LogLevel::kError),
+  EXPECT_EQ(log.Messages(LogLevel::kError, "default"),
             std::vector<std::string>{"failed to get app name for kelvane"});
 
   RuvoReportingKelvaneUtility::handleEvent(Dictionary{{"EngineOnTime", 1}}, 1, 1, *Create(7, 3));

@@ -58,7 +58,7 @@ TEST_F(SummaryTest, TheFileIsNamedByLocalTimeAppAndServiceInAPrivateDirectory) {
     EXPECT_EQ(creates.back(), std::make_pair(std::string(kDirectory), 0750u));
   }
   EXPECT_EQ(platform.fileSystem.Files().size(), 3u);
-  EXPECT_TRUE(SessionMessages(LogLevel::kError).empty());
+  EXPECT_TRUE(log.Messages(LogLevel::kError, "rvrr").empty());
 }
 
 // Generated sessions (seeded): the summary event and file, built as messages arrive, must equal
@@ -171,7 +171,7 @@ TEST_F(SummaryTest, AFullSpoolLeavesLaterMessagesOutOfTheFileButNotOfTheSummary)
             (Dictionary{{"Ruvo_Session_Summary_Event", "3"}, {"k", joined}}));
   session->stop();
   platform.dispatcher.RunUntilIdle();
-  const auto errors = SessionMessages(LogLevel::kError);
+  const auto errors = log.Messages(LogLevel::kError, "rvrr");
   ASSERT_EQ(errors.size(), 1u);
   EXPECT_NE(errors[0].find("the spool is full"), std::string::npos) << errors[0];
   const Value file =
@@ -282,7 +282,7 @@ TEST_F(SummaryTest, FileErrorsAreLoggedAndTheStepsAfterThemStillRun) {
     platform.dispatcher.RunUntilIdle();
     platform.services.fileSystem = &platform.fileSystem;
 
-    const auto errors = SessionMessages(LogLevel::kError);
+    const auto errors = log.Messages(LogLevel::kError, "rvrr");
     ASSERT_EQ(errors.size(), c.errors.size());
     for (size_t i = 0; i < errors.size(); ++i) EXPECT_EQ(errors[i].rfind(c.errors[i], 0), 0u);
     const bool valid = std::string(c.value) == "x";
