@@ -36,10 +36,6 @@ class FakeNotificationCenter final : public NotificationCenter {
           [handler = registration.handler, delivered] { handler(delivered); });
     }
   }
-  size_t registrations() const {
-    std::lock_guard lock(mutex_);
-    return registrations_.size();
-  }
 
   int failWith = 0;  // a non-zero status makes registration fail
 

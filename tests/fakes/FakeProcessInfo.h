@@ -13,14 +13,13 @@ namespace tavrin::testing {
 class FakeProcessInfo final : public ProcessInfo {
  public:
   int32_t ownPid = 4242;
-  std::string ownName = "tavrind";
 
   void SetCommandName(int32_t pid, std::string name) {
     std::lock_guard lock(mutex_);
     names_[pid] = std::move(name);
   }
   int32_t OwnProcessIdentifier() const override { return ownPid; }
-  std::string OwnProcessName() const override { return ownName; }
+  std::string OwnProcessName() const override { return "tavrind"; }
   std::optional<std::string> CommandName(int32_t pid) const override {
     std::lock_guard lock(mutex_);
     auto found = names_.find(pid);

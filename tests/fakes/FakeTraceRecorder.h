@@ -23,10 +23,6 @@ class RecordingTraceRecorder final : public TraceRecorder {
     std::lock_guard lock(mutex_);
     return static_cast<size_t>(std::count(codes_.begin(), codes_.end(), code));
   }
-  void Clear() {
-    std::lock_guard lock(mutex_);
-    codes_.clear();
-  }
 
  private:
   mutable std::mutex mutex_;
