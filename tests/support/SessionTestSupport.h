@@ -45,6 +45,24 @@ class SessionTestBase : public ::testing::Test {
     session->setServiceType(serviceType);
     return session;
   }
+  // A session given `configuration` and started, with the queued half of start run (up to the
+  // back-end wait).
+  std::shared_ptr<RuvoReportingSession> Started(uint16_t serviceType = 3,
+                                                const Dictionary& configuration = Dictionary(),
+                                                int64_t reporterID = 42) {
+    auto session = Create(reporterID, serviceType);
+    session->setConfiguration(configuration);
+    StartAndRun(session);
+    return session;
+  }
+  void StartAndRun(const std::shared_ptr<RuvoReportingSession>& session) {
+    session->start();
+    platform.dispatcher.RunUntilIdle();
+  }
+  void StopAndRun(const std::shared_ptr<RuvoReportingSession>& session) {
+    session->stop();
+    platform.dispatcher.RunUntilIdle();
+  }
 
   // Lines whose message (prefix removed) is `message`, of `level` when given.
   size_t CountMessage(const std::string& message, std::optional<LogLevel> level = {}) const {

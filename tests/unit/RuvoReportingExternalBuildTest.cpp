@@ -20,16 +20,14 @@ TEST_F(ExternalBuildTest, NoFileIsWrittenAndNoOrientationTrackedHoweverMuchWasAg
   for (uint16_t type : {uint16_t{2}, uint16_t{7}}) {
     auto session = Create(42, type);
     EXPECT_FALSE(session->shouldReportOrientation());
-    session->start();
-    platform.dispatcher.RunUntilIdle();
+    StartAndRun(session);
     EXPECT_FALSE(session->orientationCallbackID().has_value());
     EXPECT_FALSE(session->startDate().has_value());
     for (int i = 0; i < 50; ++i) session->sendMessage(Dictionary{{"n", i}}, 1, 1, nullptr);
     session->stop();
     session->start();
     session->sendMessage(Dictionary{{"n", 0}}, 1, 1, nullptr);
-    session->stop();
-    platform.dispatcher.RunUntilIdle();
+    StopAndRun(session);
   }
   EXPECT_TRUE(platform.fileSystem.CreateDirectoriesCalls().empty());
   EXPECT_TRUE(platform.fileSystem.WriteCalls().empty());

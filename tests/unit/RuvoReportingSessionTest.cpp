@@ -34,16 +34,6 @@ using Kind = FakeOrientationRegistry::Kind;
 
 class SessionTest : public SessionTestBase {
  protected:
-  // A session started, with the queued half of start run (up to the back-end wait).
-  std::shared_ptr<RuvoReportingSession> Started(int64_t reporterID = 42, uint16_t type = 3) {
-    auto session = Create(reporterID, type);
-    StartAndRun(session);
-    return session;
-  }
-  void StartAndRun(const std::shared_ptr<RuvoReportingSession>& session) {
-    session->start();
-    platform.dispatcher.RunUntilIdle();
-  }
   void Send(const std::shared_ptr<RuvoReportingSession>& session, const Dictionary& payload) {
     session->sendMessage(payload, 1, 1, nullptr);
   }
@@ -130,8 +120,7 @@ TEST_F(SessionTest, BackendsThatNeverAnswerDropTheSessionAfterNineSecondsAndAggr
   session->sendMessage(Dictionary{{"seq", 3}}, 1, 1, reply);
   EXPECT_EQ(replies, 4);
   EXPECT_EQ(Aggregated(session->summaryTexts()), 4u);
-  session->stop();
-  platform.dispatcher.RunUntilIdle();
+  StopAndRun(session);
   EXPECT_EQ(CountMessage("sending summary event for reporter 42", LogLevel::kDefault), 1u);
   EXPECT_EQ(CountMessage("No valid TelvoroSession", LogLevel::kError), 5u);
   EXPECT_EQ(replies, 4);  // none twice
@@ -236,9 +225,7 @@ TEST_F(SessionTest, ServiceNamesAndBatchingFollowTheServiceTypeUnlessTheClientNa
       {0xFFFF, Dictionary(), {{"ClientName", client}, {"ServiceName", "unknown_session"}}},
   };
   for (const auto& c : cases) {
-    auto session = Create(1, c.type);
-    session->setConfiguration(c.configuration);
-    StartAndRun(session);
+    Started(c.type, c.configuration, 1);
     const auto fake = platform.telvoro.LastSession();
     EXPECT_EQ(fake->UserInfo(), c.userInfo) << c.type;
     // Only API-usage sessions are real-time.
@@ -250,7 +237,7 @@ TEST_F(SessionTest, ServiceNamesAndBatchingFollowTheServiceTypeUnlessTheClientNa
 // --- start and stop ---------------------------------------------------------------------------
 
 TEST_F(SessionTest, TestSessionsGetNoBackEndButStillSummarise) {
-  auto session = Started(5, 11);
+  auto session = Started(11, Dictionary(), 5);
   EXPECT_TRUE(platform.telvoro.Tokens().empty());
   EXPECT_TRUE(platform.telvoro.Sessions().empty());
   EXPECT_EQ(session->telvoroAgentToken(), nullptr);
@@ -259,8 +246,7 @@ TEST_F(SessionTest, TestSessionsGetNoBackEndButStillSummarise) {
   platform.dispatcher.RunUntilIdle();
   EXPECT_EQ(CountMessage("transactions aren't allowed on this platform", LogLevel::kInfo), 1u);
 
-  session->stop();
-  platform.dispatcher.RunUntilIdle();
+  StopAndRun(session);
   EXPECT_EQ(CountMessage("sending summary event for reporter 5"), 1u);
   EXPECT_EQ(CountMessage("transactions aren't allowed on this platform"), 2u);
   EXPECT_EQ(platform.fileSystem.Files().size(), 1u);
@@ -273,8 +259,7 @@ TEST_F(SessionTest, BeforeStartMessagesGoAloneStopDoesNothingAndStartDropsTheAgg
   session->sendMessage(Dictionary{{"early", 1}}, 1, 1,
                        [&](const OptionalError& error) { replied = !error; });
   EXPECT_TRUE(replied);
-  session->stop();
-  platform.dispatcher.RunUntilIdle();
+  StopAndRun(session);
   EXPECT_FALSE(session->started());
   EXPECT_EQ(CountMessage("sending summary event for reporter 42"), 0u);
   EXPECT_TRUE(platform.fileSystem.CreateDirectoriesCalls().empty());
@@ -331,8 +316,7 @@ TEST_F(SessionTest, StartingTwiceChangesNothingButARestartGetsANewBackEndAndFres
   EXPECT_EQ(traces.Count(trace::kSessionStarted), 1u);
 
   Send(session, Dictionary{{"a", 2}});
-  session->stop();
-  platform.dispatcher.RunUntilIdle();
+  StopAndRun(session);
   StartAndRun(session);
   EXPECT_EQ(platform.telvoro.Sessions().size(), 2u);
   EXPECT_EQ(platform.telvoro.Tokens().size(), 2u);
@@ -393,9 +377,7 @@ TEST_F(SessionTest, MessageIdsCountPerCategoryAndType) {
 }
 
 TEST_F(SessionTest, AfterStopMessagesGoAloneAndReachNoSummary) {
-  auto session = Create(42, 2);
-  session->setConfiguration(Dictionary{{"HostApplicationDisplayID", "app"}});
-  StartAndRun(session);
+  auto session = Started(2, Dictionary{{"HostApplicationDisplayID", "app"}});
   Send(session, Dictionary{{"kept", 1}});
   session->stop();
   session->sendMessage(Dictionary{{"late key", 2}}, 3, 4, nullptr);
@@ -496,13 +478,13 @@ constexpr const char* kCallbackID = "RuvoReportingService 42";
 // stop; other types, never-started sessions and device class 6 never track.
 TEST_F(SessionTest, OnlyTelephonyAndLongFormAudioTrackOrientation) {
   for (uint16_t type : {uint16_t{0}, uint16_t{3}, uint16_t{8}, uint16_t{0xFFFF}}) {
-    auto session = Started(42, type);
+    auto session = Started(type);
     EXPECT_FALSE(session->orientationCallbackID().has_value()) << type;
     session->stop();
   }
   Create(42, 2)->stop();  // never started: nothing to unregister
   platform.deviceInfo.SetInt32(kDeviceInfoDeviceClassNumber, 6);
-  auto classSix = Started(42, 2);
+  auto classSix = Started(2);
   EXPECT_FALSE(classSix->shouldReportOrientation());
   EXPECT_FALSE(classSix->orientationCallbackID().has_value());
   EXPECT_TRUE(platform.orientation.History().empty());
@@ -511,7 +493,7 @@ TEST_F(SessionTest, OnlyTelephonyAndLongFormAudioTrackOrientation) {
 
   for (uint16_t type : {uint16_t{2}, uint16_t{7}}) {
     const size_t before = platform.orientation.History().size();
-    auto session = Started(42, type);
+    auto session = Started(type);
     EXPECT_TRUE(session->shouldReportOrientation());
     EXPECT_EQ(session->orientationCallbackID(), kCallbackID);
     EXPECT_EQ(session->startDate(), platform.clock.Now());
@@ -533,7 +515,7 @@ TEST_F(SessionTest, OnlyTelephonyAndLongFormAudioTrackOrientation) {
 
 TEST_F(SessionTest, TimesAreRoundedToWholeMilliseconds) {
   platform.orientation.SetText("3", "landscape-left");
-  auto session = Started(42, 2);
+  auto session = Started(2);
   platform.clock.Advance(microseconds(12600));
   EXPECT_EQ(platform.orientation.FireUI("3"), 1u);
   platform.clock.Advance(microseconds(2000400 - 12600));
@@ -554,7 +536,7 @@ TEST_F(SessionTest, TimesAreRoundedToWholeMilliseconds) {
 }
 
 TEST_F(SessionTest, TheCallbacksHoldTheSessionUntilStopUnregistersThem) {
-  std::weak_ptr<RuvoReportingSession> weak = Started(42, 2);
+  std::weak_ptr<RuvoReportingSession> weak = Started(2);
   // Released without stop: still registered, still aggregating.
   ASSERT_FALSE(weak.expired());
   EXPECT_EQ(platform.orientation.FireUI("portrait"), 1u);
@@ -573,7 +555,7 @@ TEST_F(SessionTest, TheCallbacksHoldTheSessionUntilStopUnregistersThem) {
 }
 
 TEST_F(SessionTest, ARestartRegistersAgainAndRecordsInterleaveWithMessages) {
-  auto session = Started(42, 7);
+  auto session = Started(7);
   session->stop();
   platform.clock.Advance(std::chrono::seconds(30));
   session->start();

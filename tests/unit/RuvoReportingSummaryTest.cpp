@@ -19,17 +19,7 @@ namespace {
 constexpr const char* kDirectory = "/fake/log/DiagnosticLogs/Audio/Reporting";
 
 // The base sets TZ to UTC for every test, so a zone a case sets does not outlive it.
-class SummaryTest : public SessionTestBase {
- protected:
-  std::shared_ptr<RuvoReportingSession> Started(uint16_t serviceType,
-                                                const Dictionary& configuration = Dictionary()) {
-    auto session = Create(42, serviceType);
-    session->setConfiguration(configuration);
-    session->start();
-    platform.dispatcher.RunUntilIdle();
-    return session;
-  }
-};
+using SummaryTest = SessionTestBase;
 
 TEST_F(SummaryTest, TheFileIsNamedByLocalTimeAppAndServiceInAPrivateDirectory) {
   const struct {
@@ -49,8 +39,7 @@ TEST_F(SummaryTest, TheFileIsNamedByLocalTimeAppAndServiceInAPrivateDirectory) {
     auto session = Started(c.serviceType,
                            c.app ? Dictionary{{"HostApplicationDisplayID", c.app}} : Dictionary());
     session->sendMessage(Dictionary{{"a", 1}}, 1, 1, nullptr);
-    session->stop();
-    platform.dispatcher.RunUntilIdle();  // the file is written on the session's queue
+    StopAndRun(session);  // the file is written on the session's queue
     ASSERT_FALSE(platform.fileSystem.WriteCalls().empty());
     EXPECT_EQ(platform.fileSystem.WriteCalls().back(), std::string(kDirectory) + "/" + c.name);
     const auto creates = platform.fileSystem.CreateDirectoriesCalls();
@@ -119,8 +108,7 @@ TEST_F(SummaryTest, GeneratedSessionsMatchThePlainAlgorithm) {
       const auto summary = session->createSummaryEventForSession();
       ASSERT_EQ(summary ? summary->dump() : "none", sent.empty() ? "none" : expected.dump());
       const size_t writes = platform.fileSystem.WriteCalls().size();
-      session->stop();
-      platform.dispatcher.RunUntilIdle();
+      StopAndRun(session);
       const auto calls = platform.fileSystem.WriteCalls();
       ASSERT_EQ(calls.size(), writes + (sent.empty() ? 0 : 1));
       if (!sent.empty()) {
@@ -169,8 +157,7 @@ TEST_F(SummaryTest, AFullSpoolLeavesLaterMessagesOutOfTheFileButNotOfTheSummary)
   EXPECT_LT(spooled, 10u);
   EXPECT_EQ(session->createSummaryEventForSession(),
             (Dictionary{{"Ruvo_Session_Summary_Event", "3"}, {"k", joined}}));
-  session->stop();
-  platform.dispatcher.RunUntilIdle();
+  StopAndRun(session);
   const auto errors = log.Messages(LogLevel::kError, "rvrr");
   ASSERT_EQ(errors.size(), 1u);
   EXPECT_NE(errors[0].find("the spool is full"), std::string::npos) << errors[0];
@@ -278,8 +265,7 @@ TEST_F(SummaryTest, FileErrorsAreLoggedAndTheStepsAfterThemStillRun) {
     log.Clear();
     auto session = Started(3);
     session->sendMessage(Dictionary{{"bad", c.value}}, 1, 1, nullptr);
-    session->stop();
-    platform.dispatcher.RunUntilIdle();
+    StopAndRun(session);
     platform.services.fileSystem = &platform.fileSystem;
 
     const auto errors = log.Messages(LogLevel::kError, "rvrr");
