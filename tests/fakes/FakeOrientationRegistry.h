@@ -23,6 +23,7 @@ class FakeOrientationRegistry final : public OrientationRegistry {
     Kind kind;
     bool registered;  // false: unregistered
     std::string id;
+    bool operator==(const Change&) const = default;
   };
 
   void RegisterDeviceOrientation(const std::string& id, Callback callback) override {

@@ -31,6 +31,7 @@ using std::chrono::seconds;
 using Builders = FakeAnalyticsSink::Builders;
 using Discovery = FakeTelvoroService::Discovery;
 using Kind = FakeOrientationRegistry::Kind;
+using Change = FakeOrientationRegistry::Change;
 
 class SessionTest : public SessionTestBase {
  protected:
@@ -502,14 +503,11 @@ TEST_F(SessionTest, OnlyTelephonyAndLongFormAudioTrackOrientation) {
     EXPECT_EQ(platform.orientation.FireDevice("portrait"), 0u);
 
     const auto history = platform.orientation.History();
-    ASSERT_EQ(history.size(), before + 4);
-    const Kind kinds[] = {Kind::kDevice, Kind::kUI, Kind::kDevice, Kind::kUI};
-    const bool registered[] = {true, true, false, false};
-    for (size_t i = 0; i < 4; ++i) {
-      EXPECT_EQ(history[before + i].kind, kinds[i]) << i;
-      EXPECT_EQ(history[before + i].registered, registered[i]) << i;
-      EXPECT_EQ(history[before + i].id, kCallbackID) << i;
-    }
+    EXPECT_EQ(std::vector<Change>(history.begin() + before, history.end()),
+              (std::vector<Change>{{Kind::kDevice, true, kCallbackID},
+                                   {Kind::kUI, true, kCallbackID},
+                                   {Kind::kDevice, false, kCallbackID},
+                                   {Kind::kUI, false, kCallbackID}}));
   }
 }
 
@@ -775,11 +773,8 @@ TEST_F(SessionThreadsTest, MessagesKeepTheirOrderWhileOrientationAndStopRunElsew
     EXPECT_FALSE(summary.contains("late"));
     records += summary.contains("device_orientation") || summary.contains("ui_orientation");
     if (summary.contains("device_orientation")) {
-      const auto count = [&](const char* key) {
-        const std::string text = summary[key].get<std::string>();
-        return std::count(text.begin(), text.end(), ',');
-      };
-      EXPECT_EQ(count("device_orientation"), count("device_orientation_time"));
+      EXPECT_EQ(std::ranges::count(summary["device_orientation"].get<std::string>(), ','),
+                std::ranges::count(summary["device_orientation_time"].get<std::string>(), ','));
     }
     EXPECT_EQ(fake->MessagesAtFlush(), std::vector<size_t>{kMessages + 1});
   }
