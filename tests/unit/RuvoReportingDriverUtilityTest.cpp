@@ -2,7 +2,6 @@
 
 #include <gtest/gtest.h>
 
-#include <algorithm>
 
 #include "tests/fakes/FakeDriverStatsService.h"
 #include "tests/fakes/FakeLogSystem.h"

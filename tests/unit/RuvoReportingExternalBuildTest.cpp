@@ -1,8 +1,6 @@
 // Sessions on a build that is not internal: no summary file, no orientation tracking. The
 // internal-build answer is fixed once per process, hence an executable of its own.
 
-#include <memory>
-
 #include <gtest/gtest.h>
 
 #include "Statistics/Service/RuvoReportingSession.h"

@@ -3,7 +3,6 @@
 #include <algorithm>
 #include <cstdlib>
 #include <ctime>
-#include <memory>
 #include <random>
 #include <string>
 #include <vector>
