@@ -203,44 +203,42 @@ struct RejectCase {
 // One row per branch that rejects (integers out of range: the integer table above), with the
 // reason for one of each kind.
 std::vector<RejectCase> RejectCases() {
+  using C = RejectCode;
   return {
       // 1: op not an integer from 1 to 12
-      {"op 0", RequestBytes(0, Pack().uint(0), {}), RejectCode::kUnknownOp},
-      {"op 13", RequestBytes(0, Pack().uint(13), {}), RejectCode::kUnknownOp,
-       "unknown operation 13"},
-      {"op 2^64-1", RequestBytes(0, Pack().uint(kUint64Max), {}), RejectCode::kUnknownOp},
-      {"op -1", RequestBytes(0, Pack().integer(IntFormat::kNegativeFixint, -1), {}),
-       RejectCode::kUnknownOp},
-      {"op \"1\"", RequestBytes(1, Pack().str("1"), Pack().uint(1)), RejectCode::kUnknownOp},
+      {"op 0", RequestBytes(0, Pack().uint(0), {}), C::kUnknownOp},
+      {"op 13", RequestBytes(0, Pack().uint(13), {}), C::kUnknownOp, "unknown operation 13"},
+      {"op 2^64-1", RequestBytes(0, Pack().uint(kUint64Max), {}), C::kUnknownOp},
+      {"op -1", RequestBytes(0, Pack().integer(IntFormat::kNegativeFixint, -1), {}), C::kUnknownOp},
+      {"op \"1\"", RequestBytes(1, Pack().str("1"), Pack().uint(1)), C::kUnknownOp},
       // 2: argument count, one short and one over
-      {"create without ID", RequestBytes(0, Pack().uint(1), {}), RejectCode::kWrongArgumentCount},
+      {"create without ID", RequestBytes(0, Pack().uint(1), {}), C::kWrongArgumentCount},
       {"create with 2", RequestBytes(2, Pack().uint(1), Pack().uint(1).uint(2)),
-       RejectCode::kWrongArgumentCount, "createReportingSession:reply: takes 1 argument(s), got 2"},
+       C::kWrongArgumentCount, "createReportingSession:reply: takes 1 argument(s), got 2"},
       // 3: argument of the wrong type
-      {"reporterID string", RequestBytes(1, Pack().uint(1), Pack().str("5")),
-       RejectCode::kWrongArgumentType,
+      {"reporterID string", RequestBytes(1, Pack().uint(1), Pack().str("5")), C::kWrongArgumentType,
        "argument 1 (reporterID) of createReportingSession:reply: is a string, not an integer"},
       {"serviceType 70000", RequestBytes(2, Pack().uint(2), Pack().uint(70000).uint(1)),
-       RejectCode::kIntegerOutOfRange,
+       C::kIntegerOutOfRange,
        "argument 1 (serviceType) of setServiceType:reportingSession:reply:: 70000 does not fit an "
        "unsigned 16-bit integer"},
       {"configuration array", RequestBytes(2, Pack().uint(4), Pack().array(0).uint(1)),
-       RejectCode::kWrongArgumentType},
+       C::kWrongArgumentType},
       {"reporterIDs map", RequestBytes(4, Pack().uint(6), Pack().map(0).uint(1).uint(1).map(0)),
-       RejectCode::kWrongArgumentType},
+       C::kWrongArgumentType},
       {"reporterIDs element float",
        RequestBytes(4, Pack().uint(6), Pack().map(0).uint(1).uint(1).array(2).uint(1).float64(2)),
-       RejectCode::kWrongArgumentType},
+       C::kWrongArgumentType},
       {"integer map key",
        RequestBytes(4, Pack().uint(6), Pack().map(1).uint(1).str("v").uint(1).uint(1).nil()),
-       RejectCode::kWrongArgumentType},
+       C::kWrongArgumentType},
       // 5: nesting
-      {"65 levels", RequestBytes(1, Pack().uint(1), Nested(64)), RejectCode::kTooDeep},
+      {"65 levels", RequestBytes(1, Pack().uint(1), Nested(64)), C::kTooDeep},
       // 6: bin and ext
       {"bin8 in a message",
        RequestBytes(4, Pack().uint(6),
                     Pack().map(1).str("b").raw({0xc4, 1, 0}).uint(1).uint(1).nil()),
-       RejectCode::kUnsupportedType},
+       C::kUnsupportedType},
   };
 }
 
@@ -350,26 +348,24 @@ TEST(CodecTest, EveryTruncationOfEveryRequestClosesTheConnection) {
 // Precedence
 
 TEST(CodecTest, ChecksRunInTheirDocumentedOrder) {
-  // Depth before bin/ext before a non-string key before the op.
-  EXPECT_EQ(
-      Refused(RequestBytes(2, Pack().uint(99), Pack().raw({0xc4, 0}).append(Nested(70)))).code,
-      RejectCode::kTooDeep);
-  EXPECT_EQ(
-      Refused(RequestBytes(2, Pack().uint(99), Pack().map(1).uint(1).nil().raw({0xc4, 0}))).code,
-      RejectCode::kUnsupportedType);
-  EXPECT_EQ(Refused(RequestBytes(1, Pack().uint(99), Pack().map(1).uint(1).nil())).code,
-            RejectCode::kWrongArgumentType);
-  // The op before the argument count.
-  EXPECT_EQ(Refused(RequestBytes(5, Pack().uint(99), Pack().nil().nil().nil().nil().nil())).code,
-            RejectCode::kUnknownOp);
-  // The argument count before the argument types.
-  EXPECT_EQ(Refused(RequestBytes(2, Pack().uint(1), Pack().str("a").str("b"))).code,
-            RejectCode::kWrongArgumentCount);
-  // Arguments in order: the first one's fault is reported.
-  EXPECT_EQ(Refused(RequestBytes(2, Pack().uint(2), Pack().str("a").uint(kUint64Max))).code,
-            RejectCode::kWrongArgumentType);
-  EXPECT_EQ(Refused(RequestBytes(2, Pack().uint(2), Pack().uint(70000).str("b"))).code,
-            RejectCode::kIntegerOutOfRange);
+  using C = RejectCode;
+  const std::pair<Bytes, C> cases[] = {
+      // Depth before bin/ext before a non-string key before the op.
+      {RequestBytes(2, Pack().uint(99), Pack().raw({0xc4, 0}).append(Nested(70))), C::kTooDeep},
+      {RequestBytes(2, Pack().uint(99), Pack().map(1).uint(1).nil().raw({0xc4, 0})),
+       C::kUnsupportedType},
+      {RequestBytes(1, Pack().uint(99), Pack().map(1).uint(1).nil()), C::kWrongArgumentType},
+      // The op before the argument count.
+      {RequestBytes(5, Pack().uint(99), Pack().nil().nil().nil().nil().nil()), C::kUnknownOp},
+      // The argument count before the argument types.
+      {RequestBytes(2, Pack().uint(1), Pack().str("a").str("b")), C::kWrongArgumentCount},
+      // Arguments in order: the first one's fault is reported.
+      {RequestBytes(2, Pack().uint(2), Pack().str("a").uint(kUint64Max)), C::kWrongArgumentType},
+      {RequestBytes(2, Pack().uint(2), Pack().uint(70000).str("b")), C::kIntegerOutOfRange},
+  };
+  for (size_t i = 0; i < std::size(cases); ++i) {
+    EXPECT_EQ(Refused(cases[i].first).code, cases[i].second) << "case " << i;
+  }
 }
 
 // ---------------------------------------------------------------------------------------------
