@@ -6,11 +6,12 @@
 #include <string>
 
 #include "platform/NotificationCenter.h"
+#include "tests/fakes/GuardedState.h"
 
 namespace tavrin::testing {
 
 // Notifications posted by the test; handlers run on their queue like the real ones.
-class FakeNotificationCenter final : public NotificationCenter {
+class FakeNotificationCenter final : public NotificationCenter, private GuardedState {
  public:
   int RegisterNotificationHandler(const std::string& name, int* token, WorkQueue& queue,
                                   Handler handler) override {
@@ -45,7 +46,6 @@ class FakeNotificationCenter final : public NotificationCenter {
     WorkQueue* queue;
     Handler handler;
   };
-  mutable std::mutex mutex_;
   std::map<int, Registration> registrations_;
   int nextToken_ = 1;
 };

@@ -8,6 +8,7 @@
 #include <vector>
 
 #include "platform/OrientationRegistry.h"
+#include "tests/fakes/GuardedState.h"
 
 namespace tavrin::testing {
 
@@ -15,7 +16,7 @@ namespace tavrin::testing {
 // for the registry's own thread). Keeps the real contract: once Unregister returns, the
 // callbacks of that id are not called again, even when another thread is firing meanwhile.
 // Callbacks must not register or unregister from inside a firing. Thread-safe.
-class FakeOrientationRegistry final : public OrientationRegistry {
+class FakeOrientationRegistry final : public OrientationRegistry, private GuardedState {
  public:
   enum class Kind { kDevice, kUI };
   // One registration or unregistration, in call order.
@@ -60,10 +61,7 @@ class FakeOrientationRegistry final : public OrientationRegistry {
     std::lock_guard lock(mutex_);
     return Callbacks(kind).size();
   }
-  std::vector<Change> History() const {
-    std::lock_guard lock(mutex_);
-    return history_;
-  }
+  std::vector<Change> History() const { return Locked(history_); }
   // Drops every callback (and what they hold), as a registry that goes away does.
   void Clear() {
     std::map<std::string, Callback> device, ui;
@@ -117,7 +115,6 @@ class FakeOrientationRegistry final : public OrientationRegistry {
   }
 
   std::mutex fireMutex_;  // held while callbacks run, so Unregister waits for a firing to end
-  mutable std::mutex mutex_;
   std::map<std::string, Callback> device_;         // guarded by mutex_
   std::map<std::string, Callback> ui_;             // guarded by mutex_
   std::map<OrientationValue, std::string> texts_;  // guarded by mutex_

@@ -6,11 +6,12 @@
 #include <string>
 
 #include "platform/ProcessInfo.h"
+#include "tests/fakes/GuardedState.h"
 
 namespace tavrin::testing {
 
 // Process names from a table the test fills.
-class FakeProcessInfo final : public ProcessInfo {
+class FakeProcessInfo final : public ProcessInfo, private GuardedState {
  public:
   int32_t ownPid = 4242;
 
@@ -28,7 +29,6 @@ class FakeProcessInfo final : public ProcessInfo {
   }
 
  private:
-  mutable std::mutex mutex_;
   std::map<int32_t, std::string> names_;
 };
 

@@ -6,11 +6,12 @@
 #include <vector>
 
 #include "platform/TracePoints.h"
+#include "tests/fakes/GuardedState.h"
 
 namespace tavrin::testing {
 
 // Sees every trace point fired while it lives.
-class RecordingTraceRecorder final : public TraceRecorder {
+class RecordingTraceRecorder final : public TraceRecorder, private GuardedState {
  public:
   RecordingTraceRecorder() : previous_(InstallTraceRecorder(this)) {}
   ~RecordingTraceRecorder() override { InstallTraceRecorder(previous_); }
@@ -25,7 +26,6 @@ class RecordingTraceRecorder final : public TraceRecorder {
   }
 
  private:
-  mutable std::mutex mutex_;
   std::vector<uint32_t> codes_;
   TraceRecorder* previous_;
 };
