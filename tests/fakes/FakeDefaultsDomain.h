@@ -11,12 +11,10 @@ namespace tavrin::testing {
 class FakeDefaultsDomain final : public DefaultsDomain, private GuardedState {
  public:
   void Set(const std::string& key, Value value) {
-    std::lock_guard lock(mutex_);
-    values_[key] = std::move(value);
+    WithLock([&] { values_[key] = std::move(value); });
   }
   void Remove(const std::string& key) {
-    std::lock_guard lock(mutex_);
-    values_.erase(key);
+    WithLock([&] { values_.erase(key); });
   }
   Dictionary Read() override {
     std::lock_guard lock(mutex_);

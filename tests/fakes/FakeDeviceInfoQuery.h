@@ -18,12 +18,10 @@ namespace tavrin::testing {
 class FakeDeviceInfo final : public DeviceInfoQuery, private GuardedState {
  public:
   void SetBool(std::string_view key, bool value) {
-    std::lock_guard lock(mutex_);
-    bools_[std::string(key)] = value;
+    WithLock([&] { bools_[std::string(key)] = value; });
   }
   void SetInt32(std::string_view key, int32_t value) {
-    std::lock_guard lock(mutex_);
-    ints_[std::string(key)] = value;
+    WithLock([&] { ints_[std::string(key)] = value; });
   }
   // Runs on the querying thread before each answer, outside the fake's lock (for example to
   // hold a query open while other threads pile up behind a once-only guard).

@@ -88,9 +88,4 @@ std::vector<std::string> FakeLogSystem::Messages(std::optional<LogLevel> level,
   return messages;
 }
 
-void FakeLogSystem::Clear() {
-  std::lock_guard lock(mutex_);
-  lines_.clear();
-}
-
 }  // namespace tavrin::testing

@@ -44,7 +44,9 @@ class FakeLogSystem final : public LogSystem, private GuardedState {
   // given, in order.
   std::vector<std::string> Messages(std::optional<LogLevel> level = {},
                                     std::string_view scope = {}) const;
-  void Clear();
+  void Clear() {
+    WithLock([&] { lines_.clear(); });
+  }
 
   // What RegisterLogScope was asked, by scope name.
   struct Registration {

@@ -23,8 +23,7 @@ class FakeNotificationCenter final : public NotificationCenter, private GuardedS
     return 0;
   }
   void Cancel(int token) override {
-    std::lock_guard lock(mutex_);
-    registrations_.erase(token);
+    WithLock([&] { registrations_.erase(token); });
   }
   void Post(const std::string& name) override { PostWithToken(name, std::nullopt); }
   // Posts as if the registration's token were `token` (a stale or foreign token).

@@ -45,8 +45,7 @@ class FakeOrientationRegistry final : public OrientationRegistry, private Guarde
     return found == texts_.end() ? value : found->second;
   }
   void SetText(const OrientationValue& value, std::string text) {
-    std::lock_guard lock(mutex_);
-    texts_[value] = std::move(text);
+    WithLock([&] { texts_[value] = std::move(text); });
   }
 
   // Calls every registered callback of the kind with `value`; returns how many were called.
@@ -54,12 +53,10 @@ class FakeOrientationRegistry final : public OrientationRegistry, private Guarde
   size_t FireUI(const OrientationValue& value) { return Fire(Kind::kUI, value); }
 
   bool IsRegistered(Kind kind, const std::string& id) const {
-    std::lock_guard lock(mutex_);
-    return Callbacks(kind).count(id) > 0;
+    return WithLock([&] { return Callbacks(kind).count(id) > 0; });
   }
   size_t RegisteredCount(Kind kind) const {
-    std::lock_guard lock(mutex_);
-    return Callbacks(kind).size();
+    return WithLock([&] { return Callbacks(kind).size(); });
   }
   std::vector<Change> History() const { return Locked(history_); }
   // Drops every callback (and what they hold), as a registry that goes away does.

@@ -16,8 +16,7 @@ class FakeProcessInfo final : public ProcessInfo, private GuardedState {
   int32_t ownPid = 4242;
 
   void SetCommandName(int32_t pid, std::string name) {
-    std::lock_guard lock(mutex_);
-    names_[pid] = std::move(name);
+    WithLock([&] { names_[pid] = std::move(name); });
   }
   int32_t OwnProcessIdentifier() const override { return ownPid; }
   std::string OwnProcessName() const override { return "tavrind"; }

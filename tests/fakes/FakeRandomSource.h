@@ -22,8 +22,7 @@ class FakeRandom final : public RandomSource, private GuardedState {
 
   // Appends values to answer before the default.
   void Script(std::initializer_list<uint64_t> values) {
-    std::lock_guard lock(mutex_);
-    scripted_.insert(scripted_.end(), values.begin(), values.end());
+    WithLock([&] { scripted_.insert(scripted_.end(), values.begin(), values.end()); });
   }
 
   uint64_t UniformBelow(uint64_t bound) override {

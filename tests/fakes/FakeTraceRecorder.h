@@ -17,12 +17,10 @@ class RecordingTraceRecorder final : public TraceRecorder, private GuardedState 
   ~RecordingTraceRecorder() override { InstallTraceRecorder(previous_); }
 
   void Record(uint32_t code) override {
-    std::lock_guard lock(mutex_);
-    codes_.push_back(code);
+    WithLock([&] { codes_.push_back(code); });
   }
   size_t Count(uint32_t code) const {
-    std::lock_guard lock(mutex_);
-    return static_cast<size_t>(std::count(codes_.begin(), codes_.end(), code));
+    return WithLock([&] { return static_cast<size_t>(std::ranges::count(codes_, code)); });
   }
 
  private:
