@@ -29,15 +29,11 @@ class FakeAnalyticsSink final : public AnalyticsSink, private GuardedState {
   void SetBuilders(Builders mode) { Set(mode_, mode); }
 
   void SendEventLazy(const std::string& name, std::function<Dictionary()> buildPayload) override {
-    size_t index = 0;
-    Builders mode;
-    {
-      std::lock_guard lock(mutex_);
-      index = events_.size();
+    const auto [index, mode] = WithLock([&] {
       events_.push_back(Event{name, 0, std::nullopt});
       builders_.push_back(buildPayload);
-      mode = mode_;
-    }
+      return std::pair(events_.size() - 1, mode_);
+    });
     if (mode == Builders::kCallAtOnce) RunBuilder(index);
   }
 
@@ -45,12 +41,7 @@ class FakeAnalyticsSink final : public AnalyticsSink, private GuardedState {
   size_t RunPendingBuilders() {
     size_t count = 0;
     for (size_t index = 0; index < Events().size(); ++index) {
-      bool pending;
-      {
-        std::lock_guard lock(mutex_);
-        pending = events_[index].builderCalls == 0;
-      }
-      if (pending && RunBuilder(index)) ++count;
+      if (Events()[index].builderCalls == 0 && RunBuilder(index)) ++count;
     }
     return count;
   }

@@ -47,10 +47,7 @@ bool FakeTelvoroSession::SendSessionMessage(uint16_t category, uint16_t type,
 
 void FakeTelvoroSession::FlushMessages(std::function<void(const OptionalError&)> done) {
   OptionalError failure = service_.Locked(service_.flushError_);
-  {
-    std::lock_guard lock(mutex_);
-    messagesAtFlush_.push_back(messages_.size());
-  }
+  WithLock([&] { messagesAtFlush_.push_back(messages_.size()); });
   if (done) done(failure);
 }
 
@@ -61,11 +58,8 @@ std::string FakeTelvoroSession::Description() const {
 size_t FakeTelvoroService::AnswerPendingDiscoveries(const BackendList& backends) {
   size_t answered = 0;
   for (const auto& session : Sessions()) {
-    std::function<void(const BackendList&)> done;
-    {
-      std::lock_guard lock(session->mutex_);
-      done = std::exchange(session->pendingDiscovery_, nullptr);
-    }
+    const auto done =
+        session->WithLock([&] { return std::exchange(session->pendingDiscovery_, nullptr); });
     if (!done) continue;
     done(backends);
     ++answered;
@@ -74,8 +68,7 @@ size_t FakeTelvoroService::AnswerPendingDiscoveries(const BackendList& backends)
 }
 
 std::shared_ptr<FakeTelvoroSession> FakeTelvoroService::LastSession() const {
-  std::lock_guard lock(mutex_);
-  return sessions_.empty() ? nullptr : sessions_.back();
+  return WithLock([&] { return sessions_.empty() ? nullptr : sessions_.back(); });
 }
 
 TelvoroTokenPtr FakeTelvoroService::NewSecureHierarchyToken(const TelvoroTokenPtr& parent) {
