@@ -243,9 +243,7 @@ TEST_F(ServiceDelegateTest, StopSendsThePositiveDriverDeltaIntoTheSessionFirst) 
   ASSERT_EQ(platform.telvoro.Sessions().size(), 1u);
   auto messages = platform.telvoro.Sessions()[0]->Messages();
   ASSERT_EQ(messages.size(), 2u) << "the delta, then the summary of the stop";
-  EXPECT_EQ(messages[0].category, 9);
-  EXPECT_EQ(messages[0].type, 0);
-  EXPECT_EQ(messages[0].payload, (Dictionary{{"Speaker_xruns", 3}}));
+  EXPECT_EQ(messages[0], (testing::FakeTelvoroMessage{9, 0, {{"Speaker_xruns", 3}}}));
   EXPECT_EQ(messages[1].type, kSummaryEventType);  // the category reaches it masked to 16 bits
   EXPECT_EQ(log.Count("fetching driver logs {\"Speaker_xruns\":3}"), 1u);
   RuvoReportingSessionPtr session = delegate->findReportingSessionForID(7);
