@@ -1,5 +1,6 @@
 #include "tests/fakes/FakeLogSystem.h"
 
+#include <algorithm>
 #include <atomic>
 #include <regex>
 
@@ -68,12 +69,9 @@ std::vector<LoggedLine> FakeLogSystem::Matching(std::string_view needle) const {
   return found;
 }
 
-size_t FakeLogSystem::Count(std::string_view needle) const { return Matching(needle).size(); }
-
-size_t FakeLogSystem::Count(std::string_view needle, LogLevel level) const {
-  size_t count = 0;
-  for (const auto& line : Matching(needle)) count += line.level == level ? 1 : 0;
-  return count;
+size_t FakeLogSystem::Count(std::string_view needle, std::optional<LogLevel> level) const {
+  return static_cast<size_t>(std::ranges::count_if(
+      Matching(needle), [&](const LoggedLine& line) { return !level || line.level == *level; }));
 }
 
 std::vector<std::string> FakeLogSystem::Messages(std::optional<LogLevel> level,

@@ -37,8 +37,7 @@ class FakeLogSystem final : public LogSystem, private GuardedState {
   std::vector<LoggedLine> Lines() const { return Locked(lines_); }
   // Lines whose text contains `needle` (and, when given, have `level`).
   std::vector<LoggedLine> Matching(std::string_view needle) const;
-  size_t Count(std::string_view needle) const;
-  size_t Count(std::string_view needle, LogLevel level) const;
+  size_t Count(std::string_view needle, std::optional<LogLevel> level = {}) const;
   bool Contains(std::string_view needle) const { return Count(needle) > 0; }
   // The texts of lines without their "file:line:function: " prefix, of `level` and `scope` when
   // given, in order.

@@ -105,8 +105,7 @@ TEST(IsInternalBuildTest, SixteenConcurrentFirstCallsAskOnceAndAgree) {
   device.SetBool("InternalBuild", true);
   // Holds the one query open so that the other threads reach the guard while it runs.
   device.SetQueryHook([](std::string_view) { std::this_thread::sleep_for(milliseconds(50)); });
-  PlatformServices services;
-  services.deviceInfo = &device;
+  PlatformServices services{.deviceInfo = &device};
 
   std::latch start(kThreads);
   std::vector<int> answers(kThreads, -1);
@@ -125,8 +124,7 @@ TEST(IsInternalBuildTest, SixteenConcurrentFirstCallsAskOnceAndAgree) {
   device.SetBool("InternalBuild", false);
   EXPECT_TRUE(IsInternalBuild(services));
   EXPECT_EQ(device.QueryCount("InternalBuild"), 1u);
-  PlatformServices other;
-  other.deviceInfo = &device;
+  PlatformServices other{.deviceInfo = &device};
   EXPECT_FALSE(IsInternalBuild(other));
   PlatformServices noQuery;
   EXPECT_FALSE(IsInternalBuild(noQuery));
