@@ -12,6 +12,7 @@
 #include <thread>
 #include <vector>
 
+#include <fmt/format.h>
 #include <gtest/gtest.h>
 
 #include "Statistics/RuvoReportingKelvaneUtility.h"
@@ -194,13 +195,10 @@ TEST_F(SessionTest, AnImmediateAnswerMeansNoWaitAndTheBackEndGetsSessionAndUserI
   auto fake = platform.telvoro.LastSession();
   const Dictionary& info = fake->SessionInfo();
   // As text, so the number types count too.
-  EXPECT_EQ(info.dump(), (Dictionary{{"ClientType", 19},
-                                     {"ClientVersion", 2.0},
-                                     {"SessionID", reporter},
-                                     {"BatchEvent", true},
-                                     {"HierarchyToken", token->value},
-                                     {"ContainsRealtimeEvents", false}})
-                             .dump());
+  EXPECT_EQ(info.dump(), fmt::format(R"({{"ClientType":19,"ClientVersion":2.0,"SessionID":{},)"
+                                     R"("BatchEvent":true,"HierarchyToken":{},)"
+                                     R"("ContainsRealtimeEvents":false}})",
+                                     reporter, token->value));
   EXPECT_EQ(fake->UserInfo(), (Dictionary{{"ClientName", "com.quorvex.tavrin"},
                                           {"ServiceName", "telephony_session"},
                                           {"HostApplicationDisplayID", "com.example.app"},
