@@ -53,35 +53,29 @@ class FakeOrientationRegistry final : public OrientationRegistry, private Guarde
   size_t FireUI(const OrientationValue& value) { return Fire(Kind::kUI, value); }
 
   bool IsRegistered(Kind kind, const std::string& id) const {
-    return WithLock([&] { return Callbacks(kind).count(id) > 0; });
+    return WithLock([&] { return callbacks_[size_t(kind)].count(id) > 0; });
   }
   size_t RegisteredCount(Kind kind) const {
-    return WithLock([&] { return Callbacks(kind).size(); });
+    return WithLock([&] { return callbacks_[size_t(kind)].size(); });
   }
   std::vector<Change> History() const { return Locked(history_); }
   // Drops every callback (and what they hold), as a registry that goes away does.
   void Clear() {
-    std::map<std::string, Callback> device, ui;
+    ByID dropped[2];  // released after the locks
     {
       std::lock_guard firing(fireMutex_);
       std::lock_guard lock(mutex_);
-      device.swap(device_);
-      ui.swap(ui_);
+      std::swap(dropped, callbacks_);
     }
   }
 
  private:
-  std::map<std::string, Callback>& Callbacks(Kind kind) {
-    return kind == Kind::kDevice ? device_ : ui_;
-  }
-  const std::map<std::string, Callback>& Callbacks(Kind kind) const {
-    return kind == Kind::kDevice ? device_ : ui_;
-  }
+  using ByID = std::map<std::string, Callback>;
 
   void Register(Kind kind, const std::string& id, Callback callback) {
     Callback previous;
     std::lock_guard lock(mutex_);
-    previous = std::exchange(Callbacks(kind)[id], std::move(callback));
+    previous = std::exchange(callbacks_[size_t(kind)][id], std::move(callback));
     history_.push_back(Change{kind, true, id});
   }
 
@@ -90,7 +84,7 @@ class FakeOrientationRegistry final : public OrientationRegistry, private Guarde
     {
       std::lock_guard firing(fireMutex_);
       std::lock_guard lock(mutex_);
-      auto& callbacks = Callbacks(kind);
+      auto& callbacks = callbacks_[size_t(kind)];
       const auto found = callbacks.find(id);
       if (found != callbacks.end()) {
         removed = std::move(found->second);
@@ -105,15 +99,14 @@ class FakeOrientationRegistry final : public OrientationRegistry, private Guarde
     std::vector<Callback> callbacks;
     {
       std::lock_guard lock(mutex_);
-      for (const auto& entry : Callbacks(kind)) callbacks.push_back(entry.second);
+      for (const auto& entry : callbacks_[size_t(kind)]) callbacks.push_back(entry.second);
     }
     for (const auto& callback : callbacks) callback(value);
     return callbacks.size();
   }
 
   std::mutex fireMutex_;  // held while callbacks run, so Unregister waits for a firing to end
-  std::map<std::string, Callback> device_;         // guarded by mutex_
-  std::map<std::string, Callback> ui_;             // guarded by mutex_
+  ByID callbacks_[2];     // by Kind, guarded by mutex_
   std::map<OrientationValue, std::string> texts_;  // guarded by mutex_
   std::vector<Change> history_;                    // guarded by mutex_
 };
