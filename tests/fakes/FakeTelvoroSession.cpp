@@ -31,16 +31,14 @@ void FakeTelvoroSession::StartConfiguration(std::function<void(const BackendList
 bool FakeTelvoroSession::SendSessionMessage(uint16_t category, uint16_t type,
                                             const Dictionary& payload, Error* error,
                                             const DeliveryReceiptPtr& receipt) {
-  OptionalError failure = service_.Locked(service_.sendError_);
-  {
-    std::lock_guard lock(mutex_);
-    if (failure) {
+  const OptionalError failure = service_.Locked(service_.sendError_);
+  if (failure && error != nullptr) *error = *failure;
+  WithLock([&] {
+    if (failure)
       ++refused_;
-      if (error != nullptr) *error = *failure;
-    } else {
+    else
       messages_.push_back(FakeTelvoroMessage{category, type, payload});
-    }
-  }
+  });
   Settle(receipt, !failure, DropReason::kQueueFull);
   return !failure;
 }
@@ -93,19 +91,16 @@ TelvoroSessionPtr FakeTelvoroService::CreateTelvoroSession(
 bool FakeTelvoroService::SendOneMessage(const Dictionary& sessionInfo, const Dictionary& userInfo,
                                         uint16_t category, uint16_t type, const Dictionary& payload,
                                         Error* error, const DeliveryReceiptPtr& receipt) {
-  bool accepted = false;
-  {
-    std::lock_guard lock(mutex_);
-    if (sendError_) {
+  const OptionalError failure = Locked(sendError_);
+  if (failure && error != nullptr) *error = *failure;
+  WithLock([&] {
+    if (failure)
       ++refusedSingles_;
-      if (error != nullptr) *error = *sendError_;
-    } else {
+    else
       singleMessages_.push_back(SingleMessage{sessionInfo, userInfo, category, type, payload});
-      accepted = true;
-    }
-  }
-  Settle(receipt, accepted, DropReason::kQueueFull);
-  return accepted;
+  });
+  Settle(receipt, !failure, DropReason::kQueueFull);
+  return !failure;
 }
 
 }  // namespace tavrin::testing
