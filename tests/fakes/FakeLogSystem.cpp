@@ -55,15 +55,9 @@ LogHandle FakeLogSystem::RegisterLogScope(bool enabled, uint32_t code, std::stri
 
 LogScope& FakeLogSystem::DefaultLog() { return *defaultScope_; }
 
-void FakeLogSystem::Append(const std::string& scope, LogLevel level, std::string_view text) {
-  std::lock_guard lock(mutex_);
-  lines_.push_back(LoggedLine{scope, level, std::string(text)});
-}
-
 std::vector<LoggedLine> FakeLogSystem::Matching(std::string_view needle) const {
-  std::lock_guard lock(mutex_);
   std::vector<LoggedLine> found;
-  for (const auto& line : lines_) {
+  for (const auto& line : Lines()) {
     if (line.text.find(needle) != std::string::npos) found.push_back(line);
   }
   return found;

@@ -59,7 +59,9 @@ class FakeLogSystem final : public LogSystem, private GuardedState {
 
  private:
   class Scope;
-  void Append(const std::string& scope, LogLevel level, std::string_view text);
+  void Append(const std::string& scope, LogLevel level, std::string_view text) {
+    WithLock([&] { lines_.push_back(LoggedLine{scope, level, std::string(text)}); });
+  }
   bool Verbose() const { return Locked(verbose_); }
 
   std::vector<LoggedLine> lines_;
