@@ -183,20 +183,21 @@ TEST(WaitTest, ScriptedOutcomesGiveTheirResultDeadlinesAndLines) {
     std::vector<O> script;
     bool result;
     std::vector<SteadyTime> deadlines;
-    std::vector<std::string> lines;  // W = waiting, C = continuing, T = timed out (an error)
+    std::vector<std::string>
+        lines;  // W (waiting) and "continuing" by default, T (timed out) an error
   } cases[] = {
       {{{O::kTimeOut}}, false, {t0 + t}, {"W", "T"}},
-      {{{O::kSignalWithFlag, milliseconds(300)}}, true, {t0 + t}, {"W", "C"}},
+      {{{O::kSignalWithFlag, milliseconds(300)}}, true, {t0 + t}, {"W", "continuing"}},
       {{{O::kSignalWithoutFlag, seconds(2)},
         {O::kSignalWithoutFlag, milliseconds(2400)},
         {O::kSignalWithFlag, seconds(1)}},
        true,
        {t0 + t, t0 + seconds(2) + t, t0 + milliseconds(4400) + t},
-       {"W", "C", "W", "C", "W", "C"}},
+       {"W", "continuing", "W", "continuing", "W", "continuing"}},
       {{{O::kSignalWithoutFlag, seconds(2)}, {O::kTimeOut}},
        false,
        {t0 + t, t0 + seconds(2) + t},
-       {"W", "C", "W", "T"}},
+       {"W", "continuing", "W", "T"}},
   };
   for (size_t i = 0; i < std::size(cases); ++i) {
     FakeLogSystem logs;
@@ -206,18 +207,13 @@ TEST(WaitTest, ScriptedOutcomesGiveTheirResultDeadlinesAndLines) {
         << i;
     EXPECT_EQ(condition.deadlines, cases[i].deadlines) << i;
     EXPECT_TRUE(condition.Balanced()) << i;
-    std::vector<std::string> lines;
-    for (const LoggedLine& line : logs.Lines()) {
-      EXPECT_EQ(line.scope, "default");
-      const bool error = line.text.ends_with(": T");
-      EXPECT_EQ(line.level, error ? LogLevel::kError : LogLevel::kDefault) << line.text;
-      // The prefix names the operation, not a helper.
-      EXPECT_NE(line.text.find(":RuvoReportingUtilityWait: "), std::string::npos) << line.text;
-      lines.push_back(line.text.substr(line.text.rfind(' ') + 1) == "continuing"
-                          ? "C"
-                          : line.text.substr(line.text.size() - 1));
-    }
-    EXPECT_EQ(lines, cases[i].lines) << i;
+    std::vector<std::string> defaults, errors;  // the expected lines by level
+    for (const auto& line : cases[i].lines) (line == "T" ? errors : defaults).push_back(line);
+    EXPECT_EQ(logs.Messages(), cases[i].lines) << i;  // in this order, and nothing else
+    EXPECT_EQ(logs.Messages(LogLevel::kDefault, "default"), defaults) << i;
+    EXPECT_EQ(logs.Messages(LogLevel::kError, "default"), errors) << i;
+    // The prefix names the operation, not a helper.
+    EXPECT_EQ(logs.Count(":RuvoReportingUtilityWait: "), cases[i].lines.size()) << i;
   }
 }
 
