@@ -22,7 +22,6 @@ using std::chrono::milliseconds;
 using std::chrono::seconds;
 using testing::FakeDeviceInfo;
 using testing::FakeLogSystem;
-using testing::LoggedLine;
 
 // ---------------------------------------------------------------------------------------------
 // Name tables
@@ -252,8 +251,8 @@ TEST(WaitTest, SetFlagThrowingWaitAndOddTimeouts) {
   flag = false;
   ScriptedCondition scoped(flag, {{O::kTimeOut}});
   EXPECT_FALSE(RuvoReportingUtilityWait(scoped, flag, "W", "T", scope, 2.5));
-  ASSERT_EQ(logs.Lines().size(), 2u);
-  for (const LoggedLine& line : logs.Lines()) EXPECT_EQ(line.scope, "session");
+  EXPECT_EQ(logs.Lines().size(), 2u);
+  EXPECT_EQ(logs.Messages({}, "session"), (std::vector<std::string>{"W", "T"}));
 }
 
 }  // namespace
