@@ -235,9 +235,8 @@ TEST_F(SummaryTest, WritingPutsTheUserInfoFirstEveryTime) {
 TEST_F(SummaryTest, FileErrorsAreLoggedAndTheStepsAfterThemStillRun) {
   const std::string d = std::string("can't create logging directory at ") + kDirectory + ": ";
   const std::string w = "jsonOutput writeToURL: ";
-  auto failure = [](const char* text) -> OptionalError {
-    if (text == nullptr) return std::nullopt;
-    return Error{"posix", 1, text};
+  auto failure = [](const char* text) {
+    return text ? OptionalError(Error{"posix", 1, text}) : std::nullopt;
   };
   const struct {
     bool directoryExists;
