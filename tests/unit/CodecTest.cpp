@@ -21,25 +21,25 @@ constexpr int64_t kInt64Min = std::numeric_limits<int64_t>::min();
 constexpr int64_t kInt64Max = std::numeric_limits<int64_t>::max();
 constexpr uint64_t kUint64Max = std::numeric_limits<uint64_t>::max();
 
-// The accepted request, or a test failure naming the reason it was refused.
-Request Accepted(std::span<const uint8_t> body) {
-  auto decoded = DecodeRequest(body);
-  if (auto* error = std::get_if<RequestError>(&decoded)) {
-    ADD_FAILURE() << "refused: " << error->reason;
-    return Request{};
-  }
-  return std::get<Request>(std::move(decoded));
+// What a decoding gave instead of the alternative a test expected.
+std::string Why(const RequestError& error) { return "refused: " + error.reason; }
+std::string Why(const std::string& reason) { return "refused: " + reason; }
+std::string Why(const Request&) { return "accepted"; }
+std::string Why(const Reply&) { return "accepted"; }
+
+// The `T` alternative of a decoding, or a test failure saying what came instead.
+template <typename T, typename Decoded>
+T Expect(Decoded decoded) {
+  if (T* value = std::get_if<T>(&decoded)) return std::move(*value);
+  std::visit([](const auto& other) { ADD_FAILURE() << Why(other); }, decoded);
+  return T{};
 }
 
-// The refusal, or a test failure when the request was accepted.
+Request Accepted(std::span<const uint8_t> body) { return Expect<Request>(DecodeRequest(body)); }
 RequestError Refused(std::span<const uint8_t> body) {
-  auto decoded = DecodeRequest(body);
-  if (std::holds_alternative<Request>(decoded)) {
-    ADD_FAILURE() << "accepted";
-    return RequestError{};
-  }
-  return std::get<RequestError>(std::move(decoded));
+  return Expect<RequestError>(DecodeRequest(body));
 }
+Reply DecodedReply(const Bytes& body) { return Expect<Reply>(DecodeReply(body)); }
 
 // A request with call 77 and `op`, `args` elements following (their bytes in `argBytes`).
 Bytes RequestBytes(uint64_t args, Pack op, const Bytes& argBytes) {
@@ -366,15 +366,6 @@ TEST(CodecTest, ChecksRunInTheirDocumentedOrder) {
 
 // ---------------------------------------------------------------------------------------------
 // Replies
-
-Reply DecodedReply(const Bytes& body) {
-  auto decoded = DecodeReply(body);
-  if (auto* reason = std::get_if<std::string>(&decoded)) {
-    ADD_FAILURE() << "reply refused: " << *reason;
-    return Reply{};
-  }
-  return std::get<Reply>(std::move(decoded));
-}
 
 TEST(CodecTest, ReplyWireFormIsCallStatusValue) {
   EXPECT_EQ(EncodeBoolReply(3, true), Pack().array(3).uint(3).uint(0).boolean(true).bytes());
