@@ -5,16 +5,18 @@
 #include <mutex>
 #include <optional>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "platform/AnalyticsSink.h"
+#include "tests/fakes/GuardedState.h"
 
 namespace tavrin::testing {
 
 // Records every analytics event. By default it builds each payload at once, as a sink that
 // wants every event does; it can also hold builders for the test to run later, or never call
 // them, as a sink switched off does. Thread-safe; builders run outside the lock.
-class FakeAnalyticsSink final : public AnalyticsSink {
+class FakeAnalyticsSink final : public AnalyticsSink, private GuardedState {
  public:
   enum class Builders { kCallAtOnce, kCallLater, kNeverCall };
 
@@ -25,21 +27,14 @@ class FakeAnalyticsSink final : public AnalyticsSink {
     std::optional<Dictionary> payload;
   };
 
-  void SetBuilders(Builders mode) {
-    std::lock_guard lock(mutex_);
-    mode_ = mode;
-  }
+  void SetBuilders(Builders mode) { Set(mode_, mode); }
 
   void SendEventLazy(const std::string& name, std::function<Dictionary()> buildPayload) override {
-    size_t index = 0;
-    Builders mode;
-    {
-      std::lock_guard lock(mutex_);
-      index = events_.size();
+    const auto [index, mode] = WithLock([&] {
       events_.push_back(Event{name, 0, std::nullopt});
       builders_.push_back(buildPayload);
-      mode = mode_;
-    }
+      return std::pair(events_.size() - 1, mode_);
+    });
     if (mode == Builders::kCallAtOnce) RunBuilder(index);
   }
 
@@ -47,28 +42,16 @@ class FakeAnalyticsSink final : public AnalyticsSink {
   size_t RunPendingBuilders() {
     size_t count = 0;
     for (size_t index = 0; index < Events().size(); ++index) {
-      bool pending;
-      {
-        std::lock_guard lock(mutex_);
-        pending = events_[index].builderCalls == 0;
-      }
-      if (pending && RunBuilder(index)) ++count;
+      if (Events()[index].builderCalls == 0 && RunBuilder(index)) ++count;
     }
     return count;
   }
 
-  std::vector<Event> Events() const {
-    std::lock_guard lock(mutex_);
-    return events_;
-  }
+  std::vector<Event> Events() const { return Locked(events_); }
 
  private:
   bool RunBuilder(size_t index) {
-    std::function<Dictionary()> builder;
-    {
-      std::lock_guard lock(mutex_);
-      builder = builders_[index];
-    }
+    const std::function<Dictionary()> builder = Locked(builders_)[index];
     if (!builder) return false;
     Dictionary payload = builder();
     std::lock_guard lock(mutex_);
@@ -77,7 +60,6 @@ class FakeAnalyticsSink final : public AnalyticsSink {
     return true;
   }
 
-  mutable std::mutex mutex_;
   Builders mode_ = Builders::kCallAtOnce;              // guarded by mutex_
   std::vector<Event> events_;                          // guarded by mutex_
   std::vector<std::function<Dictionary()>> builders_;  // guarded by mutex_

@@ -8,15 +8,15 @@
 
 namespace tavrin::testing {
 
-// A client connection driven by the test: it keeps what the delegate set on it and lets the test
-// end the connection the way the transport would.
+// A client connection driven by the test: it keeps the object and handlers the delegate set on it
+// and lets the test end the connection the way the transport would.
 class FakeClientConnection final : public ClientConnection {
  public:
   explicit FakeClientConnection(int32_t pid) : pid_(pid) {}
 
   int32_t ProcessIdentifier() const override { return pid_; }
   uint32_t UserIdentifier() const override { return 0; }
-  void SetExportedInterface(std::string_view name) override { interface_ = std::string(name); }
+  void SetExportedInterface(std::string_view) override {}
   void SetExportedObject(std::shared_ptr<RuvoReportingServiceProtocol> object) override {
     object_ = std::move(object);
   }
@@ -27,7 +27,7 @@ class FakeClientConnection final : public ClientConnection {
   void SetInvalidationHandler(std::function<void()> handler) override {
     invalidation_ = std::move(handler);
   }
-  void Resume() override { resumed_ = true; }
+  void Resume() override {}
   std::string Description() const override {
     return "<FakeClientConnection pid=" + std::to_string(pid_) + ">";
   }
@@ -42,16 +42,11 @@ class FakeClientConnection final : public ClientConnection {
     object_.reset();
   }
 
-  const std::string& exportedInterface() const { return interface_; }
-  bool resumed() const { return resumed_; }
-
  private:
   int32_t pid_;
-  std::string interface_;
   std::shared_ptr<RuvoReportingServiceProtocol> object_;
   std::function<void()> interruption_;
   std::function<void()> invalidation_;
-  bool resumed_ = false;
 };
 
 }  // namespace tavrin::testing

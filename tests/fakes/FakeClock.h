@@ -6,12 +6,13 @@
 #include <gtest/gtest.h>
 
 #include "platform/Clock.h"
+#include "tests/fakes/GuardedState.h"
 
 namespace tavrin::testing {
 
 // A clock that moves only when the test moves it. Thread-safe: code under test may read it from
 // any thread while the test advances it.
-class FakeClock final : public Clock {
+class FakeClock final : public Clock, private GuardedState {
  public:
   // 2026-11-16 05:27:45 UTC: a fixed date, so records and file names are reproducible.
   static constexpr WallTime kStartWallTime =
@@ -20,14 +21,8 @@ class FakeClock final : public Clock {
   // Well away from the steady clock's epoch, so that "now minus a while" stays meaningful.
   static constexpr SteadyTime kStartSteadyTime = SteadyTime(std::chrono::hours(1000));
 
-  SteadyTime Now() const override {
-    std::lock_guard lock(mutex_);
-    return now_;
-  }
-  WallTime WallNow() const override {
-    std::lock_guard lock(mutex_);
-    return wallNow_;
-  }
+  SteadyTime Now() const override { return Locked(now_); }
+  WallTime WallNow() const override { return Locked(wallNow_); }
 
   // Moves both times forward by `duration`. Time never goes back: a negative duration is a test
   // bug and fails the test.
@@ -42,7 +37,6 @@ class FakeClock final : public Clock {
   }
 
  private:
-  mutable std::mutex mutex_;
   SteadyTime now_ = kStartSteadyTime;  // guarded by mutex_
   WallTime wallNow_ = kStartWallTime;  // guarded by mutex_
 };

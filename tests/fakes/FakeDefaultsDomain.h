@@ -3,32 +3,27 @@
 #include <mutex>
 
 #include "platform/DefaultsDomain.h"
+#include "tests/fakes/GuardedState.h"
 
 namespace tavrin::testing {
 
 // A defaults domain held in memory.
-class FakeDefaultsDomain final : public DefaultsDomain {
+class FakeDefaultsDomain final : public DefaultsDomain, private GuardedState {
  public:
   void Set(const std::string& key, Value value) {
-    std::lock_guard lock(mutex_);
-    values_[key] = std::move(value);
+    WithLock([&] { values_[key] = std::move(value); });
   }
   void Remove(const std::string& key) {
-    std::lock_guard lock(mutex_);
-    values_.erase(key);
+    WithLock([&] { values_.erase(key); });
   }
   Dictionary Read() override {
     std::lock_guard lock(mutex_);
     ++reads_;
     return values_;
   }
-  int reads() const {
-    std::lock_guard lock(mutex_);
-    return reads_;
-  }
+  int reads() const { return Locked(reads_); }
 
  private:
-  mutable std::mutex mutex_;
   Dictionary values_ = Dictionary::object();
   int reads_ = 0;
 };

@@ -9,27 +9,23 @@
 #include <string_view>
 
 #include "platform/DeviceInfoQuery.h"
+#include "tests/fakes/GuardedState.h"
 
 namespace tavrin::testing {
 
 // Device facts from in-memory maps; unknown keys answer the fallback, as the real query does.
 // Counts every query per key. Thread-safe.
-class FakeDeviceInfo final : public DeviceInfoQuery {
+class FakeDeviceInfo final : public DeviceInfoQuery, private GuardedState {
  public:
   void SetBool(std::string_view key, bool value) {
-    std::lock_guard lock(mutex_);
-    bools_[std::string(key)] = value;
+    WithLock([&] { bools_[std::string(key)] = value; });
   }
   void SetInt32(std::string_view key, int32_t value) {
-    std::lock_guard lock(mutex_);
-    ints_[std::string(key)] = value;
+    WithLock([&] { ints_[std::string(key)] = value; });
   }
   // Runs on the querying thread before each answer, outside the fake's lock (for example to
   // hold a query open while other threads pile up behind a once-only guard).
-  void SetQueryHook(std::function<void(std::string_view key)> hook) {
-    std::lock_guard lock(mutex_);
-    hook_ = std::move(hook);
-  }
+  void SetQueryHook(std::function<void(std::string_view)> hook) { Set(hook_, std::move(hook)); }
 
   bool QueryBool(std::string_view key, bool fallback) override {
     RunHook(key);
@@ -54,15 +50,9 @@ class FakeDeviceInfo final : public DeviceInfoQuery {
 
  private:
   void RunHook(std::string_view key) {
-    std::function<void(std::string_view)> hook;
-    {
-      std::lock_guard lock(mutex_);
-      hook = hook_;
-    }
-    if (hook) hook(key);
+    if (const auto hook = Locked(hook_)) hook(key);
   }
 
-  mutable std::mutex mutex_;
   std::map<std::string, bool> bools_;
   std::map<std::string, int32_t> ints_;
   std::map<std::string, size_t> queries_;

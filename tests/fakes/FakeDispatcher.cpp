@@ -177,15 +177,13 @@ class FakeTimer final : public Timer {
 
 }  // namespace
 
-FakeDispatcher::FakeDispatcher()
-    : ownClock_(std::make_unique<FakeClock>()),
-      clock_(*ownClock_),
-      state_(std::make_shared<State>(clock_)),
-      background_(*(state_->background = std::make_shared<FakeQueue>(
-                        state_, kBackgroundLabel, QualityOfService::kBackground))) {}
+FakeDispatcher::FakeDispatcher() : FakeDispatcher(std::make_unique<FakeClock>(), nullptr) {}
 
-FakeDispatcher::FakeDispatcher(FakeClock& clock)
-    : clock_(clock),
+FakeDispatcher::FakeDispatcher(FakeClock& clock) : FakeDispatcher(nullptr, &clock) {}
+
+FakeDispatcher::FakeDispatcher(std::unique_ptr<FakeClock> own, FakeClock* clock)
+    : ownClock_(std::move(own)),
+      clock_(clock ? *clock : *ownClock_),
       state_(std::make_shared<State>(clock_)),
       background_(*(state_->background = std::make_shared<FakeQueue>(
                         state_, kBackgroundLabel, QualityOfService::kBackground))) {}

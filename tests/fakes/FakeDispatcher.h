@@ -45,7 +45,6 @@ class FakeDispatcher final : public Dispatcher {
   size_t RunDeferredNow() override;
   size_t DeferredCount() const override;
   Clock& GetClock() override { return clock_; }
-  FakeClock& Time() { return clock_; }
 
   // Returns the number of items run. Calling either from inside a work item fails the test.
   size_t RunUntilIdle();
@@ -62,6 +61,8 @@ class FakeDispatcher final : public Dispatcher {
   struct State;
 
  private:
+  FakeDispatcher(std::unique_ptr<FakeClock> own, FakeClock* clock);
+
   std::unique_ptr<FakeClock> ownClock_;
   FakeClock& clock_;
   std::shared_ptr<State> state_;

@@ -26,31 +26,6 @@ int FakeDriverStatsService::AddChannel(Name group, Name subgroup, Name name, int
   return int(channels_.size() - 1);
 }
 
-void FakeDriverStatsService::SetValue(int id, int64_t value) {
-  std::lock_guard lock(mutex_);
-  channels_.at(size_t(id)).value = value;
-}
-
-void FakeDriverStatsService::FailCopyChannels(Name group, Name subgroup, Failure failure) {
-  std::lock_guard lock(mutex_);
-  copyFailures_[{std::move(group), std::move(subgroup)}] = failure;
-}
-
-void FakeDriverStatsService::FailCreateSamples(Name group, Name subgroup, Failure failure) {
-  std::lock_guard lock(mutex_);
-  sampleFailures_[{std::move(group), std::move(subgroup)}] = failure;
-}
-
-void FakeDriverStatsService::FailCreateSamplesDelta(Failure failure) {
-  std::lock_guard lock(mutex_);
-  deltaFailures_[{}] = failure;
-}
-
-void FakeDriverStatsService::AnswerNoChannels(Name group, Name subgroup) {
-  std::lock_guard lock(mutex_);
-  noChannels_.emplace_back(std::move(group), std::move(subgroup));
-}
-
 bool FakeDriverStatsService::Fire(std::map<Query, Failure>& failures, const Query& query,
                                   OptionalError* error) {
   const auto it = failures.find(query);

@@ -2,7 +2,6 @@
 
 #include <cstdint>
 #include <map>
-#include <mutex>
 #include <optional>
 #include <string>
 #include <utility>
@@ -28,7 +27,9 @@ class FakeDriverStatsService final : public DriverStatsService, private GuardedS
 
   // Adds a channel and returns its id. `name` may be absent (a channel without a name).
   int AddChannel(Name group, Name subgroup, Name name, int64_t value);
-  void SetValue(int id, int64_t value);
+  void SetValue(int id, int64_t value) {
+    WithLock([&] { channels_.at(size_t(id)).value = value; });
+  }
 
   // An injected failure of one operation. `code` goes into the Error; `withResult` also returns
   // the result the operation would have given; `times` failures (-1: every call).
@@ -38,14 +39,22 @@ class FakeDriverStatsService final : public DriverStatsService, private GuardedS
     int times = -1;
   };
   // CopyChannelsInGroup for exactly this (group, subgroup) query.
-  void FailCopyChannels(Name group, Name subgroup, Failure failure);
+  void FailCopyChannels(Name group, Name subgroup, Failure failure) {
+    WithLock([&] { copyFailures_[{group, subgroup}] = failure; });
+  }
   // CreateSamples of the subscription made for this (group, subgroup) query.
-  void FailCreateSamples(Name group, Name subgroup, Failure failure);
+  void FailCreateSamples(Name group, Name subgroup, Failure failure) {
+    WithLock([&] { sampleFailures_[{group, subgroup}] = failure; });
+  }
   // Every CreateSamplesDelta call.
-  void FailCreateSamplesDelta(Failure failure);
+  void FailCreateSamplesDelta(Failure failure) {
+    WithLock([&] { deltaFailures_[{}] = failure; });
+  }
   // CopyChannelsInGroup for this query answers none without error (a service that knows no
   // such group).
-  void AnswerNoChannels(Name group, Name subgroup);
+  void AnswerNoChannels(Name group, Name subgroup) {
+    WithLock([&] { noChannels_.emplace_back(group, subgroup); });
+  }
 
   // What CreateSamplesDelta was given, per call.
   struct DeltaCall {

@@ -1,6 +1,7 @@
 #include "tests/fakes/FakeFileSystem.h"
 
 #include <algorithm>
+#include <string_view>
 
 namespace tavrin::testing {
 namespace {
@@ -15,9 +16,8 @@ Error FileError(int64_t code, const std::string& what, const std::string& path) 
   return Error{FakeFileSystem::kErrorDomain, code, what + ": " + path};
 }
 
-}  // namespace
-
-std::string FakeFileSystem::Normalize(std::string_view path) {
+// The path made absolute, without repeated or trailing "/".
+std::string Normalize(std::string_view path) {
   std::string normalized = "/";
   size_t position = 0;
   while (position < path.size()) {
@@ -31,6 +31,8 @@ std::string FakeFileSystem::Normalize(std::string_view path) {
   }
   return normalized;
 }
+
+}  // namespace
 
 OptionalError FakeFileSystem::CreateDirectories(const std::string& path, unsigned mode) {
   const std::string normalized = Normalize(path);

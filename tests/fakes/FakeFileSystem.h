@@ -2,10 +2,8 @@
 
 #include <map>
 #include <memory>
-#include <mutex>
 #include <optional>
 #include <string>
-#include <string_view>
 #include <utility>
 #include <vector>
 
@@ -54,8 +52,6 @@ class FakeFileSystem final : public FileSystem, private GuardedState {
     return Locked(createCalls_);
   }
   std::vector<std::string> WriteCalls() const { return Locked(writeCalls_); }
-
-  static std::string Normalize(std::string_view path);
 
  private:
   class Writer;

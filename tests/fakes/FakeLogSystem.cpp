@@ -1,6 +1,8 @@
 #include "tests/fakes/FakeLogSystem.h"
 
+#include <algorithm>
 #include <atomic>
+#include <regex>
 
 namespace tavrin::testing {
 
@@ -53,31 +55,29 @@ LogHandle FakeLogSystem::RegisterLogScope(bool enabled, uint32_t code, std::stri
 
 LogScope& FakeLogSystem::DefaultLog() { return *defaultScope_; }
 
-void FakeLogSystem::Append(const std::string& scope, LogLevel level, std::string_view text) {
-  std::lock_guard lock(mutex_);
-  lines_.push_back(LoggedLine{scope, level, std::string(text)});
-}
-
 std::vector<LoggedLine> FakeLogSystem::Matching(std::string_view needle) const {
-  std::lock_guard lock(mutex_);
   std::vector<LoggedLine> found;
-  for (const auto& line : lines_) {
+  for (const auto& line : Lines()) {
     if (line.text.find(needle) != std::string::npos) found.push_back(line);
   }
   return found;
 }
 
-size_t FakeLogSystem::Count(std::string_view needle) const { return Matching(needle).size(); }
-
-size_t FakeLogSystem::Count(std::string_view needle, LogLevel level) const {
-  size_t count = 0;
-  for (const auto& line : Matching(needle)) count += line.level == level ? 1 : 0;
-  return count;
+size_t FakeLogSystem::Count(std::string_view needle, std::optional<LogLevel> level) const {
+  return static_cast<size_t>(std::ranges::count_if(
+      Matching(needle), [&](const LoggedLine& line) { return !level || line.level == *level; }));
 }
 
-void FakeLogSystem::Clear() {
-  std::lock_guard lock(mutex_);
-  lines_.clear();
+std::vector<std::string> FakeLogSystem::Messages(std::optional<LogLevel> level,
+                                                 std::string_view scope) const {
+  static const std::regex prefix("^[^:]+:[0-9]+:.*?: ");
+  std::vector<std::string> messages;
+  for (const auto& line : Lines()) {
+    if ((level && line.level != *level) || (!scope.empty() && line.scope != scope)) continue;
+    messages.push_back(
+        std::regex_replace(line.text, prefix, "", std::regex_constants::format_first_only));
+  }
+  return messages;
 }
 
 }  // namespace tavrin::testing

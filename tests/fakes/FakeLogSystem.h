@@ -1,7 +1,7 @@
 #pragma once
 
 #include <map>
-#include <mutex>
+#include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -37,10 +37,15 @@ class FakeLogSystem final : public LogSystem, private GuardedState {
   std::vector<LoggedLine> Lines() const { return Locked(lines_); }
   // Lines whose text contains `needle` (and, when given, have `level`).
   std::vector<LoggedLine> Matching(std::string_view needle) const;
-  size_t Count(std::string_view needle) const;
-  size_t Count(std::string_view needle, LogLevel level) const;
+  size_t Count(std::string_view needle, std::optional<LogLevel> level = {}) const;
   bool Contains(std::string_view needle) const { return Count(needle) > 0; }
-  void Clear();
+  // The texts of lines without their "file:line:function: " prefix, of `level` and `scope` when
+  // given, in order.
+  std::vector<std::string> Messages(std::optional<LogLevel> level = {},
+                                    std::string_view scope = {}) const;
+  void Clear() {
+    WithLock([&] { lines_.clear(); });
+  }
 
   // What RegisterLogScope was asked, by scope name.
   struct Registration {
@@ -54,7 +59,9 @@ class FakeLogSystem final : public LogSystem, private GuardedState {
 
  private:
   class Scope;
-  void Append(const std::string& scope, LogLevel level, std::string_view text);
+  void Append(const std::string& scope, LogLevel level, std::string_view text) {
+    WithLock([&] { lines_.push_back(LoggedLine{scope, level, std::string(text)}); });
+  }
   bool Verbose() const { return Locked(verbose_); }
 
   std::vector<LoggedLine> lines_;

@@ -6,11 +6,12 @@
 #include <string>
 
 #include "platform/NotificationCenter.h"
+#include "tests/fakes/GuardedState.h"
 
 namespace tavrin::testing {
 
 // Notifications posted by the test; handlers run on their queue like the real ones.
-class FakeNotificationCenter final : public NotificationCenter {
+class FakeNotificationCenter final : public NotificationCenter, private GuardedState {
  public:
   int RegisterNotificationHandler(const std::string& name, int* token, WorkQueue& queue,
                                   Handler handler) override {
@@ -22,8 +23,7 @@ class FakeNotificationCenter final : public NotificationCenter {
     return 0;
   }
   void Cancel(int token) override {
-    std::lock_guard lock(mutex_);
-    registrations_.erase(token);
+    WithLock([&] { registrations_.erase(token); });
   }
   void Post(const std::string& name) override { PostWithToken(name, std::nullopt); }
   // Posts as if the registration's token were `token` (a stale or foreign token).
@@ -36,10 +36,6 @@ class FakeNotificationCenter final : public NotificationCenter {
           [handler = registration.handler, delivered] { handler(delivered); });
     }
   }
-  size_t registrations() const {
-    std::lock_guard lock(mutex_);
-    return registrations_.size();
-  }
 
   int failWith = 0;  // a non-zero status makes registration fail
 
@@ -49,7 +45,6 @@ class FakeNotificationCenter final : public NotificationCenter {
     WorkQueue* queue;
     Handler handler;
   };
-  mutable std::mutex mutex_;
   std::map<int, Registration> registrations_;
   int nextToken_ = 1;
 };

@@ -8,6 +8,7 @@
 #include <vector>
 
 #include "platform/OrientationRegistry.h"
+#include "tests/fakes/GuardedState.h"
 
 namespace tavrin::testing {
 
@@ -15,7 +16,7 @@ namespace tavrin::testing {
 // for the registry's own thread). Keeps the real contract: once Unregister returns, the
 // callbacks of that id are not called again, even when another thread is firing meanwhile.
 // Callbacks must not register or unregister from inside a firing. Thread-safe.
-class FakeOrientationRegistry final : public OrientationRegistry {
+class FakeOrientationRegistry final : public OrientationRegistry, private GuardedState {
  public:
   enum class Kind { kDevice, kUI };
   // One registration or unregistration, in call order.
@@ -23,6 +24,7 @@ class FakeOrientationRegistry final : public OrientationRegistry {
     Kind kind;
     bool registered;  // false: unregistered
     std::string id;
+    bool operator==(const Change&) const = default;
   };
 
   void RegisterDeviceOrientation(const std::string& id, Callback callback) override {
@@ -43,8 +45,7 @@ class FakeOrientationRegistry final : public OrientationRegistry {
     return found == texts_.end() ? value : found->second;
   }
   void SetText(const OrientationValue& value, std::string text) {
-    std::lock_guard lock(mutex_);
-    texts_[value] = std::move(text);
+    WithLock([&] { texts_[value] = std::move(text); });
   }
 
   // Calls every registered callback of the kind with `value`; returns how many were called.
@@ -52,40 +53,29 @@ class FakeOrientationRegistry final : public OrientationRegistry {
   size_t FireUI(const OrientationValue& value) { return Fire(Kind::kUI, value); }
 
   bool IsRegistered(Kind kind, const std::string& id) const {
-    std::lock_guard lock(mutex_);
-    return Callbacks(kind).count(id) > 0;
+    return WithLock([&] { return callbacks_[size_t(kind)].count(id) > 0; });
   }
   size_t RegisteredCount(Kind kind) const {
-    std::lock_guard lock(mutex_);
-    return Callbacks(kind).size();
+    return WithLock([&] { return callbacks_[size_t(kind)].size(); });
   }
-  std::vector<Change> History() const {
-    std::lock_guard lock(mutex_);
-    return history_;
-  }
+  std::vector<Change> History() const { return Locked(history_); }
   // Drops every callback (and what they hold), as a registry that goes away does.
   void Clear() {
-    std::map<std::string, Callback> device, ui;
+    ByID dropped[2];  // released after the locks
     {
       std::lock_guard firing(fireMutex_);
       std::lock_guard lock(mutex_);
-      device.swap(device_);
-      ui.swap(ui_);
+      std::swap(dropped, callbacks_);
     }
   }
 
  private:
-  std::map<std::string, Callback>& Callbacks(Kind kind) {
-    return kind == Kind::kDevice ? device_ : ui_;
-  }
-  const std::map<std::string, Callback>& Callbacks(Kind kind) const {
-    return kind == Kind::kDevice ? device_ : ui_;
-  }
+  using ByID = std::map<std::string, Callback>;
 
   void Register(Kind kind, const std::string& id, Callback callback) {
     Callback previous;
     std::lock_guard lock(mutex_);
-    previous = std::exchange(Callbacks(kind)[id], std::move(callback));
+    previous = std::exchange(callbacks_[size_t(kind)][id], std::move(callback));
     history_.push_back(Change{kind, true, id});
   }
 
@@ -94,7 +84,7 @@ class FakeOrientationRegistry final : public OrientationRegistry {
     {
       std::lock_guard firing(fireMutex_);
       std::lock_guard lock(mutex_);
-      auto& callbacks = Callbacks(kind);
+      auto& callbacks = callbacks_[size_t(kind)];
       const auto found = callbacks.find(id);
       if (found != callbacks.end()) {
         removed = std::move(found->second);
@@ -109,16 +99,14 @@ class FakeOrientationRegistry final : public OrientationRegistry {
     std::vector<Callback> callbacks;
     {
       std::lock_guard lock(mutex_);
-      for (const auto& entry : Callbacks(kind)) callbacks.push_back(entry.second);
+      for (const auto& entry : callbacks_[size_t(kind)]) callbacks.push_back(entry.second);
     }
     for (const auto& callback : callbacks) callback(value);
     return callbacks.size();
   }
 
   std::mutex fireMutex_;  // held while callbacks run, so Unregister waits for a firing to end
-  mutable std::mutex mutex_;
-  std::map<std::string, Callback> device_;         // guarded by mutex_
-  std::map<std::string, Callback> ui_;             // guarded by mutex_
+  ByID callbacks_[2];     // by Kind, guarded by mutex_
   std::map<OrientationValue, std::string> texts_;  // guarded by mutex_
   std::vector<Change> history_;                    // guarded by mutex_
 };

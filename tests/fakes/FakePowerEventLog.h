@@ -7,11 +7,12 @@
 #include <vector>
 
 #include "platform/PowerEventLog.h"
+#include "tests/fakes/GuardedState.h"
 
 namespace tavrin::testing {
 
 // Records every power event. Thread-safe.
-class FakePowerEventLog final : public PowerEventLog {
+class FakePowerEventLog final : public PowerEventLog, private GuardedState {
  public:
   struct Event {
     int32_t agent = 0;
@@ -27,13 +28,9 @@ class FakePowerEventLog final : public PowerEventLog {
         Event{agent, name, payload, extra ? std::optional<Dictionary>(*extra) : std::nullopt});
   }
 
-  std::vector<Event> Events() const {
-    std::lock_guard lock(mutex_);
-    return events_;
-  }
+  std::vector<Event> Events() const { return Locked(events_); }
 
  private:
-  mutable std::mutex mutex_;
   std::vector<Event> events_;  // guarded by mutex_
 };
 

@@ -6,21 +6,20 @@
 #include <string>
 
 #include "platform/ProcessInfo.h"
+#include "tests/fakes/GuardedState.h"
 
 namespace tavrin::testing {
 
 // Process names from a table the test fills.
-class FakeProcessInfo final : public ProcessInfo {
+class FakeProcessInfo final : public ProcessInfo, private GuardedState {
  public:
   int32_t ownPid = 4242;
-  std::string ownName = "tavrind";
 
   void SetCommandName(int32_t pid, std::string name) {
-    std::lock_guard lock(mutex_);
-    names_[pid] = std::move(name);
+    WithLock([&] { names_[pid] = std::move(name); });
   }
   int32_t OwnProcessIdentifier() const override { return ownPid; }
-  std::string OwnProcessName() const override { return ownName; }
+  std::string OwnProcessName() const override { return "tavrind"; }
   std::optional<std::string> CommandName(int32_t pid) const override {
     std::lock_guard lock(mutex_);
     auto found = names_.find(pid);
@@ -29,7 +28,6 @@ class FakeProcessInfo final : public ProcessInfo {
   }
 
  private:
-  mutable std::mutex mutex_;
   std::map<int32_t, std::string> names_;
 };
 

@@ -9,20 +9,20 @@
 #include <gtest/gtest.h>
 
 #include "platform/RandomSource.h"
+#include "tests/fakes/GuardedState.h"
 
 namespace tavrin::testing {
 
 // A RandomSource that answers scripted values in order, then a fixed default, and records every
 // bound it was asked for. A bound of zero, or a scripted value outside [0, bound), fails the test:
 // the first is a caller bug, the second a test bug. Thread-safe.
-class FakeRandom final : public RandomSource {
+class FakeRandom final : public RandomSource, private GuardedState {
  public:
   explicit FakeRandom(uint64_t fallback = 0) : fallback_(fallback) {}
 
   // Appends values to answer before the default.
   void Script(std::initializer_list<uint64_t> values) {
-    std::lock_guard lock(mutex_);
-    scripted_.insert(scripted_.end(), values.begin(), values.end());
+    WithLock([&] { scripted_.insert(scripted_.end(), values.begin(), values.end()); });
   }
 
   uint64_t UniformBelow(uint64_t bound) override {
@@ -45,13 +45,9 @@ class FakeRandom final : public RandomSource {
   }
 
   // Every bound asked, in order.
-  std::vector<uint64_t> Bounds() const {
-    std::lock_guard lock(mutex_);
-    return bounds_;
-  }
+  std::vector<uint64_t> Bounds() const { return Locked(bounds_); }
 
  private:
-  mutable std::mutex mutex_;
   std::deque<uint64_t> scripted_;  // guarded by mutex_
   const uint64_t fallback_;
   std::vector<uint64_t> bounds_;  // guarded by mutex_

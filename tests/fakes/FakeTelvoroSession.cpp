@@ -31,26 +31,21 @@ void FakeTelvoroSession::StartConfiguration(std::function<void(const BackendList
 bool FakeTelvoroSession::SendSessionMessage(uint16_t category, uint16_t type,
                                             const PayloadPtr& payload, Error* error,
                                             const DeliveryReceiptPtr& receipt) {
-  OptionalError failure = service_.Locked(service_.sendError_);
-  {
-    std::lock_guard lock(mutex_);
-    if (failure) {
+  const OptionalError failure = service_.Locked(service_.sendError_);
+  if (failure && error != nullptr) *error = *failure;
+  WithLock([&] {
+    if (failure)
       ++refused_;
-      if (error != nullptr) *error = *failure;
-    } else {
+    else
       messages_.push_back(FakeTelvoroMessage{category, type, *payload});
-    }
-  }
+  });
   Settle(receipt, !failure, DropReason::kQueueFull);
   return !failure;
 }
 
 void FakeTelvoroSession::FlushMessages(std::function<void(const OptionalError&)> done) {
   OptionalError failure = service_.Locked(service_.flushError_);
-  {
-    std::lock_guard lock(mutex_);
-    messagesAtFlush_.push_back(messages_.size());
-  }
+  WithLock([&] { messagesAtFlush_.push_back(messages_.size()); });
   if (done) done(failure);
 }
 
@@ -61,11 +56,8 @@ std::string FakeTelvoroSession::Description() const {
 size_t FakeTelvoroService::AnswerPendingDiscoveries(const BackendList& backends) {
   size_t answered = 0;
   for (const auto& session : Sessions()) {
-    std::function<void(const BackendList&)> done;
-    {
-      std::lock_guard lock(session->mutex_);
-      done = std::exchange(session->pendingDiscovery_, nullptr);
-    }
+    const auto done =
+        session->WithLock([&] { return std::exchange(session->pendingDiscovery_, nullptr); });
     if (!done) continue;
     done(backends);
     ++answered;
@@ -74,8 +66,7 @@ size_t FakeTelvoroService::AnswerPendingDiscoveries(const BackendList& backends)
 }
 
 std::shared_ptr<FakeTelvoroSession> FakeTelvoroService::LastSession() const {
-  std::lock_guard lock(mutex_);
-  return sessions_.empty() ? nullptr : sessions_.back();
+  return WithLock([&] { return sessions_.empty() ? nullptr : sessions_.back(); });
 }
 
 TelvoroTokenPtr FakeTelvoroService::NewSecureHierarchyToken(const TelvoroTokenPtr& parent) {
@@ -100,19 +91,16 @@ TelvoroSessionPtr FakeTelvoroService::CreateTelvoroSession(
 bool FakeTelvoroService::SendOneMessage(const Dictionary& sessionInfo, const Dictionary& userInfo,
                                         uint16_t category, uint16_t type, const Dictionary& payload,
                                         Error* error, const DeliveryReceiptPtr& receipt) {
-  bool accepted = false;
-  {
-    std::lock_guard lock(mutex_);
-    if (sendError_) {
+  const OptionalError failure = Locked(sendError_);
+  if (failure && error != nullptr) *error = *failure;
+  WithLock([&] {
+    if (failure)
       ++refusedSingles_;
-      if (error != nullptr) *error = *sendError_;
-    } else {
+    else
       singleMessages_.push_back(SingleMessage{sessionInfo, userInfo, category, type, payload});
-      accepted = true;
-    }
-  }
-  Settle(receipt, accepted, DropReason::kQueueFull);
-  return accepted;
+  });
+  Settle(receipt, !failure, DropReason::kQueueFull);
+  return !failure;
 }
 
 }  // namespace tavrin::testing

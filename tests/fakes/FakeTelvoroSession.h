@@ -4,7 +4,6 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <utility>
 #include <vector>
@@ -23,6 +22,7 @@ struct FakeTelvoroMessage {
   uint16_t category = 0;
   uint16_t type = 0;
   Dictionary payload;
+  bool operator==(const FakeTelvoroMessage&) const = default;
 };
 
 // A TelvoroSession that records what it is given. Its discovery answer follows the mode its

@@ -6,30 +6,24 @@
 #include <vector>
 
 #include "platform/TracePoints.h"
+#include "tests/fakes/GuardedState.h"
 
 namespace tavrin::testing {
 
 // Sees every trace point fired while it lives.
-class RecordingTraceRecorder final : public TraceRecorder {
+class RecordingTraceRecorder final : public TraceRecorder, private GuardedState {
  public:
   RecordingTraceRecorder() : previous_(InstallTraceRecorder(this)) {}
   ~RecordingTraceRecorder() override { InstallTraceRecorder(previous_); }
 
   void Record(uint32_t code) override {
-    std::lock_guard lock(mutex_);
-    codes_.push_back(code);
+    WithLock([&] { codes_.push_back(code); });
   }
   size_t Count(uint32_t code) const {
-    std::lock_guard lock(mutex_);
-    return static_cast<size_t>(std::count(codes_.begin(), codes_.end(), code));
-  }
-  void Clear() {
-    std::lock_guard lock(mutex_);
-    codes_.clear();
+    return WithLock([&] { return static_cast<size_t>(std::ranges::count(codes_, code)); });
   }
 
  private:
-  mutable std::mutex mutex_;
   std::vector<uint32_t> codes_;
   TraceRecorder* previous_;
 };

@@ -6,7 +6,7 @@
 namespace tavrin {
 
 // The one mutex of a fake's recorded state, which the code under test writes from its threads
-// while the test reads: copies out and assignments in, each under the lock.
+// while the test reads: copies out, assignments in and other steps, each under the lock.
 class GuardedState {
  protected:
   template <typename T>
@@ -18,6 +18,11 @@ class GuardedState {
   void Set(T& member, T value) {
     std::lock_guard lock(mutex_);
     member = std::move(value);
+  }
+  template <typename Step>
+  auto WithLock(Step step) const {
+    std::lock_guard lock(mutex_);
+    return step();
   }
 
   mutable std::mutex mutex_;

@@ -1,10 +1,10 @@
 #pragma once
 
+#include <algorithm>
 #include <cstdlib>
 #include <ctime>
 #include <memory>
 #include <optional>
-#include <regex>
 #include <string>
 #include <vector>
 
@@ -26,12 +26,6 @@ inline FakeLogSystem& ProcessLogSystem() {
   return *system;
 }
 
-// The text of a logged line without its "file:line:function: " prefix.
-inline std::string LineMessage(const std::string& line) {
-  static const std::regex prefix("^[^:]+:[0-9]+:.*?: ");
-  return std::regex_replace(line, prefix, "", std::regex_constants::format_first_only);
-}
-
 // Base of the session tests: a fresh fake platform per test, the process's log facility cleared,
 // trace points recorded, local time in UTC. The internal-build answer is fixed for the life of
 // the process at its first use, so every test of one executable must ask for the same answer.
@@ -51,19 +45,28 @@ class SessionTestBase : public ::testing::Test {
     session->setServiceType(serviceType);
     return session;
   }
-
-  // Messages (prefix removed) of the session scope, in order, of `level`.
-  std::vector<std::string> SessionMessages(LogLevel level) const { return Messages("rvrr", level); }
-  std::vector<std::string> DefaultMessages(LogLevel level) const {
-    return Messages("default", level);
+  // A session given `configuration` and started, with the queued half of start run (up to the
+  // back-end wait).
+  std::shared_ptr<RuvoReportingSession> Started(uint16_t serviceType = 3,
+                                                const Dictionary& configuration = Dictionary(),
+                                                int64_t reporterID = 42) {
+    auto session = Create(reporterID, serviceType);
+    session->setConfiguration(configuration);
+    StartAndRun(session);
+    return session;
   }
+  void StartAndRun(const std::shared_ptr<RuvoReportingSession>& session) {
+    session->start();
+    platform.dispatcher.RunUntilIdle();
+  }
+  void StopAndRun(const std::shared_ptr<RuvoReportingSession>& session) {
+    session->stop();
+    platform.dispatcher.RunUntilIdle();
+  }
+
   // Lines whose message (prefix removed) is `message`, of `level` when given.
   size_t CountMessage(const std::string& message, std::optional<LogLevel> level = {}) const {
-    size_t count = 0;
-    for (const auto& line : log.Lines()) {
-      count += (!level || line.level == *level) && LineMessage(line.text) == message ? 1 : 0;
-    }
-    return count;
+    return static_cast<size_t>(std::ranges::count(log.Messages(level), message));
   }
 
   // Payloads aggregated, none when the aggregation is gone.
@@ -83,15 +86,6 @@ class SessionTestBase : public ::testing::Test {
   FakeLogSystem& log;
   FakePlatform platform;
   RecordingTraceRecorder traces;
-
- private:
-  std::vector<std::string> Messages(const std::string& scope, LogLevel level) const {
-    std::vector<std::string> messages;
-    for (const auto& line : log.Lines()) {
-      if (line.scope == scope && line.level == level) messages.push_back(LineMessage(line.text));
-    }
-    return messages;
-  }
 };
 
 }  // namespace tavrin::testing

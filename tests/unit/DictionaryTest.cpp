@@ -32,8 +32,6 @@ TEST(DictionaryTest, NonFiniteFloatsPrintWithoutThrowing) {
   EXPECT_EQ(ValueText(std::numeric_limits<double>::infinity()), "inf");
   EXPECT_EQ(ValueText(-std::numeric_limits<double>::infinity()), "-inf");
   EXPECT_EQ(ValueText(std::nan("")), "nan");
-  // JSON has no NaN; the compact text shows null rather than failing.
-  EXPECT_EQ(JsonText(Value::array({std::nan("")})), "[null]");
 }
 
 TEST(DictionaryTest, BooleansStringsAndNullHaveTheirPlainForms) {
@@ -43,9 +41,6 @@ TEST(DictionaryTest, BooleansStringsAndNullHaveTheirPlainForms) {
   EXPECT_EQ(ValueText(""), "");
   EXPECT_EQ(ValueText("a \"quoted\" word"), "a \"quoted\" word");
   EXPECT_EQ(ValueText(nullptr), "(null)");
-  EXPECT_EQ(JsonText("speaker"), "\"speaker\"");
-  EXPECT_EQ(JsonText(nullptr), "null");
-  EXPECT_EQ(JsonText(true), "true");
 }
 
 TEST(DictionaryTest, ContainersPrintAsCompactJsonInInsertionOrder) {
@@ -74,13 +69,14 @@ TEST(DictionaryTest, InvalidUtf8NeverThrows) {
 }
 
 // The service writes its own JSON text; it must be the library's, byte for byte, whatever the
-// strings hold and whatever the numbers are.
+// strings hold and whatever the numbers are (JSON has no NaN: both show null rather than fail).
 TEST(DictionaryTest, JsonTextIsTheLibrarysCompactDump) {
   const std::vector<Value> values = {
       Value::object(
           {{"plain", "ascii text"}, {"a \"quote\"", "back\\slash"}, {"tab\t", "line\x1F"}}),
       Value::array({"caf\xC3\xA9 \xE2\x82\xAC \xF0\x9F\x8E\xB5", "bad\xC3", "\x80", "\x7F", ""}),
-      Value::array({2.0, -0.0, 0.1, 1e300, 5e-324, -1.5e-7, 123456789.125, 1e15, 1e16}),
+      Value::array(
+          {2.0, -0.0, 0.1, 1e300, 5e-324, -1.5e-7, 123456789.125, 1e15, 1e16, std::nan("")}),
       Value::array({std::numeric_limits<int64_t>::min(), std::numeric_limits<uint64_t>::max(), 0}),
       Value::object({{"\xFF", Value::object({{"x", Value::array({true, false, nullptr})}})}}),
       Value::binary({1, 2, 3}),

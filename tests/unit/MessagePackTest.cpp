@@ -28,24 +28,14 @@ Bytes NestedArrays(int levels) {
 
 // A value using every format that the parser accepts, nested a few levels.
 Bytes Mixed() {
-  return Pack()
-      .array(5)
-      .uint(7)
-      .map(3)
-      .str("a")
-      .integer(IntFormat::kInt16, static_cast<uint64_t>(-300))
-      .str("nested")
-      .array(3)
-      .float64(4.5)
-      .float32(0.25f)
-      .boolean(false)
-      .str(std::string(40, 'x'))
-      .array(2)
-      .nil()
-      .boolean(true)
-      .str(std::string(300, 'y'))
-      .integer(IntFormat::kUint64, std::numeric_limits<uint64_t>::max())
-      .integer(IntFormat::kNegativeFixint, static_cast<uint64_t>(-5));
+  Pack map;  // one entry per statement
+  map.map(3).str("a").integer(IntFormat::kInt16, static_cast<uint64_t>(-300));
+  map.str("nested").array(3).float64(4.5).float32(0.25f).boolean(false);
+  map.str(std::string(40, 'x')).array(2).nil().boolean(true);
+  Pack value;  // [7, map, str16, uint64, negative fixint]
+  value.array(5).uint(7).append(map).str(std::string(300, 'y'));
+  value.integer(IntFormat::kUint64, std::numeric_limits<uint64_t>::max());
+  return value.integer(IntFormat::kNegativeFixint, static_cast<uint64_t>(-5));
 }
 
 TEST(MessagePackTest, MixedValueDecodesWithWireOrderAndSignedness) {

@@ -165,14 +165,14 @@ class ThrottleDeliveryTest : public ::testing::Test {
   }
   void Record(int label) {
     labels_.push_back(label);
-    at_.push_back(dispatcher_.Time().Now() - start_);
+    at_.push_back(dispatcher_.GetClock().Now() - start_);
     SerialQueuePtr queue = dispatcher_.FindQueue(Throttle::kQueueLabel);
     onQueue_ = onQueue_ && queue && queue->IsCurrent();
   }
 
   FakeLogSystem logs_;
   testing::FakeDispatcher dispatcher_;
-  const SteadyTime start_ = dispatcher_.Time().Now();
+  const SteadyTime start_ = dispatcher_.GetClock().Now();
   std::unique_ptr<Throttle> throttle_ =
       std::make_unique<Throttle>(dispatcher_, Throttle::Timing{milliseconds(1), 3});
   std::vector<int> labels_;

@@ -2,8 +2,6 @@
 
 #include <gtest/gtest.h>
 
-#include <algorithm>
-
 #include "tests/fakes/FakeDriverStatsService.h"
 #include "tests/fakes/FakeLogSystem.h"
 
@@ -14,20 +12,15 @@ using testing::FakeDriverStatsService;
 using testing::FakeLogSystem;
 using Failure = FakeDriverStatsService::Failure;
 using std::nullopt;
+using Lines = std::vector<std::string>;
 
-std::vector<std::string> Texts(const FakeLogSystem& log, LogLevel level) {
-  std::vector<std::string> texts;
-  for (const auto& line : log.Lines()) {
-    if (line.level != level) continue;
-    // Drop the "file:line:function: " prefix.
-    const auto colon = line.text.find(": ");
-    texts.push_back(colon == std::string::npos ? line.text : line.text.substr(colon + 2));
-  }
-  return texts;
+// The counters that rose since `snapShot` (every counter above zero against none).
+std::optional<Dictionary> Delta(RuvoReportingDriverUtility& utility, const Dictionary* snapShot) {
+  return utility.getDriverStatisticsRelativeToSnapShot(snapShot);
 }
 
-std::vector<std::string> Descriptions(const RuvoReportingDriverUtility& utility) {
-  std::vector<std::string> names;
+Lines Descriptions(const RuvoReportingDriverUtility& utility) {
+  Lines names;
   for (const auto& subscription : utility.ioChannelSubscriptions()) {
     names.push_back(subscription->driver()->description());
   }
@@ -109,24 +102,22 @@ TEST_F(DriverUtilityTest, SubscribesInTableOrderOnlyDriversWithChannels) {
                                                 {"Speaker", nullopt},
                                                 {nullopt, "MCA"},
                                                 {"Haptics", "Stats"}}));
-  EXPECT_EQ(Descriptions(utility),
-            (std::vector<std::string>{"QuorvexAE2MCA-(null)", "Haptics-Stats"}));
+  EXPECT_EQ(Descriptions(utility), (Lines{"QuorvexAE2MCA-(null)", "Haptics-Stats"}));
   EXPECT_EQ(fake.CreateSubscriptionCalls(), 2);
   for (const auto& subscription : utility.ioChannelSubscriptions()) {
     EXPECT_NE(subscription->subscription(), 0u);
     ASSERT_TRUE(subscription->subscribedChannels());
     EXPECT_EQ(fake.ChannelCount(*subscription->subscribedChannels()), 1);
   }
-  EXPECT_EQ(
-      Texts(log, LogLevel::kInfo),
-      (std::vector<std::string>{"creating metrioning driver utility",
-                                "couldn't find any channels for driver group Speaker-(null)"}));
+  EXPECT_EQ(log.Messages(LogLevel::kInfo),
+            (Lines{"creating metrioning driver utility",
+                   "couldn't find any channels for driver group Speaker-(null)"}));
   // Speaker had a description without channels and is still reported as subscribed.
-  EXPECT_EQ(Texts(log, LogLevel::kDefault),
-            (std::vector<std::string>{"subscribed to group group QuorvexAE2MCA-(null)",
-                                      "subscribed to group group Speaker-(null)",
-                                      "subscribed to group group Haptics-Stats"}));
-  EXPECT_TRUE(Texts(log, LogLevel::kError).empty());
+  EXPECT_EQ(log.Messages(LogLevel::kDefault),
+            (Lines{"subscribed to group group QuorvexAE2MCA-(null)",
+                   "subscribed to group group Speaker-(null)",
+                   "subscribed to group group Haptics-Stats"}));
+  EXPECT_TRUE(log.Messages(LogLevel::kError).empty());
 }
 
 TEST_F(DriverUtilityTest, ChannelsThatComeBackWithAnErrorAreStillUsed) {
@@ -136,19 +127,16 @@ TEST_F(DriverUtilityTest, ChannelsThatComeBackWithAnErrorAreStillUsed) {
   fake.FailCopyChannels("Haptics", "Stats", Failure{.code = 2, .withResult = false});
   RuvoReportingDriverUtility utility(fake);
 
-  EXPECT_EQ(Texts(log, LogLevel::kError),
-            (std::vector<std::string>{"error 35 getting channels for driver Speaker-(null)",
-                                      "error 2 getting channels for driver Haptics-Stats"}));
-  EXPECT_EQ(Descriptions(utility), (std::vector<std::string>{"Speaker-(null)"}));
-  const auto subscribed = Texts(log, LogLevel::kDefault);
+  EXPECT_EQ(log.Messages(LogLevel::kError),
+            (Lines{"error 35 getting channels for driver Speaker-(null)",
+                   "error 2 getting channels for driver Haptics-Stats"}));
+  EXPECT_EQ(Descriptions(utility), (Lines{"Speaker-(null)"}));
+  // Haptics, whose channels came back as none, is not subscribed.
   EXPECT_EQ(
-      std::count(subscribed.begin(), subscribed.end(), "subscribed to group group Speaker-(null)"),
-      1);
-  EXPECT_EQ(
-      std::count(subscribed.begin(), subscribed.end(), "subscribed to group group Haptics-Stats"),
-      0);
-  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(nullptr),
-            (Dictionary{{"Speaker_temp", 4}}));
+      log.Messages(LogLevel::kDefault),
+      (Lines{"subscribed to group group QuorvexAE2MCA-(null)",
+             "subscribed to group group Speaker-(null)", "subscribed to group group (null)-MCA"}));
+  EXPECT_EQ(Delta(utility, nullptr), (Dictionary{{"Speaker_temp", 4}}));
 }
 
 // --- Snapshots and deltas ---
@@ -165,7 +153,7 @@ TEST_F(DriverUtilityTest, OnlyCountersThatRoseAppearAndNothingChangedIsNone) {
   RuvoReportingDriverUtility utility(fake);
 
   const Dictionary unchanged = utility.getSnapShot();
-  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(&unchanged), nullopt);
+  EXPECT_EQ(Delta(utility, &unchanged), nullopt);
 
   fake.SetValue(rise, 17);
   fake.SetValue(fall, 3);
@@ -174,7 +162,7 @@ TEST_F(DriverUtilityTest, OnlyCountersThatRoseAppearAndNothingChangedIsNone) {
   fake.SetValue(haptics, 101);
   fake.SetValue(unnamed, 2);
   log.Clear();
-  const auto delta = utility.getDriverStatisticsRelativeToSnapShot(&unchanged);
+  const auto delta = Delta(utility, &unchanged);
   ASSERT_TRUE(delta);
   EXPECT_EQ(*delta, (Dictionary{{"QuorvexAE2MCA_rise", 7},
                                 {"Speaker_negative", 3},
@@ -183,7 +171,7 @@ TEST_F(DriverUtilityTest, OnlyCountersThatRoseAppearAndNothingChangedIsNone) {
                                 {"Haptics_Stats_kicks", 1},
                                 {"Haptics_Stats_", 2}}));
   EXPECT_TRUE((*delta)["QuorvexAE2MCA_rise"].is_number_integer());
-  EXPECT_EQ(Texts(log, LogLevel::kInfo).size(), 8u);  // getting / done getting, per driver
+  EXPECT_EQ(log.Messages(LogLevel::kInfo).size(), 8u);  // getting / done getting, per driver
   EXPECT_EQ(log.Count("getting latest samples", LogLevel::kInfo), 8u);
   EXPECT_EQ(log.Count("done getting latest samples", LogLevel::kInfo), 4u);
 }
@@ -195,11 +183,9 @@ TEST_F(DriverUtilityTest, LaterChannelWithTheSameKeyReplacesTheEarlierValue) {
   const Dictionary snapShot = utility.getSnapShot();
   fake.SetValue(own, 5);
   fake.SetValue(sub, 9);
-  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(&snapShot),
-            (Dictionary{{"QuorvexAE2MCA_x", 9}}));
+  EXPECT_EQ(Delta(utility, &snapShot), (Dictionary{{"QuorvexAE2MCA_x", 9}}));
   fake.SetValue(sub, 0);  // the later one is not positive: the earlier value stays
-  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(&snapShot),
-            (Dictionary{{"QuorvexAE2MCA_x", 5}}));
+  EXPECT_EQ(Delta(utility, &snapShot), (Dictionary{{"QuorvexAE2MCA_x", 5}}));
 }
 
 TEST_F(DriverUtilityTest, SamplingErrorAtSnapshotLeavesTheDriverOutAndItsDeltaCountsFromNone) {
@@ -210,11 +196,10 @@ TEST_F(DriverUtilityTest, SamplingErrorAtSnapshotLeavesTheDriverOutAndItsDeltaCo
   const Dictionary snapShot = utility.getSnapShot();
   EXPECT_EQ(snapShot.size(), 1u);
   EXPECT_TRUE(snapShot.contains("Haptics-Stats"));
-  EXPECT_EQ(Texts(log, LogLevel::kError),
-            (std::vector<std::string>{"MetrionCreateSamples error 7"}));
+  EXPECT_EQ(log.Messages(LogLevel::kError), (Lines{"MetrionCreateSamples error 7"}));
 
   fake.SetValue(kicks, 11);
-  const auto delta = utility.getDriverStatisticsRelativeToSnapShot(&snapShot);
+  const auto delta = Delta(utility, &snapShot);
   EXPECT_EQ(delta, (Dictionary{{"Speaker_temp", 40}, {"Haptics_Stats_kicks", 1}}));
   const auto calls = fake.DeltaCalls();
   ASSERT_EQ(calls.size(), 2u);
@@ -231,14 +216,12 @@ TEST_F(DriverUtilityTest, SamplingErrorAtStopLeavesOnlyThatDriverOut) {
   fake.SetValue(kicks, 5);
   fake.FailCreateSamples("Haptics", "Stats", Failure{.code = 12, .withResult = true});
   log.Clear();
-  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(&snapShot),
-            (Dictionary{{"Speaker_temp", 4}}));
-  EXPECT_EQ(Texts(log, LogLevel::kError),
-            (std::vector<std::string>{"MetrionCreateSamples error 12"}));
+  EXPECT_EQ(Delta(utility, &snapShot), (Dictionary{{"Speaker_temp", 4}}));
+  EXPECT_EQ(log.Messages(LogLevel::kError), (Lines{"MetrionCreateSamples error 12"}));
   EXPECT_EQ(fake.DeltaCalls().size(), 1u);
 
   fake.FailCreateSamples("Speaker", nullopt, Failure{.code = 12});
-  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(&snapShot), nullopt);
+  EXPECT_EQ(Delta(utility, &snapShot), nullopt);
 }
 
 TEST_F(DriverUtilityTest, FailedDifferenceFallsBackToTheAbsoluteValues) {
@@ -252,17 +235,16 @@ TEST_F(DriverUtilityTest, FailedDifferenceFallsBackToTheAbsoluteValues) {
   // The first difference fails (its partial result is ignored too), the second works.
   fake.FailCreateSamplesDelta(Failure{.code = 9, .withResult = true, .times = 1});
   log.Clear();
-  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(&snapShot),
+  EXPECT_EQ(Delta(utility, &snapShot),
             (Dictionary{{"Speaker_temp", 51}, {"Haptics_Stats_kicks", 2}}));
-  EXPECT_EQ(Texts(log, LogLevel::kError),
-            (std::vector<std::string>{"MetrionCreateSamplesDelta error 9"}));
+  EXPECT_EQ(log.Messages(LogLevel::kError), (Lines{"MetrionCreateSamplesDelta error 9"}));
 }
 
 TEST_F(DriverUtilityTest, SnapshotThatIsNotADictionaryCountsAsMissingKeys) {
   fake.AddChannel("Speaker", nullopt, "temp", 6);
   RuvoReportingDriverUtility utility(fake);
   const Dictionary odd = Value::array();
-  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(&odd), (Dictionary{{"Speaker_temp", 6}}));
+  EXPECT_EQ(Delta(utility, &odd), (Dictionary{{"Speaker_temp", 6}}));
   ASSERT_EQ(fake.DeltaCalls().size(), 1u);
   EXPECT_EQ(fake.DeltaCalls()[0].earlier, nullopt);
 }
@@ -274,8 +256,8 @@ TEST_F(DriverUtilityTest, NoChannelsAnywhereSubscribesAndReportsNothing) {
   EXPECT_EQ(log.Count("couldn't find any channels for driver group", LogLevel::kInfo), 4u);
   const Dictionary snapShot = utility.getSnapShot();
   EXPECT_EQ(snapShot, MakeDictionary());
-  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(&snapShot), nullopt);
-  EXPECT_EQ(utility.getDriverStatisticsRelativeToSnapShot(nullptr), nullopt);
+  EXPECT_EQ(Delta(utility, &snapShot), nullopt);
+  EXPECT_EQ(Delta(utility, nullptr), nullopt);
 }
 
 }  // namespace

@@ -24,6 +24,7 @@ namespace {
 
 using std::chrono::seconds;
 using testing::FakeClientConnection;
+using Replies = std::vector<std::string>;
 
 // Listener that is never asked to do anything: the delegate only receives it.
 class NullListener final : public ServiceListener {
@@ -35,7 +36,7 @@ class NullListener final : public ServiceListener {
 // One accepted client: its connection and the replies it has received, in order.
 struct Client {
   std::shared_ptr<FakeClientConnection> connection;
-  std::vector<std::string> replies;
+  Replies replies;
 
   RuvoReportingServiceProtocol& service() { return *connection->ExportedObject(); }
   RuvoReportingServiceProtocol::BoolReply Bool(std::string what) {
@@ -133,8 +134,8 @@ TEST_F(ServiceDelegateTest, StartReplyIsHeldUntilItsOwnClientStopsAndLookupFavou
   b->service().startReportingSessionForID(7, b->Bool("start"));
   b->service().stopReportingSessionForID(7, b->Bool("stop"));
   Run();
-  EXPECT_EQ(b->replies, (std::vector<std::string>{"create=YES", "start=YES", "stop=YES"}));
-  EXPECT_EQ(a->replies, (std::vector<std::string>{"create=YES", "create=YES"}));
+  EXPECT_EQ(b->replies, (Replies{"create=YES", "start=YES", "stop=YES"}));
+  EXPECT_EQ(a->replies, (Replies{"create=YES", "create=YES"}));
   EXPECT_TRUE(delegate->findReportingSessionForID(7)->started());
   EXPECT_EQ(log.Count("found reporting session 7 for client 100"), 2u);
   EXPECT_EQ(delegate->findReportingSessionForID(9)->processIdentifiers(),
@@ -146,8 +147,7 @@ TEST_F(ServiceDelegateTest, StartReplyIsHeldUntilItsOwnClientStopsAndLookupFavou
   // The held start reply arrives before the stop reply.
   a->service().stopReportingSessionForID(7, a->Bool("stop"));
   Run();
-  EXPECT_EQ(a->replies,
-            (std::vector<std::string>{"create=YES", "create=YES", "start=YES", "stop=YES"}));
+  EXPECT_EQ(a->replies, (Replies{"create=YES", "create=YES", "start=YES", "stop=YES"}));
   EXPECT_EQ(traces.Count(trace::kClientCreate), 3u);
   EXPECT_EQ(traces.Count(trace::kClientStart), 2u);
   EXPECT_EQ(traces.Count(trace::kClientStop), 2u);
@@ -228,13 +228,12 @@ TEST_F(ServiceDelegateTest, CreatingAnIdTwiceReplacesTheSessionWithoutStoppingIt
   ASSERT_TRUE(current);
   EXPECT_FALSE(current->started());
   // The held start reply went with the replaced session: it is never answered.
-  EXPECT_EQ(client->replies, (std::vector<std::string>{"create=YES", "create=YES"}));
+  EXPECT_EQ(client->replies, (Replies{"create=YES", "create=YES"}));
 }
 
 TEST_F(ServiceDelegateTest, StopSendsThePositiveDriverDeltaIntoTheSessionFirst) {
   const int channel = platform.driverStats.AddChannel("Speaker", std::nullopt, "xruns", 10);
-  auto second = RuvoReportingServiceDelegate::init(platform.services);  // subscribes anew
-  delegate = second;
+  delegate = RuvoReportingServiceDelegate::init(platform.services);  // subscribes anew
   auto client = Connect(100);
   client->CreateAndStart(7);
   Run();
@@ -244,9 +243,7 @@ TEST_F(ServiceDelegateTest, StopSendsThePositiveDriverDeltaIntoTheSessionFirst) 
   ASSERT_EQ(platform.telvoro.Sessions().size(), 1u);
   auto messages = platform.telvoro.Sessions()[0]->Messages();
   ASSERT_EQ(messages.size(), 2u) << "the delta, then the summary of the stop";
-  EXPECT_EQ(messages[0].category, 9);
-  EXPECT_EQ(messages[0].type, 0);
-  EXPECT_EQ(messages[0].payload, (Dictionary{{"Speaker_xruns", 3}}));
+  EXPECT_EQ(messages[0], (testing::FakeTelvoroMessage{9, 0, {{"Speaker_xruns", 3}}}));
   EXPECT_EQ(messages[1].type, kSummaryEventType);  // the category reaches it masked to 16 bits
   EXPECT_EQ(log.Count("fetching driver logs {\"Speaker_xruns\":3}"), 1u);
   RuvoReportingSessionPtr session = delegate->findReportingSessionForID(7);
@@ -268,15 +265,13 @@ TEST_F(ServiceDelegateTest, DisconnectStopsRunningSessionsAndRemovesTheClientOnc
   EXPECT_TRUE(delegate->getAllClients().empty());
   EXPECT_EQ(traces.Count(trace::kSessionStopped), 1u);
   // No held reply on this road.
-  EXPECT_EQ(client->replies, (std::vector<std::string>{"create=YES"}));
+  EXPECT_EQ(client->replies, (Replies{"create=YES"}));
   EXPECT_EQ(log.Count("InvalidationHandler: connection exited process=mediaplayer uptime_sec=42"),
             1u);
   auto events = platform.analytics.Events();
   ASSERT_EQ(events.size(), 1u);
   EXPECT_EQ(events[0].name, "com.quorvex.tavrin.ruvoreportingclientuptime");
-  ASSERT_TRUE(events[0].payload);
-  EXPECT_EQ((*events[0].payload)["processName"], "mediaplayer");
-  EXPECT_DOUBLE_EQ((*events[0].payload)["seconds"].get<double>(), 42.0);
+  EXPECT_EQ(events[0].payload, (Dictionary{{"processName", "mediaplayer"}, {"seconds", 42.0}}));
   // With the connection and the client list gone, the instance and its sessions are released.
   EXPECT_EQ(log.Count("dealloc 100 from the server client list"), 1u);
   EXPECT_EQ(traces.Count(trace::kSessionReleased), 1u);
@@ -319,8 +314,7 @@ TEST_F(ServiceDelegateTest, DestroyStopsARunningSessionAndReportersAreListedInOr
   EXPECT_EQ(traces.Count(trace::kSessionStopped), 1u);
   EXPECT_EQ(log.Count("destroying 7"), 1u);
   EXPECT_EQ(log.Count("destroying 0"), 0u);
-  EXPECT_EQ(a->replies, (std::vector<std::string>{"create=YES", "c=YES", "c=YES", "destroy=YES",
-                                                  "destroy0=YES"}));
+  EXPECT_EQ(a->replies, (Replies{"create=YES", "c=YES", "c=YES", "destroy=YES", "destroy0=YES"}));
 }
 
 // Pings only while probes come back through the work queue within the interval; a stuck queue

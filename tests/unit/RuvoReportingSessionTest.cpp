@@ -12,6 +12,7 @@
 #include <thread>
 #include <vector>
 
+#include <fmt/format.h>
 #include <gtest/gtest.h>
 
 #include "Statistics/RuvoReportingKelvaneUtility.h"
@@ -31,19 +32,10 @@ using std::chrono::seconds;
 using Builders = FakeAnalyticsSink::Builders;
 using Discovery = FakeTelvoroService::Discovery;
 using Kind = FakeOrientationRegistry::Kind;
+using Change = FakeOrientationRegistry::Change;
 
 class SessionTest : public SessionTestBase {
  protected:
-  // A session started, with the queued half of start run (up to the back-end wait).
-  std::shared_ptr<RuvoReportingSession> Started(int64_t reporterID = 42, uint16_t type = 3) {
-    auto session = Create(reporterID, type);
-    StartAndRun(session);
-    return session;
-  }
-  void StartAndRun(const std::shared_ptr<RuvoReportingSession>& session) {
-    session->start();
-    platform.dispatcher.RunUntilIdle();
-  }
   void Send(const std::shared_ptr<RuvoReportingSession>& session, const Dictionary& payload) {
     session->sendMessage(payload, 1, 1, nullptr);
   }
@@ -77,7 +69,7 @@ TEST_F(SessionTest, CreationSettersAndReleaseAreLoggedAndTraced) {
   session->setConfiguration(Dictionary());               // none: nothing changes
   session->setConfiguration(Dictionary::array({1, 2}));  // not a dictionary: refused, logged
   EXPECT_EQ(session->userInfo(), (Dictionary{{"a", 1}, {"b", 3}, {"c", "x"}}));
-  EXPECT_EQ(SessionMessages(LogLevel::kError).size(), 1u);
+  EXPECT_EQ(log.Messages(LogLevel::kError, "rvrr").size(), 1u);
 
   session.reset();
   EXPECT_EQ(traces.Count(trace::kSessionReleased), 1u);
@@ -130,8 +122,7 @@ TEST_F(SessionTest, BackendsThatNeverAnswerDropTheSessionAfterNineSecondsAndAggr
   session->sendMessage(Dictionary{{"seq", 3}}, 1, 1, reply);
   EXPECT_EQ(replies, 4);
   EXPECT_EQ(Aggregated(session->summaryTexts()), 4u);
-  session->stop();
-  platform.dispatcher.RunUntilIdle();
+  StopAndRun(session);
   EXPECT_EQ(CountMessage("sending summary event for reporter 42", LogLevel::kDefault), 1u);
   EXPECT_EQ(CountMessage("No valid TelvoroSession", LogLevel::kError), 5u);
   EXPECT_EQ(replies, 4);  // none twice
@@ -204,13 +195,10 @@ TEST_F(SessionTest, AnImmediateAnswerMeansNoWaitAndTheBackEndGetsSessionAndUserI
   auto fake = platform.telvoro.LastSession();
   const Dictionary& info = fake->SessionInfo();
   // As text, so the number types count too.
-  EXPECT_EQ(info.dump(), (Dictionary{{"ClientType", 19},
-                                     {"ClientVersion", 2.0},
-                                     {"SessionID", reporter},
-                                     {"BatchEvent", true},
-                                     {"HierarchyToken", token->value},
-                                     {"ContainsRealtimeEvents", false}})
-                             .dump());
+  EXPECT_EQ(info.dump(), fmt::format(R"({{"ClientType":19,"ClientVersion":2.0,"SessionID":{},)"
+                                     R"("BatchEvent":true,"HierarchyToken":{},)"
+                                     R"("ContainsRealtimeEvents":false}})",
+                                     reporter, token->value));
   EXPECT_EQ(fake->UserInfo(), (Dictionary{{"ClientName", "com.quorvex.tavrin"},
                                           {"ServiceName", "telephony_session"},
                                           {"HostApplicationDisplayID", "com.example.app"},
@@ -236,9 +224,7 @@ TEST_F(SessionTest, ServiceNamesAndBatchingFollowTheServiceTypeUnlessTheClientNa
       {0xFFFF, Dictionary(), {{"ClientName", client}, {"ServiceName", "unknown_session"}}},
   };
   for (const auto& c : cases) {
-    auto session = Create(1, c.type);
-    session->setConfiguration(c.configuration);
-    StartAndRun(session);
+    Started(c.type, c.configuration, 1);
     const auto fake = platform.telvoro.LastSession();
     EXPECT_EQ(fake->UserInfo(), c.userInfo) << c.type;
     // Only API-usage sessions are real-time.
@@ -250,7 +236,7 @@ TEST_F(SessionTest, ServiceNamesAndBatchingFollowTheServiceTypeUnlessTheClientNa
 // --- start and stop ---------------------------------------------------------------------------
 
 TEST_F(SessionTest, TestSessionsGetNoBackEndButStillSummarise) {
-  auto session = Started(5, 11);
+  auto session = Started(11, Dictionary(), 5);
   EXPECT_TRUE(platform.telvoro.Tokens().empty());
   EXPECT_TRUE(platform.telvoro.Sessions().empty());
   EXPECT_EQ(session->telvoroAgentToken(), nullptr);
@@ -259,8 +245,7 @@ TEST_F(SessionTest, TestSessionsGetNoBackEndButStillSummarise) {
   platform.dispatcher.RunUntilIdle();
   EXPECT_EQ(CountMessage("transactions aren't allowed on this platform", LogLevel::kInfo), 1u);
 
-  session->stop();
-  platform.dispatcher.RunUntilIdle();
+  StopAndRun(session);
   EXPECT_EQ(CountMessage("sending summary event for reporter 5"), 1u);
   EXPECT_EQ(CountMessage("transactions aren't allowed on this platform"), 2u);
   EXPECT_EQ(platform.fileSystem.Files().size(), 1u);
@@ -273,8 +258,7 @@ TEST_F(SessionTest, BeforeStartMessagesGoAloneStopDoesNothingAndStartDropsTheAgg
   session->sendMessage(Dictionary{{"early", 1}}, 1, 1,
                        [&](const OptionalError& error) { replied = !error; });
   EXPECT_TRUE(replied);
-  session->stop();
-  platform.dispatcher.RunUntilIdle();
+  StopAndRun(session);
   EXPECT_FALSE(session->started());
   EXPECT_EQ(CountMessage("sending summary event for reporter 42"), 0u);
   EXPECT_TRUE(platform.fileSystem.CreateDirectoriesCalls().empty());
@@ -309,10 +293,9 @@ TEST_F(SessionTest, StopFlushesAfterEveryQueuedMessageAndDropsTheLists) {
   EXPECT_EQ(Sequence(fake), (std::vector<int64_t>{0, 1, 2}));
   EXPECT_TRUE(platform.telvoro.SingleMessages().empty());
   EXPECT_EQ(fake->MessagesAtFlush(), (std::vector<size_t>{4}));
-  const FakeTelvoroMessage summary = fake->Messages().back();
-  EXPECT_EQ(summary.category, 0xFFFF);
-  EXPECT_EQ(summary.type, 0xFFFF);
-  EXPECT_EQ(summary.payload, (Dictionary{{"Ruvo_Session_Summary_Event", "3"}, {"seq", "0,1,2"}}));
+  EXPECT_EQ(fake->Messages().back(),
+            (FakeTelvoroMessage{
+                0xFFFF, 0xFFFF, {{"Ruvo_Session_Summary_Event", "3"}, {"seq", "0,1,2"}}}));
   EXPECT_EQ(session->telvoroSession(), nullptr);
   EXPECT_EQ(CountMessage("flush error disk full", LogLevel::kError), 1u);
   EXPECT_EQ(log.Count(":stop: flush error disk full"), 1u);
@@ -322,8 +305,7 @@ TEST_F(SessionTest, StartingTwiceChangesNothingButARestartGetsANewBackEndAndFres
   auto session = Started();
   Send(session, Dictionary{{"a", 1}});
   const auto list = session->summaryTexts();
-  session->start();
-  platform.dispatcher.RunUntilIdle();
+  StartAndRun(session);
   EXPECT_EQ(CountMessage("42 is already started", LogLevel::kInfo), 1u);
   EXPECT_EQ(session->summaryTexts(), list);
   EXPECT_EQ(Aggregated(list), 1u);
@@ -331,8 +313,7 @@ TEST_F(SessionTest, StartingTwiceChangesNothingButARestartGetsANewBackEndAndFres
   EXPECT_EQ(traces.Count(trace::kSessionStarted), 1u);
 
   Send(session, Dictionary{{"a", 2}});
-  session->stop();
-  platform.dispatcher.RunUntilIdle();
+  StopAndRun(session);
   StartAndRun(session);
   EXPECT_EQ(platform.telvoro.Sessions().size(), 2u);
   EXPECT_EQ(platform.telvoro.Tokens().size(), 2u);
@@ -350,7 +331,7 @@ TEST_F(SessionTest, TheBackEndGetsKeysWithoutBlanksAndTheLogTheMessageAsSent) {
   session->sendMessage(Value::array({1, 2}), 1, 1, nullptr);  // not a dictionary: reported
   session->sendMessage(Value(), 1, 1, nullptr);
   platform.dispatcher.RunUntilIdle();
-  EXPECT_EQ(SessionMessages(LogLevel::kError).size(), 1u);
+  EXPECT_EQ(log.Messages(LogLevel::kError, "rvrr").size(), 1u);
 
   const auto messages = platform.telvoro.LastSession()->Messages();
   ASSERT_EQ(messages.size(), 3u);
@@ -369,7 +350,7 @@ TEST_F(SessionTest, TheBackEndGetsKeysWithoutBlanksAndTheLogTheMessageAsSent) {
   Send(session, Dictionary{{"a", 1}});
   platform.dispatcher.RunUntilIdle();
   EXPECT_EQ(platform.telvoro.LastSession()->RefusedCount(), 1u);
-  EXPECT_EQ(SessionMessages(LogLevel::kError).size(), 1u);
+  EXPECT_EQ(log.Messages(LogLevel::kError, "rvrr").size(), 1u);
 }
 
 TEST_F(SessionTest, MessageIdsCountPerCategoryAndType) {
@@ -393,9 +374,7 @@ TEST_F(SessionTest, MessageIdsCountPerCategoryAndType) {
 }
 
 TEST_F(SessionTest, AfterStopMessagesGoAloneAndReachNoSummary) {
-  auto session = Create(42, 2);
-  session->setConfiguration(Dictionary{{"HostApplicationDisplayID", "app"}});
-  StartAndRun(session);
+  auto session = Started(2, Dictionary{{"HostApplicationDisplayID", "app"}});
   Send(session, Dictionary{{"kept", 1}});
   session->stop();
   session->sendMessage(Dictionary{{"late key", 2}}, 3, 4, nullptr);
@@ -415,10 +394,8 @@ TEST_F(SessionTest, AfterStopMessagesGoAloneAndReachNoSummary) {
   // Not in the summary of a later run either.
   StartAndRun(session);
   Send(session, Dictionary{{"next", 3}});
-  const auto summary = session->createSummaryEventForSession();
-  ASSERT_TRUE(summary.has_value());
-  EXPECT_FALSE(summary->contains("late_key"));
-  EXPECT_TRUE(summary->contains("next"));
+  EXPECT_EQ(session->createSummaryEventForSession(),
+            (Dictionary{{"Ruvo_Session_Summary_Event", "2"}, {"next", "3"}}));
 }
 
 // --- single messages --------------------------------------------------------------------------
@@ -496,13 +473,13 @@ constexpr const char* kCallbackID = "RuvoReportingService 42";
 // stop; other types, never-started sessions and device class 6 never track.
 TEST_F(SessionTest, OnlyTelephonyAndLongFormAudioTrackOrientation) {
   for (uint16_t type : {uint16_t{0}, uint16_t{3}, uint16_t{8}, uint16_t{0xFFFF}}) {
-    auto session = Started(42, type);
+    auto session = Started(type);
     EXPECT_FALSE(session->orientationCallbackID().has_value()) << type;
     session->stop();
   }
   Create(42, 2)->stop();  // never started: nothing to unregister
   platform.deviceInfo.SetInt32(kDeviceInfoDeviceClassNumber, 6);
-  auto classSix = Started(42, 2);
+  auto classSix = Started(2);
   EXPECT_FALSE(classSix->shouldReportOrientation());
   EXPECT_FALSE(classSix->orientationCallbackID().has_value());
   EXPECT_TRUE(platform.orientation.History().empty());
@@ -511,7 +488,7 @@ TEST_F(SessionTest, OnlyTelephonyAndLongFormAudioTrackOrientation) {
 
   for (uint16_t type : {uint16_t{2}, uint16_t{7}}) {
     const size_t before = platform.orientation.History().size();
-    auto session = Started(42, type);
+    auto session = Started(type);
     EXPECT_TRUE(session->shouldReportOrientation());
     EXPECT_EQ(session->orientationCallbackID(), kCallbackID);
     EXPECT_EQ(session->startDate(), platform.clock.Now());
@@ -520,20 +497,17 @@ TEST_F(SessionTest, OnlyTelephonyAndLongFormAudioTrackOrientation) {
     EXPECT_EQ(platform.orientation.FireDevice("portrait"), 0u);
 
     const auto history = platform.orientation.History();
-    ASSERT_EQ(history.size(), before + 4);
-    const Kind kinds[] = {Kind::kDevice, Kind::kUI, Kind::kDevice, Kind::kUI};
-    const bool registered[] = {true, true, false, false};
-    for (size_t i = 0; i < 4; ++i) {
-      EXPECT_EQ(history[before + i].kind, kinds[i]) << i;
-      EXPECT_EQ(history[before + i].registered, registered[i]) << i;
-      EXPECT_EQ(history[before + i].id, kCallbackID) << i;
-    }
+    EXPECT_EQ(std::vector<Change>(history.begin() + before, history.end()),
+              (std::vector<Change>{{Kind::kDevice, true, kCallbackID},
+                                   {Kind::kUI, true, kCallbackID},
+                                   {Kind::kDevice, false, kCallbackID},
+                                   {Kind::kUI, false, kCallbackID}}));
   }
 }
 
 TEST_F(SessionTest, TimesAreRoundedToWholeMilliseconds) {
   platform.orientation.SetText("3", "landscape-left");
-  auto session = Started(42, 2);
+  auto session = Started(2);
   platform.clock.Advance(microseconds(12600));
   EXPECT_EQ(platform.orientation.FireUI("3"), 1u);
   platform.clock.Advance(microseconds(2000400 - 12600));
@@ -554,7 +528,7 @@ TEST_F(SessionTest, TimesAreRoundedToWholeMilliseconds) {
 }
 
 TEST_F(SessionTest, TheCallbacksHoldTheSessionUntilStopUnregistersThem) {
-  std::weak_ptr<RuvoReportingSession> weak = Started(42, 2);
+  std::weak_ptr<RuvoReportingSession> weak = Started(2);
   // Released without stop: still registered, still aggregating.
   ASSERT_FALSE(weak.expired());
   EXPECT_EQ(platform.orientation.FireUI("portrait"), 1u);
@@ -573,7 +547,7 @@ TEST_F(SessionTest, TheCallbacksHoldTheSessionUntilStopUnregistersThem) {
 }
 
 TEST_F(SessionTest, ARestartRegistersAgainAndRecordsInterleaveWithMessages) {
-  auto session = Started(42, 7);
+  auto session = Started(7);
   session->stop();
   platform.clock.Advance(std::chrono::seconds(30));
   session->start();
@@ -638,7 +612,7 @@ TEST_F(SinksTest, EveryMessageBecomesANamedAnalyticsEventWithTheSessionsApplicat
   EXPECT_EQ(*events[4].payload, (Dictionary{{"HostApplicationDisplayID", "Unknown"}}));
   // No engine time, or no dictionary: no power event.
   EXPECT_TRUE(platform.powerLog.Events().empty());
-  EXPECT_TRUE(DefaultMessages(LogLevel::kError).empty());
+  EXPECT_TRUE(log.Messages(LogLevel::kError, "default").empty());
 }
 
 TEST_F(SinksTest, TheLazyPayloadIsTheOnePreparedAtSendTimeAndASwitchedOffSinkNeverBuildsIt) {
@@ -662,7 +636,7 @@ TEST_F(SinksTest, TheLazyPayloadIsTheOnePreparedAtSendTimeAndASwitchedOffSinkNev
 TEST_F(SinksTest, EngineTimeBecomesAPowerEventAndAMissingTimestampIsLogged) {
   Offer(Dictionary{{"EngineOnTime", 12.5}, {"ruvoreporting_timestamp", 1700000000123}, {"x", 1}}, 3,
         2);
-  EXPECT_TRUE(DefaultMessages(LogLevel::kError).empty());
+  EXPECT_TRUE(log.Messages(LogLevel::kError, "default").empty());
   Offer(Dictionary{{"EngineOnTime", 3}}, 1, 1);
   const auto events = platform.powerLog.Events();
   ASSERT_EQ(events.size(), 2u);
@@ -675,7 +649,7 @@ TEST_F(SinksTest, EngineTimeBecomesAPowerEventAndAMissingTimestampIsLogged) {
                                           .dump());
   EXPECT_EQ(events[1].payload,
             (Dictionary{{"EngineOnDuration", 3}, {"ApplicationName", "com.example.game"}}));
-  EXPECT_EQ(DefaultMessages(LogLevel::kError),
+  EXPECT_EQ(log.Messages(LogLevel::kError, "default"),
             std::vector<std::string>{"failed to get RuvoReporting timestamp for kelvane"});
 }
 
@@ -686,7 +660,7 @@ TEST_F(SinksTest, AnAbsentApplicationNameIsLoggedAndLeftOut) {
   const auto events = platform.powerLog.Events();
   ASSERT_EQ(events.size(), 1u);
   EXPECT_EQ(events[0].payload, (Dictionary{{"EngineOnDuration", "7"}, {"TimestampEnd", 5}}));
-  EXPECT_EQ(DefaultMessages(LogLevel::kError),
+  EXPECT_EQ(log.Messages(LogLevel::kError, "default"),
             std::vector<std::string>{"failed to get app name for kelvane"});
 
   RuvoReportingKelvaneUtility::handleEvent(Dictionary{{"EngineOnTime", 1}}, 1, 1, *Create(7, 3));
@@ -793,11 +767,8 @@ TEST_F(SessionThreadsTest, MessagesKeepTheirOrderWhileOrientationAndStopRunElsew
     EXPECT_FALSE(summary.contains("late"));
     records += summary.contains("device_orientation") || summary.contains("ui_orientation");
     if (summary.contains("device_orientation")) {
-      const auto count = [&](const char* key) {
-        const std::string text = summary[key].get<std::string>();
-        return std::count(text.begin(), text.end(), ',');
-      };
-      EXPECT_EQ(count("device_orientation"), count("device_orientation_time"));
+      EXPECT_EQ(std::ranges::count(summary["device_orientation"].get<std::string>(), ','),
+                std::ranges::count(summary["device_orientation_time"].get<std::string>(), ','));
     }
     EXPECT_EQ(fake->MessagesAtFlush(), std::vector<size_t>{kMessages + 1});
   }

@@ -3,7 +3,6 @@
 #include <algorithm>
 #include <cstdlib>
 #include <ctime>
-#include <memory>
 #include <random>
 #include <string>
 #include <vector>
@@ -19,17 +18,7 @@ namespace {
 constexpr const char* kDirectory = "/fake/log/DiagnosticLogs/Audio/Reporting";
 
 // The base sets TZ to UTC for every test, so a zone a case sets does not outlive it.
-class SummaryTest : public SessionTestBase {
- protected:
-  std::shared_ptr<RuvoReportingSession> Started(uint16_t serviceType,
-                                                const Dictionary& configuration = Dictionary()) {
-    auto session = Create(42, serviceType);
-    session->setConfiguration(configuration);
-    session->start();
-    platform.dispatcher.RunUntilIdle();
-    return session;
-  }
-};
+using SummaryTest = SessionTestBase;
 
 TEST_F(SummaryTest, TheFileIsNamedByLocalTimeAppAndServiceInAPrivateDirectory) {
   const struct {
@@ -49,8 +38,7 @@ TEST_F(SummaryTest, TheFileIsNamedByLocalTimeAppAndServiceInAPrivateDirectory) {
     auto session = Started(c.serviceType,
                            c.app ? Dictionary{{"HostApplicationDisplayID", c.app}} : Dictionary());
     session->sendMessage(Dictionary{{"a", 1}}, 1, 1, nullptr);
-    session->stop();
-    platform.dispatcher.RunUntilIdle();  // the file is written on the session's queue
+    StopAndRun(session);  // the file is written on the session's queue
     ASSERT_FALSE(platform.fileSystem.WriteCalls().empty());
     EXPECT_EQ(platform.fileSystem.WriteCalls().back(), std::string(kDirectory) + "/" + c.name);
     const auto creates = platform.fileSystem.CreateDirectoriesCalls();
@@ -58,7 +46,7 @@ TEST_F(SummaryTest, TheFileIsNamedByLocalTimeAppAndServiceInAPrivateDirectory) {
     EXPECT_EQ(creates.back(), std::make_pair(std::string(kDirectory), 0750u));
   }
   EXPECT_EQ(platform.fileSystem.Files().size(), 3u);
-  EXPECT_TRUE(SessionMessages(LogLevel::kError).empty());
+  EXPECT_TRUE(log.Messages(LogLevel::kError, "rvrr").empty());
 }
 
 // Generated sessions (seeded): the summary event and file, built as messages arrive, must equal
@@ -119,8 +107,7 @@ TEST_F(SummaryTest, GeneratedSessionsMatchThePlainAlgorithm) {
       const auto summary = session->createSummaryEventForSession();
       ASSERT_EQ(summary ? summary->dump() : "none", sent.empty() ? "none" : expected.dump());
       const size_t writes = platform.fileSystem.WriteCalls().size();
-      session->stop();
-      platform.dispatcher.RunUntilIdle();
+      StopAndRun(session);
       const auto calls = platform.fileSystem.WriteCalls();
       ASSERT_EQ(calls.size(), writes + (sent.empty() ? 0 : 1));
       if (!sent.empty()) {
@@ -134,21 +121,19 @@ TEST_F(SummaryTest, GeneratedSessionsMatchThePlainAlgorithm) {
 // again in order, the key order unchanged.
 TEST_F(SummaryTest, LongTextsSpillToTheSpoolAndComeBackWhole) {
   auto session = Started(3);
-  Dictionary expected{{"Ruvo_Session_Summary_Event", "3"}, {"long", ""}, {"short", ""}};
+  std::string longs, shorts;
   for (int i = 0; i < 400; ++i) {
     const std::string text = std::string(size_t(i % 50), 'a' + char(i % 26)) + std::to_string(i);
     session->sendMessage(Dictionary{{"long", text}, {"short", i % 2}}, 1, 1, nullptr);
-    for (const auto& [key, value] :
-         {std::pair<std::string, std::string>{"long", text}, {"short", std::to_string(i % 2)}}) {
-      std::string& joined = expected[key].get_ref<std::string&>();
-      joined += (i ? "," : "") + value;
-    }
+    longs += (i ? "," : "") + text;
+    shorts += (i ? "," : "") + std::to_string(i % 2);
   }
   platform.dispatcher.RunUntilIdle();
   size_t pieces = 0;
   session->spool()->Replay([&](const Value& record) { pieces += record[0] == "k" ? 1 : 0; });
   EXPECT_GE(pieces, 2u);
-  EXPECT_EQ(session->createSummaryEventForSession(), expected);
+  EXPECT_EQ(session->createSummaryEventForSession(),
+            (Dictionary{{"Ruvo_Session_Summary_Event", "3"}, {"long", longs}, {"short", shorts}}));
 }
 
 // A full spool says so once and keeps what it has; the summary event stays whole because texts
@@ -169,9 +154,8 @@ TEST_F(SummaryTest, AFullSpoolLeavesLaterMessagesOutOfTheFileButNotOfTheSummary)
   EXPECT_LT(spooled, 10u);
   EXPECT_EQ(session->createSummaryEventForSession(),
             (Dictionary{{"Ruvo_Session_Summary_Event", "3"}, {"k", joined}}));
-  session->stop();
-  platform.dispatcher.RunUntilIdle();
-  const auto errors = SessionMessages(LogLevel::kError);
+  StopAndRun(session);
+  const auto errors = log.Messages(LogLevel::kError, "rvrr");
   ASSERT_EQ(errors.size(), 1u);
   EXPECT_NE(errors[0].find("the spool is full"), std::string::npos) << errors[0];
   const Value file =
@@ -251,9 +235,8 @@ TEST_F(SummaryTest, WritingPutsTheUserInfoFirstEveryTime) {
 TEST_F(SummaryTest, FileErrorsAreLoggedAndTheStepsAfterThemStillRun) {
   const std::string d = std::string("can't create logging directory at ") + kDirectory + ": ";
   const std::string w = "jsonOutput writeToURL: ";
-  auto failure = [](const char* text) -> OptionalError {
-    if (text == nullptr) return std::nullopt;
-    return Error{"posix", 1, text};
+  auto failure = [](const char* text) {
+    return text ? OptionalError(Error{"posix", 1, text}) : std::nullopt;
   };
   const struct {
     bool directoryExists;
@@ -278,11 +261,10 @@ TEST_F(SummaryTest, FileErrorsAreLoggedAndTheStepsAfterThemStillRun) {
     log.Clear();
     auto session = Started(3);
     session->sendMessage(Dictionary{{"bad", c.value}}, 1, 1, nullptr);
-    session->stop();
-    platform.dispatcher.RunUntilIdle();
+    StopAndRun(session);
     platform.services.fileSystem = &platform.fileSystem;
 
-    const auto errors = SessionMessages(LogLevel::kError);
+    const auto errors = log.Messages(LogLevel::kError, "rvrr");
     ASSERT_EQ(errors.size(), c.errors.size());
     for (size_t i = 0; i < errors.size(); ++i) EXPECT_EQ(errors[i].rfind(c.errors[i], 0), 0u);
     const bool valid = std::string(c.value) == "x";

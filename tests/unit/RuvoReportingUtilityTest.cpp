@@ -22,7 +22,6 @@ using std::chrono::milliseconds;
 using std::chrono::seconds;
 using testing::FakeDeviceInfo;
 using testing::FakeLogSystem;
-using testing::LoggedLine;
 
 // ---------------------------------------------------------------------------------------------
 // Name tables
@@ -105,8 +104,7 @@ TEST(IsInternalBuildTest, SixteenConcurrentFirstCallsAskOnceAndAgree) {
   device.SetBool("InternalBuild", true);
   // Holds the one query open so that the other threads reach the guard while it runs.
   device.SetQueryHook([](std::string_view) { std::this_thread::sleep_for(milliseconds(50)); });
-  PlatformServices services;
-  services.deviceInfo = &device;
+  PlatformServices services{.deviceInfo = &device};
 
   std::latch start(kThreads);
   std::vector<int> answers(kThreads, -1);
@@ -125,8 +123,7 @@ TEST(IsInternalBuildTest, SixteenConcurrentFirstCallsAskOnceAndAgree) {
   device.SetBool("InternalBuild", false);
   EXPECT_TRUE(IsInternalBuild(services));
   EXPECT_EQ(device.QueryCount("InternalBuild"), 1u);
-  PlatformServices other;
-  other.deviceInfo = &device;
+  PlatformServices other{.deviceInfo = &device};
   EXPECT_FALSE(IsInternalBuild(other));
   PlatformServices noQuery;
   EXPECT_FALSE(IsInternalBuild(noQuery));
@@ -185,20 +182,21 @@ TEST(WaitTest, ScriptedOutcomesGiveTheirResultDeadlinesAndLines) {
     std::vector<O> script;
     bool result;
     std::vector<SteadyTime> deadlines;
-    std::vector<std::string> lines;  // W = waiting, C = continuing, T = timed out (an error)
+    std::vector<std::string>
+        lines;  // W (waiting) and "continuing" by default, T (timed out) an error
   } cases[] = {
       {{{O::kTimeOut}}, false, {t0 + t}, {"W", "T"}},
-      {{{O::kSignalWithFlag, milliseconds(300)}}, true, {t0 + t}, {"W", "C"}},
+      {{{O::kSignalWithFlag, milliseconds(300)}}, true, {t0 + t}, {"W", "continuing"}},
       {{{O::kSignalWithoutFlag, seconds(2)},
         {O::kSignalWithoutFlag, milliseconds(2400)},
         {O::kSignalWithFlag, seconds(1)}},
        true,
        {t0 + t, t0 + seconds(2) + t, t0 + milliseconds(4400) + t},
-       {"W", "C", "W", "C", "W", "C"}},
+       {"W", "continuing", "W", "continuing", "W", "continuing"}},
       {{{O::kSignalWithoutFlag, seconds(2)}, {O::kTimeOut}},
        false,
        {t0 + t, t0 + seconds(2) + t},
-       {"W", "C", "W", "T"}},
+       {"W", "continuing", "W", "T"}},
   };
   for (size_t i = 0; i < std::size(cases); ++i) {
     FakeLogSystem logs;
@@ -208,18 +206,13 @@ TEST(WaitTest, ScriptedOutcomesGiveTheirResultDeadlinesAndLines) {
         << i;
     EXPECT_EQ(condition.deadlines, cases[i].deadlines) << i;
     EXPECT_TRUE(condition.Balanced()) << i;
-    std::vector<std::string> lines;
-    for (const LoggedLine& line : logs.Lines()) {
-      EXPECT_EQ(line.scope, "default");
-      const bool error = line.text.ends_with(": T");
-      EXPECT_EQ(line.level, error ? LogLevel::kError : LogLevel::kDefault) << line.text;
-      // The prefix names the operation, not a helper.
-      EXPECT_NE(line.text.find(":RuvoReportingUtilityWait: "), std::string::npos) << line.text;
-      lines.push_back(line.text.substr(line.text.rfind(' ') + 1) == "continuing"
-                          ? "C"
-                          : line.text.substr(line.text.size() - 1));
-    }
-    EXPECT_EQ(lines, cases[i].lines) << i;
+    std::vector<std::string> defaults, errors;  // the expected lines by level
+    for (const auto& line : cases[i].lines) (line == "T" ? errors : defaults).push_back(line);
+    EXPECT_EQ(logs.Messages(), cases[i].lines) << i;  // in this order, and nothing else
+    EXPECT_EQ(logs.Messages(LogLevel::kDefault, "default"), defaults) << i;
+    EXPECT_EQ(logs.Messages(LogLevel::kError, "default"), errors) << i;
+    // The prefix names the operation, not a helper.
+    EXPECT_EQ(logs.Count(":RuvoReportingUtilityWait: "), cases[i].lines.size()) << i;
   }
 }
 
@@ -258,8 +251,8 @@ TEST(WaitTest, SetFlagThrowingWaitAndOddTimeouts) {
   flag = false;
   ScriptedCondition scoped(flag, {{O::kTimeOut}});
   EXPECT_FALSE(RuvoReportingUtilityWait(scoped, flag, "W", "T", scope, 2.5));
-  ASSERT_EQ(logs.Lines().size(), 2u);
-  for (const LoggedLine& line : logs.Lines()) EXPECT_EQ(line.scope, "session");
+  EXPECT_EQ(logs.Lines().size(), 2u);
+  EXPECT_EQ(logs.Messages({}, "session"), (std::vector<std::string>{"W", "T"}));
 }
 
 }  // namespace
