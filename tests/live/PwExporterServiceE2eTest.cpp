@@ -2,9 +2,7 @@
 // runs a graph, the real tavrin-pw-exporter writes its counters under the root of a real
 // tavrind, and a client's session carries what rose while it ran in its driver delta message.
 
-#include <fcntl.h>
 #include <gtest/gtest.h>
-#include <spawn.h>
 #include <sys/stat.h>
 
 #include <csignal>
@@ -16,41 +14,17 @@
 
 #include <nlohmann/json.hpp>
 
+#include "tests/support/ChildProcess.h"
 #include "tests/support/StoreFiles.h"
 #include "tests/support/TavrindProcess.h"
 
 namespace tavrin {
 namespace {
 
+using testing::ChildProcess;
 using testing::TavrindProcess;
 using testing::TestClient;
 using testing::WaitUntil;
-
-// A child process with the test's environment, output appended to `log`; killed at the end.
-class Spawned {
- public:
-  Spawned(std::vector<std::string> argv, const std::string& log) {
-    std::vector<char*> args;
-    for (auto& a : argv) args.push_back(a.data());
-    args.push_back(nullptr);
-    posix_spawn_file_actions_t actions;
-    posix_spawn_file_actions_init(&actions);
-    posix_spawn_file_actions_addopen(&actions, 1, log.c_str(), O_WRONLY | O_CREAT | O_APPEND, 0644);
-    posix_spawn_file_actions_adddup2(&actions, 1, 2);
-    if (posix_spawn(&pid_, args[0], &actions, nullptr, args.data(), environ) != 0) pid_ = -1;
-    posix_spawn_file_actions_destroy(&actions);
-  }
-  ~Spawned() {
-    if (pid_ > 0) {
-      ::kill(pid_, SIGKILL);
-      ::waitpid(pid_, nullptr, 0);
-    }
-  }
-  bool started() const { return pid_ > 0; }
-
- private:
-  pid_t pid_ = -1;
-};
 
 // A counter file's value, -1 while it does not exist yet.
 int64_t Counter(const std::string& path) {
@@ -71,14 +45,14 @@ TEST(PwExporterServiceE2eTest, ASessionCarriesTheCyclesThePipeWireGraphRanWhileI
   ::setenv("PIPEWIRE_RUNTIME_DIR", runtime.c_str(), 1);
   ::unsetenv("PIPEWIRE_REMOTE");
   const std::string log = runtime + "/output.log";
-  Spawned daemon({"/usr/bin/pipewire", "-c", PIPEWIRE_NULL_GRAPH_CONF}, log);
+  ChildProcess daemon({"/usr/bin/pipewire", "-c", PIPEWIRE_NULL_GRAPH_CONF}, log);
   ASSERT_TRUE(daemon.started());
   ASSERT_TRUE(WaitUntil([&] { return ::access((runtime + "/pipewire-0").c_str(), F_OK) == 0; }))
       << testing::ReadFile(log);
 
   // The service starts before the exporter has made its group, as after a boot.
   ASSERT_TRUE(service.Start()) << service.Log();
-  Spawned exporter(
+  ChildProcess exporter(
       {TAVRIN_PW_EXPORTER_PATH, "--root", service.root() + "/driverstats", "--interval-ms", "50"},
       log);
   ASSERT_TRUE(exporter.started());

@@ -1,10 +1,7 @@
-#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <spa/param/profiler.h>
 #include <spa/pod/builder.h>
-#include <spawn.h>
 #include <sys/stat.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <array>
@@ -16,6 +13,7 @@
 #include "ProfilerCounters.h"
 #include "ProfilerPod.h"
 #include "platform/linux/driverstats/CountersTreeDriverStats.h"
+#include "tests/support/ChildProcess.h"
 #include "tests/support/TempCountersTree.h"
 #include "tests/support/TestClient.h"
 
@@ -24,6 +22,7 @@ extern char** environ;
 namespace tavrin::pwexport {
 namespace {
 
+using testing::ChildProcess;
 using testing::ReadFile;
 using testing::TempCountersTree;
 using testing::WaitUntil;
@@ -204,41 +203,6 @@ TEST(ProfilerPodTest, TruncatedAndRandomBytesNeverReadOutOfBounds) {
 
 constexpr const char* kPipeWire = "/usr/bin/pipewire";
 
-// A child process with the test's environment, its output appended to `output`.
-class Child {
- public:
-  Child(const std::vector<std::string>& argv, const std::string& output) {
-    std::vector<char*> args;
-    for (const auto& a : argv) args.push_back(const_cast<char*>(a.c_str()));
-    args.push_back(nullptr);
-    posix_spawn_file_actions_t actions;
-    posix_spawn_file_actions_init(&actions);
-    posix_spawn_file_actions_addopen(&actions, 1, output.c_str(), O_WRONLY | O_CREAT | O_APPEND,
-                                     0644);
-    posix_spawn_file_actions_adddup2(&actions, 1, 2);
-    if (posix_spawn(&pid_, args[0], &actions, nullptr, args.data(), environ) != 0) pid_ = -1;
-    posix_spawn_file_actions_destroy(&actions);
-  }
-  ~Child() {
-    if (pid_ > 0) {
-      ::kill(pid_, SIGKILL);
-      ::waitpid(pid_, nullptr, 0);
-    }
-  }
-  bool started() const { return pid_ > 0; }
-  void Signal(int signal) const { ::kill(pid_, signal); }
-  // The exit status, or -1 if the child did not end in time.
-  int Wait() {
-    int status = 0;
-    if (!WaitUntil([&] { return ::waitpid(pid_, &status, WNOHANG) == pid_; })) return -1;
-    pid_ = -1;
-    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
-  }
-
- private:
-  pid_t pid_ = -1;
-};
-
 int64_t Counter(const TempCountersTree& tree, const std::string& rel) {
   return ParseCounterText(ReadFile(tree.path(rel))).value_or(-1);
 }
@@ -254,14 +218,14 @@ TEST(PwExporterDaemonTest, ExportsDriverAndFollowerCountersFromALiveDaemon) {
   ::unsetenv("PIPEWIRE_REMOTE");
   const std::string logFile = runtime + "/output.log";
 
-  Child daemon({kPipeWire, "-c", PIPEWIRE_NULL_GRAPH_CONF}, logFile);
+  ChildProcess daemon({kPipeWire, "-c", PIPEWIRE_NULL_GRAPH_CONF}, logFile);
   ASSERT_TRUE(daemon.started());
   ASSERT_TRUE(WaitUntil([&] { return ::access((runtime + "/pipewire-0").c_str(), F_OK) == 0; }))
       << ReadFile(logFile);
 
   {
-    Child exporter({TAVRIN_PW_EXPORTER_PATH, "--root", tree.root(), "--interval-ms", "50"},
-                   logFile);
+    ChildProcess exporter({TAVRIN_PW_EXPORTER_PATH, "--root", tree.root(), "--interval-ms", "50"},
+                          logFile);
     ASSERT_TRUE(exporter.started());
     ASSERT_TRUE(WaitUntil([&] {
       return Counter(tree, "Speaker/Dummy-Driver/cycles") > 0 &&
@@ -275,7 +239,8 @@ TEST(PwExporterDaemonTest, ExportsDriverAndFollowerCountersFromALiveDaemon) {
   }
 
   // The daemon going away ends the exporter with status 1, for its supervisor to restart it.
-  Child exporter({TAVRIN_PW_EXPORTER_PATH, "--root", tree.root(), "--interval-ms", "50"}, logFile);
+  ChildProcess exporter({TAVRIN_PW_EXPORTER_PATH, "--root", tree.root(), "--interval-ms", "50"},
+                        logFile);
   ASSERT_TRUE(WaitUntil([&] {
     return testing::Occurrences(ReadFile(logFile), "profiling, counters under") == 2;
   })) << ReadFile(logFile);
