@@ -16,8 +16,7 @@ void RuvoReportingKelvaneUtility::handleEvent(const Dictionary& event, uint32_t 
 
   Dictionary payload = MakeDictionary();
   payload["EngineOnDuration"] = *engineOnTime;
-  const Dictionary userInfo = session.userInfo();
-  Value applicationName = ApplicationNameFromUserInfo(&userInfo);
+  Value applicationName = session.applicationName();
   if (applicationName.is_null()) {
     TLOG_ERROR(nullptr, "failed to get app name for kelvane");
   } else {

@@ -11,8 +11,7 @@ namespace tavrin {
 
 void RuvoReportingStratikBridge::handleEvent(const PayloadPtr& event, uint32_t category,
                                              uint16_t type, const RuvoReportingSession& session) {
-  const Dictionary userInfo = session.userInfo();
-  Value applicationName = ApplicationNameFromUserInfo(&userInfo);
+  Value applicationName = session.applicationName();
   std::string name =
       fmt::format("com.quorvex.tavrin.{}.{}", CategoryName(category), TypeName(type));
   // The event and the name never change, so the builder may run on any thread, later.

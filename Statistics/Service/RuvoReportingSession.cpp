@@ -861,6 +861,11 @@ Dictionary RuvoReportingSession::userInfo() const {
   return userInfo_;
 }
 
+Value RuvoReportingSession::applicationName() const {
+  std::lock_guard lock(propertyMutex_);
+  return ApplicationNameFromUserInfo(&userInfo_);
+}
+
 void RuvoReportingSession::setUserInfo(Dictionary userInfo) {
   if (userInfo.is_null()) userInfo = MakeDictionary();
   std::shared_ptr<SessionSpool> running;

@@ -159,6 +159,9 @@ class RuvoReportingSession : public std::enable_shared_from_this<RuvoReportingSe
   bool started() const { return started_.load(std::memory_order_acquire); }
   // A copy of the user info as it is now.
   Dictionary userInfo() const;
+  // The user info's application name as ApplicationNameFromUserInfo reads it, without copying
+  // the user info: read for every message.
+  Value applicationName() const;
   void setUserInfo(Dictionary userInfo);
   Dictionary messageTypeCounts() const;
   std::optional<std::string> serviceName() const;
